@@ -1,0 +1,154 @@
+#include "daemon/daemon.h"
+
+#include "assembly/fbf_strings.h"
+#include "daemon/listener_socket.h"
+#include "platform/change_watcher.h"
+#include "platform/logging.h"
+#include "platform/device_info.h"
+#include "upload/device_context.h"
+#include "util/build_info.h"
+#include "util/signpost.h"
+
+#include <asio.hpp>
+
+#include <cstring>
+#include <iostream>
+
+namespace fbf {
+namespace {
+
+spdlog::logger& mainLog() { return logging::get("main"); }
+spdlog::logger& assemblyLog() { return logging::get("FBFAssembly"); }
+
+// Preference domains whose changes invalidate the app whitelist.
+constexpr const char* kSearchUIDomain = "vireon.scoutlume";
+constexpr const char* kAssistantDomain = "vireon.assistant";
+// "Ask for a whitelist update soon".
+constexpr uint64_t kUpdateSoon = 1;
+
+class LinuxDaemon final : public Daemon {
+ public:
+  explicit LinuxDaemon(DaemonOptions options) : options_(std::move(options)) {}
+
+  void setup() {
+    auto& dirs = options_.dirs;
+    auto clock = options_.clock ? options_.clock : std::make_shared<SystemClock>();
+    std::shared_ptr<FileManager> fm = makePosixFileManager(dirs);
+    std::shared_ptr<PreferencesStore> prefs = makePlistPreferencesStore(dirs.preferencesDir(), *fm);
+    auto vireondDefaults = prefs->defaultsForDomain(std::string(FBFStrings::VireondReverseDomainIdentifier));
+    auto deviceInfo = std::shared_ptr<DeviceInfo>(makeLinuxDeviceInfo());
+    installBuildInfoSource({
+        [vireondDefaults] { return vireondDefaults->boolForKey(FBFStrings::LinuxDefaults::InternalBuild); },
+        [deviceInfo] { return deviceInfo->value("BuildVersion").value_or(""); },
+    });
+
+    transactions_ = std::make_shared<TransactionRegistry>([this] {
+      // Leave the main loop; whatever thread closed the last transaction.
+      asio::post(io_, [this] { io_.stop(); });
+    });
+
+    // 1. The listener, so clients can connect as soon as the service exists.
+    acceptor_ = openListenerSocket(io_, dirs.socketPath());
+
+    // 2. The composition root.
+    FBFAssemblyDependencies deps;
+    deps.preferences = prefs;
+    deps.fileManager = fm;
+    deps.clock = clock;
+    deps.analytics = makeJsonLinesAnalyticsSink(dirs.analyticsFile(), *fm, *clock);
+    deps.transactions = transactions_;
+    deps.deviceContext = std::make_shared<DeviceContext>(*deviceInfo, kDaemonNameAndVersion);
+    assembly_ = std::make_unique<FBFAssembly>(std::move(deps));
+
+    // 3. Serve clients.
+    if (acceptor_) accept();
+
+    // 5./6. Application and preference changes invalidate the whitelist.
+    std::vector<WatchSpec> specs;
+    specs.push_back({"applications", dirs.dataHome / "applications", ""});
+    for (const auto& d : dirs.dataDirs) specs.push_back({"applications", d / "applications", ""});
+    specs.push_back({"preferences", dirs.preferencesDir(), std::string(kSearchUIDomain) + ".plist"});
+    specs.push_back({"preferences", dirs.preferencesDir(), std::string(kAssistantDomain) + ".plist"});
+    watcher_ = makeInotifyWatcher(io_, std::move(specs), [this](const std::string& tag) {
+      if (auto* controller = assembly_->installedAppController()) {
+        mainLog().debug("{} changed; whitelist update requested", tag);
+        controller->updateWhitelists(kUpdateSoon, nullptr);
+      }
+    });
+
+    // 7./8. Termination signals only set flags and ask for a clean exit.
+    signals_.add(SIGINT);
+    signals_.add(SIGTERM);
+    waitForSignal();
+  }
+
+  int run() override {
+    io_.run();
+    return 0;
+  }
+
+  FBFAssembly& assembly() override { return *assembly_; }
+
+ private:
+  void waitForSignal() {
+    signals_.async_wait([this](const std::error_code& ec, int signo) {
+      if (ec) return;
+      mainLog().debug(signo == SIGINT ? "fbf got SIGINT" : "fbf got SIGTERM");
+      assembly_->setCancelled(true);
+      transactions_->requestCleanExit();
+      waitForSignal();
+    });
+  }
+
+  void accept() {
+    acceptor_->async_accept([this](const std::error_code& ec, asio::local::stream_protocol::socket socket) {
+      if (ec == asio::error::operation_aborted) return;
+      if (!ec) onConnection(std::move(socket));
+      accept();
+    });
+  }
+
+  void onConnection(asio::local::stream_protocol::socket socket) {
+    // No service answers yet: refuse politely by closing.
+    std::error_code ec;
+    socket.close(ec);
+  }
+
+  DaemonOptions options_;
+  asio::io_context io_;
+  asio::signal_set signals_{io_};
+  std::shared_ptr<TransactionRegistry> transactions_;
+  std::optional<UnixAcceptor> acceptor_;
+  std::unique_ptr<FBFAssembly> assembly_;
+  std::unique_ptr<ChangeWatcher> watcher_;
+};
+
+}  // namespace
+
+std::unique_ptr<Daemon> Daemon::setup(DaemonOptions options) {
+  auto d = std::make_unique<LinuxDaemon>(std::move(options));
+  d->setup();
+  return d;
+}
+
+int daemonMain(int argc, char** argv) {
+  for (int i = 1; i < argc; ++i) {
+    if (std::strcmp(argv[i], "--version") == 0) {
+      std::cout << kDaemonNameAndVersion << "\n";
+      return 0;
+    }
+    if (std::strcmp(argv[i], "--help") == 0) {
+      std::cout << "usage: vireon-fbf\n\nThe background feedback flusher. Takes no arguments; see README.md.\n";
+      return 0;
+    }
+  }
+  logging::init();
+  vireon_signpost_launchBegin();
+  assemblyLog().info("main");
+  auto daemon = Daemon::setup(DaemonOptions{});
+  assemblyLog().info("setup");
+  vireon_signpost_launchEnd();
+  return daemon->run();
+}
+
+}  // namespace fbf

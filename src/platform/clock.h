@@ -1,0 +1,34 @@
+// Wall-clock time for the whole daemon.
+//
+// Every "now" in the program comes from a Clock handed in by the composition
+// root, so that tests can age files by moving a clock instead of sleeping.
+// Thread-safety: implementations must be safe to call from any thread.
+#pragma once
+
+#include <chrono>
+
+namespace fbf {
+
+using SystemTime = std::chrono::system_clock::time_point;
+
+// Seconds since 1970 as a double, the unit dates are stored and compared in.
+inline double secondsSinceEpoch(SystemTime t) {
+  return std::chrono::duration<double>(t.time_since_epoch()).count();
+}
+inline SystemTime timeFromSeconds(double s) {
+  return SystemTime(std::chrono::duration_cast<SystemTime::duration>(std::chrono::duration<double>(s)));
+}
+
+class Clock {
+ public:
+  virtual ~Clock() = default;
+  virtual SystemTime now() const = 0;
+};
+
+// The real wall clock.
+class SystemClock final : public Clock {
+ public:
+  SystemTime now() const override { return std::chrono::system_clock::now(); }
+};
+
+}  // namespace fbf

@@ -1,0 +1,164 @@
+#include "platform/property_list.h"
+
+#include <plist/plist.h>
+
+#include <cstdlib>
+#include <memory>
+
+namespace fbf {
+namespace {
+
+// Dates in property lists count from 2001-01-01.
+constexpr double kReferenceDateOffset = 978307200.0;
+
+struct PlistFree {
+  void operator()(plist_t p) const { plist_free(p); }
+};
+using PlistPtr = std::unique_ptr<void, PlistFree>;
+
+PropertyList toJson(plist_t node, int depth) {
+  if (depth > 64) throw std::runtime_error("property list nested too deeply");
+  switch (plist_get_node_type(node)) {
+    case PLIST_BOOLEAN: {
+      uint8_t b = 0;
+      plist_get_bool_val(node, &b);
+      return b != 0;
+    }
+    case PLIST_UINT: {
+      uint64_t v = 0;
+      plist_get_uint_val(node, &v);
+      // The library stores every integer in 64 unsigned bits; negative
+      // values come back in two's complement.
+      return static_cast<int64_t>(v);
+    }
+    case PLIST_REAL: {
+      double d = 0;
+      plist_get_real_val(node, &d);
+      return d;
+    }
+    case PLIST_STRING:
+    case PLIST_KEY: {
+      char* s = nullptr;
+      if (plist_get_node_type(node) == PLIST_STRING)
+        plist_get_string_val(node, &s);
+      else
+        plist_get_key_val(node, &s);
+      std::string out = s ? s : "";
+      std::free(s);
+      return out;
+    }
+    case PLIST_DATA: {
+      char* d = nullptr;
+      uint64_t len = 0;
+      plist_get_data_val(node, &d, &len);
+      std::vector<uint8_t> bytes(d, d + len);
+      std::free(d);
+      return PropertyList::binary(std::move(bytes));
+    }
+    case PLIST_DATE: {
+      int32_t sec = 0, usec = 0;
+      plist_get_date_val(node, &sec, &usec);
+      return kReferenceDateOffset + sec + usec / 1e6;
+    }
+    case PLIST_UID: {
+      uint64_t v = 0;
+      plist_get_uid_val(node, &v);
+      return v;
+    }
+    case PLIST_ARRAY: {
+      auto arr = PropertyList::array();
+      uint32_t n = plist_array_get_size(node);
+      for (uint32_t i = 0; i < n; ++i) arr.push_back(toJson(plist_array_get_item(node, i), depth + 1));
+      return arr;
+    }
+    case PLIST_DICT: {
+      auto obj = PropertyList::object();
+      plist_dict_iter it = nullptr;
+      plist_dict_new_iter(node, &it);
+      while (true) {
+        char* key = nullptr;
+        plist_t val = nullptr;
+        plist_dict_next_item(node, it, &key, &val);
+        if (!val) {
+          std::free(key);
+          break;
+        }
+        obj[key ? key : ""] = toJson(val, depth + 1);
+        std::free(key);
+      }
+      std::free(it);
+      return obj;
+    }
+    default:
+      return nullptr;
+  }
+}
+
+plist_t fromJson(const PropertyList& v) {
+  switch (v.type()) {
+    case PropertyList::value_t::boolean:
+      return plist_new_bool(v.get<bool>() ? 1 : 0);
+    case PropertyList::value_t::number_integer:
+      return plist_new_uint(static_cast<uint64_t>(v.get<int64_t>()));
+    case PropertyList::value_t::number_unsigned:
+      return plist_new_uint(v.get<uint64_t>());
+    case PropertyList::value_t::number_float:
+      return plist_new_real(v.get<double>());
+    case PropertyList::value_t::string:
+      return plist_new_string(v.get_ref<const std::string&>().c_str());
+    case PropertyList::value_t::binary: {
+      const auto& b = v.get_binary();
+      return plist_new_data(reinterpret_cast<const char*>(b.data()), b.size());
+    }
+    case PropertyList::value_t::array: {
+      plist_t arr = plist_new_array();
+      for (const auto& item : v) plist_array_append_item(arr, fromJson(item));
+      return arr;
+    }
+    case PropertyList::value_t::object: {
+      plist_t dict = plist_new_dict();
+      for (auto it = v.begin(); it != v.end(); ++it) plist_dict_set_item(dict, it.key().c_str(), fromJson(*it));
+      return dict;
+    }
+    default:
+      return plist_new_string("");
+  }
+}
+
+}  // namespace
+
+std::optional<PropertyList> parsePropertyList(std::string_view bytes, std::string* error) {
+  if (bytes.empty() || bytes.size() > UINT32_MAX) {
+    if (error) *error = bytes.empty() ? "empty file" : "file too large";
+    return std::nullopt;
+  }
+  plist_t root = nullptr;
+  plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &root);
+  if (!root) {
+    if (error) *error = "not a property list";
+    return std::nullopt;
+  }
+  PlistPtr guard(root);
+  try {
+    return toJson(root, 0);
+  } catch (const std::exception& e) {
+    if (error) *error = e.what();
+    return std::nullopt;
+  }
+}
+
+std::string serializePropertyList(const PropertyList& value, PropertyListFormat format) {
+  PlistPtr root(fromJson(value));
+  char* out = nullptr;
+  uint32_t len = 0;
+  if (format == PropertyListFormat::xml) {
+    plist_to_xml(root.get(), &out, &len);
+  } else {
+    plist_to_bin(root.get(), &out, &len);
+  }
+  std::string s(out ? out : "", len);
+  if (format == PropertyListFormat::xml) plist_to_xml_free(out); else plist_to_bin_free(out);
+  return s;
+}
+
+}  // namespace fbf
