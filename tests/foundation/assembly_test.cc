@@ -1,0 +1,110 @@
+#include "assembly/fbf_assembly.h"
+#include "support/test_support.h"
+
+#include <gtest/gtest.h>
+
+namespace fbf {
+namespace {
+
+using testing::TestEnvironment;
+
+class RecordingSession final : public HttpClientSession {
+ public:
+  explicit RecordingSession(HttpSessionConfiguration c) : config(std::move(c)) {}
+  void uploadFile(HttpRequest, std::filesystem::path, HttpCompletion) override {}
+  void finishTasksAndInvalidate() override { config.onInvalidated(); }
+  HttpSessionConfiguration config;
+};
+
+TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
+  TestEnvironment env;
+  auto& a = env.assembly();
+  auto check = [&] {
+    bool result = false;
+    env.manualQueue->sync([&] { result = a.shouldProceed(); });
+    return result;
+  };
+  EXPECT_TRUE(check());
+  a.setCancelled(true);
+  EXPECT_FALSE(check());
+
+  class Listener final : public ClientConduit {
+    void willUploadData(const std::string&, const std::string&) override {}
+    void willGenerateCohortFeebacks(const std::string&) override {}
+  };
+  a.setCohortsListener(std::make_shared<Listener>());
+  EXPECT_TRUE(check());
+  a.setCohortsListener(nullptr);
+  a.setUploadListener(std::make_shared<Listener>());
+  EXPECT_TRUE(check());
+}
+
+TEST(AssemblyFlags, DefaultsReadFalseAndZero) {
+  TestEnvironment env;
+  auto& a = env.assembly();
+  EXPECT_FALSE(a.keepAliveAfterFlushing());
+  EXPECT_FALSE(a.isDiagnosticsAndUsageEnabled());
+  EXPECT_FALSE(a.isFlushingEagerly());
+  EXPECT_FALSE(a.allowCellularUploads());
+  EXPECT_EQ(a.userDefaults().integerForKey("FlushFrequencyInSeconds"), 0);
+  env.preferences->defaultsForDomain("vireon.privacy")->setObject("DiagnosticsAndUsageEnabled", true);
+  EXPECT_TRUE(a.isDiagnosticsAndUsageEnabled());
+}
+
+TEST(UploadSessionTransactions, TwoMadeOneInvalidatedLeavesOneOpen) {
+  TestEnvironment env;
+  std::vector<std::shared_ptr<RecordingSession>> made;
+  env.httpSessionFactory = [&](HttpSessionConfiguration c) {
+    made.push_back(std::make_shared<RecordingSession>(std::move(c)));
+    return made.back();
+  };
+  env.defaults().setObject("VIRUploadPinnedPublicKeys", "sha256//abc");
+  auto& a = env.assembly();
+  auto s1 = a.makeUploadSession();
+  auto s2 = a.makeUploadSession();
+  env.manualQueue->drain();
+  EXPECT_EQ(a.openTransactionCount(), 2u);
+  EXPECT_EQ(env.transactions->openCount(), 2);
+  EXPECT_EQ(made[0]->config.maxConnectionsPerHost, 1);
+  EXPECT_EQ(made[0]->config.pinnedPublicKeys, "sha256//abc");
+
+  s1->finishTasksAndInvalidate();
+  env.manualQueue->drain();
+  EXPECT_EQ(a.openTransactionCount(), 1u);
+  EXPECT_EQ(env.transactions->openCount(), 1);
+}
+
+TEST(CleanExit, WaitsForTheLastOpenTransaction) {
+  int exits = 0;
+  TransactionRegistry registry([&] { ++exits; });
+  auto t1 = registry.begin("one");
+  auto t2 = registry.begin("two");
+  registry.requestCleanExit();
+  EXPECT_EQ(exits, 0);
+  t1.reset();
+  EXPECT_EQ(exits, 0);
+  t2.reset();
+  EXPECT_EQ(exits, 1);
+  // Once only.
+  registry.begin("late").reset();
+  EXPECT_EQ(exits, 1);
+}
+
+TEST(CleanExit, ExitsAtOnceWhenNothingIsOpen) {
+  int exits = 0;
+  TransactionRegistry registry([&] { ++exits; });
+  registry.requestCleanExit();
+  EXPECT_EQ(exits, 1);
+}
+
+TEST(DeletionEvents, AssemblySendsTheFeedbackLossEvent) {
+  TestEnvironment env;
+  env.assembly().didDeleteFeedbackFile(FeedbackDeletionEvent{12, 1, 3, 40});
+  auto events = env.analytics->events();
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(events[0].first, "vireond.feedbackLoss");
+  EXPECT_EQ(events[0].second, (nlohmann::json{{"feedbackType", 12}, {"reason", 1}, {"size", 3}, {"age", 40}}));
+}
+
+}  // namespace
+}  // namespace fbf

@@ -1,0 +1,102 @@
+#include "util/atomic.h"
+#include "util/lock.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <thread>
+
+namespace fbf {
+namespace {
+
+TEST(ConditionLockTimeouts, ZeroTimeoutWithOtherValueFailsAtOnceAndReleasesTheLock) {
+  ConditionLock<int> cl(1);
+  EXPECT_FALSE(cl.lockWhenValue(2, 0.0));
+  // The lock was released: another thread can take it.
+  std::atomic<bool> took{false};
+  std::thread t([&] {
+    cl.lock();
+    took = true;
+    cl.unlock();
+  });
+  t.join();
+  EXPECT_TRUE(took);
+}
+
+TEST(ConditionLockTimeouts, MatchingValueReturnsAtOnceHoldingTheLock) {
+  ConditionLock<int> cl(7);
+  ASSERT_TRUE(cl.lockWhenValue(7, 5.0));
+  std::atomic<bool> took{false};
+  std::thread t([&] {
+    cl.lock();
+    took = true;
+    cl.unlock();
+  });
+  std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  EXPECT_FALSE(took) << "the lock must still be held by the waiter";
+  cl.unlock();
+  t.join();
+  EXPECT_TRUE(took);
+}
+
+TEST(ConditionLockTimeouts, WaiterWakesWhenAnotherThreadSetsTheValue) {
+  ConditionLock<int> cl(0);
+  std::thread setter([&] {
+    cl.lock();
+    cl.unlockWithValue(3);
+  });
+  ASSERT_TRUE(cl.lockWhenValue(3, 10.0));
+  EXPECT_EQ(cl.value(), 3);
+  cl.unlock();
+  setter.join();
+}
+
+TEST(ConditionLockDeathTest, NegativeTimeoutStopsTheProcess) {
+  ConditionLock<int> cl(0);
+  EXPECT_DEATH(cl.lockWhenValue(1, -1.0), "Fatal error");
+}
+
+TEST(AtomicValueCompareAndSwap, MakerRunsOnlyOnMatch) {
+  AtomicValue<int> v(5);
+  int calls = 0;
+  EXPECT_FALSE(v.compareAndSwap(4, [&] {
+    ++calls;
+    return 9;
+  }));
+  EXPECT_EQ(calls, 0);
+  EXPECT_EQ(v.load(), 5);
+  EXPECT_TRUE(v.compareAndSwap(5, [&] {
+    ++calls;
+    return 9;
+  }));
+  EXPECT_EQ(calls, 1);
+  EXPECT_EQ(v.load(), 9);
+}
+
+TEST(AtomicCells, ExchangeAddSubAndCompareAndExchange) {
+  Atomic<int64_t> a(10);
+  EXPECT_EQ(a.exchange(20), 10);
+  EXPECT_EQ(a.add(5), 25);
+  EXPECT_EQ(a.sub(7), 18);
+  EXPECT_FALSE(a.compareAndExchange(17, 1));
+  EXPECT_EQ(a.load(), 18);
+  EXPECT_TRUE(a.compareAndExchange(18, 1));
+  EXPECT_EQ(a.load(), 1);
+
+  Atomic<bool> flag(false);
+  std::vector<std::thread> ts;
+  std::atomic<int> winners{0};
+  for (int i = 0; i < 8; ++i) ts.emplace_back([&] { winners += flag.compareAndExchange(false, true) ? 1 : 0; });
+  for (auto& t : ts) t.join();
+  EXPECT_EQ(winners, 1);
+}
+
+TEST(LockBodies, WithLockUnlocksWhenTheBodyThrows) {
+  Lock lock;
+  EXPECT_THROW(lock.withLock([]() -> int { throw std::runtime_error("x"); }), std::runtime_error);
+  // Would deadlock (and time out the test) if the throw had left it locked.
+  EXPECT_EQ(lock.withLock([] { return 3; }), 3);
+}
+
+}  // namespace
+}  // namespace fbf

@@ -1,0 +1,125 @@
+#include "assembly/configuration_bag.h"
+#include "platform/property_list.h"
+#include "platform/user_defaults.h"
+#include "support/test_support.h"
+
+#include <gtest/gtest.h>
+
+namespace fbf {
+namespace {
+
+using testing::LogCapture;
+using testing::TestEnvironment;
+using testing::writeFile;
+
+class PreferencesFiles : public ::testing::Test {
+ protected:
+  TestEnvironment env;
+  std::shared_ptr<UserDefaults> domain(const std::string& name) { return env.preferences->defaultsForDomain(name); }
+  fs::path file(const std::string& name) { return env.preferences->fileForDomain(name); }
+};
+
+TEST_F(PreferencesFiles, MissingFileReadsAsDefaults) {
+  auto d = domain("vireond");
+  EXPECT_FALSE(d->boolForKey("VIRFeedbackFlushDisabled"));
+  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 0);
+  EXPECT_FALSE(d->stringForKey("VIRDebugParameters"));
+}
+
+TEST_F(PreferencesFiles, XmlAndBinaryFilesAreReadOnEveryUse) {
+  PropertyList values = {{"FBFNoExit", true}, {"FlushFrequencyInSeconds", 3600}, {"VIRDebugParameters", "v=3"}};
+  writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::xml));
+  auto d = domain("vireond");
+  EXPECT_TRUE(d->boolForKey("FBFNoExit"));
+  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 3600);
+  EXPECT_EQ(d->stringForKey("VIRDebugParameters"), "v=3");
+
+  // Replaced behind the object's back: the next read sees it.
+  values["FBFNoExit"] = false;
+  writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::binary));
+  EXPECT_FALSE(d->boolForKey("FBFNoExit"));
+  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 3600);
+}
+
+TEST_F(PreferencesFiles, NegativeIntegersSurviveTheRoundTrip) {
+  auto d = domain("vireond");
+  ASSERT_TRUE(d->setObject("FlushFrequencyInSeconds", -5));
+  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), -5);
+}
+
+TEST_F(PreferencesFiles, WrongValueTypesReadAsDefaults) {
+  PropertyList values = {{"FBFNoExit", PropertyList::array({1})},
+                         {"FlushFrequencyInSeconds", "soon"},
+                         {"VIRDebugParameters", 12}};
+  writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::xml));
+  auto d = domain("vireond");
+  EXPECT_FALSE(d->boolForKey("FBFNoExit"));
+  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 0);
+  EXPECT_FALSE(d->stringForKey("VIRDebugParameters"));
+}
+
+TEST_F(PreferencesFiles, MalformedFileMeansNoValuesAndOneErrorLine) {
+  writeFile(file("vireond"), "<?xml version=\"1.0\"?><plist><dict><key>FBFNoExit</key><true/>");
+  LogCapture logs;
+  auto d = domain("vireond");
+  EXPECT_FALSE(d->boolForKey("FBFNoExit"));
+  EXPECT_EQ(logs.count("Ignoring malformed preferences file"), 1u);
+}
+
+TEST_F(PreferencesFiles, WritesAreOwnerOnlyAndKeepOtherKeys) {
+  auto d = domain("vireon.scoutlume");
+  ASSERT_TRUE(d->setObject("DisabledApplications", PropertyList::array({"a", "b"})));
+  ASSERT_TRUE(d->setObject("Other", true));
+  ASSERT_TRUE(d->removeObject("Other"));
+  EXPECT_EQ(d->stringArrayForKey("DisabledApplications"), (std::vector<std::string>{"a", "b"}));
+  EXPECT_FALSE(d->objectForKey("Other"));
+  auto attrs = env.fileManager->attributes(file("vireon.scoutlume"));
+  ASSERT_TRUE(attrs);
+  EXPECT_EQ(attrs->mode, 0600u);
+}
+
+class BagFiles : public PreferencesFiles {};
+
+TEST_F(BagFiles, TypedAccessorsAndMissingKeys) {
+  env.writeBag({{"feedback_url", "https://127.0.0.1:1/fb"},
+                {"feedback_max_age_in_days", 3},
+                {"max_custom_feedback_sizes", {{"UserReport", 100}, {"Crowdsourcing", "big"}, {"Usage", -1}}},
+                {"vireon_feedback_format", "FeedbackV2PB"}});
+  auto bag = env.assembly().cachedBag();
+  ASSERT_TRUE(bag);
+  EXPECT_EQ(bag->feedbackURL(), "https://127.0.0.1:1/fb");
+  EXPECT_EQ(bag->feedbackMaxAgeInDays(), 3);
+  EXPECT_EQ(bag->maxCustomFeedbackSizes(), (std::map<std::string, uint64_t>{{"UserReport", 100}}));
+  EXPECT_EQ(bag->vireonFeedbackFormat(), "FeedbackV2PB");
+  EXPECT_FALSE(bag->crowdsourcingURL());
+  EXPECT_FALSE(bag->cohortsLookbackInDays());
+}
+
+TEST_F(BagFiles, BinaryBagIsReadAnewOnEveryAccess) {
+  writeFile(env.cacheDir() / "bag.plist",
+            serializePropertyList({{"feedback_max_age_in_days", 2}}, PropertyListFormat::binary));
+  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 2);
+  env.writeBag({{"feedback_max_age_in_days", 9}});
+  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 9);
+}
+
+TEST_F(BagFiles, MissingMalformedOrNonDictionaryBagIsNoBag) {
+  EXPECT_FALSE(env.assembly().cachedBag());
+  LogCapture logs;
+  writeFile(env.cacheDir() / "bag.plist", "garbage\x01\x02");
+  EXPECT_FALSE(env.assembly().cachedBag());
+  EXPECT_TRUE(logs.contains("Ignoring malformed configuration bag"));
+  writeFile(env.cacheDir() / "bag.plist", serializePropertyList(PropertyList::array({1, 2}), PropertyListFormat::xml));
+  EXPECT_FALSE(env.assembly().cachedBag());
+  EXPECT_TRUE(logs.contains("top level is not a dictionary"));
+}
+
+TEST_F(BagFiles, SymlinkedBagIsNotFollowed) {
+  auto secret = env.temp.path() / "secret.plist";
+  writeFile(secret, serializePropertyList({{"feedback_url", "https://evil"}}, PropertyListFormat::xml));
+  fs::create_symlink(secret, env.cacheDir() / "bag.plist");
+  EXPECT_FALSE(env.assembly().cachedBag());
+}
+
+}  // namespace
+}  // namespace fbf
