@@ -87,7 +87,7 @@ void FBFAssembly::uploadSessionDidBecomeInvalid() {
 }
 
 void FBFAssembly::didDeleteFeedbackFile(const FeedbackDeletionEvent& event) {
-  deps_.analytics->sendEvent(FBFStrings::FeedbackLossEventName, [&]() -> std::optional<nlohmann::json> {
+  deps_.analytics->sendEvent(FBFStrings::FeedbackLossEventName, [event]() -> std::optional<nlohmann::json> {
     auto payload = nlohmann::json::parse(event.toJSON().dump(), nullptr, false);
     if (payload.is_discarded() || !payload.is_object()) return std::nullopt;
     return payload;
