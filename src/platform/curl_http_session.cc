@@ -1,0 +1,359 @@
+#include "platform/curl_http_session.h"
+
+#include "platform/file_manager.h"
+#include "platform/logging.h"
+
+#include <curl/curl.h>
+#include <fcntl.h>
+#include <strings.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <map>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+namespace fbf {
+
+HttpError httpErrorFromCurl(int curlCode, long osErrno, const std::string& detail) {
+  HttpError e;
+  auto code = static_cast<CURLcode>(curlCode);
+  switch (code) {
+    case CURLE_COULDNT_RESOLVE_HOST:
+      e = {HttpErrorDomain::url, HttpErrorCode::cannotFindHost, {}};
+      break;
+    case CURLE_COULDNT_RESOLVE_PROXY:
+      e = {HttpErrorDomain::url, HttpErrorCode::dnsLookupFailed, {}};
+      break;
+    case CURLE_COULDNT_CONNECT:
+      e = {HttpErrorDomain::url,
+           osErrno == ENETUNREACH ? HttpErrorCode::notConnectedToInternet : HttpErrorCode::cannotConnectToHost,
+           {}};
+      break;
+    case CURLE_OPERATION_TIMEDOUT:
+      e = {HttpErrorDomain::url, HttpErrorCode::timedOut, {}};
+      break;
+    case CURLE_SSL_CONNECT_ERROR:
+    case CURLE_PEER_FAILED_VERIFICATION:
+    case CURLE_SSL_PINNEDPUBKEYNOTMATCH:
+    case CURLE_SSL_CACERT_BADFILE:
+    case CURLE_SSL_CERTPROBLEM:
+    case CURLE_SSL_CIPHER:
+    case CURLE_SSL_ISSUER_ERROR:
+    case CURLE_SSL_CRL_BADFILE:
+    case CURLE_SSL_INVALIDCERTSTATUS:
+      e = {HttpErrorDomain::url, HttpErrorCode::secureConnectionFailed, {}};
+      break;
+    case CURLE_READ_ERROR:
+    case CURLE_ABORTED_BY_CALLBACK:
+      e = {HttpErrorDomain::url, HttpErrorCode::fileUnreadable, {}};
+      break;
+    case CURLE_SEND_ERROR:
+    case CURLE_RECV_ERROR:
+    case CURLE_GOT_NOTHING:
+    case CURLE_PARTIAL_FILE:
+    case CURLE_SEND_FAIL_REWIND:
+      // The connection was lost mid-exchange.
+      e = {HttpErrorDomain::network, HttpErrorCode::other, {}};
+      break;
+    case CURLE_URL_MALFORMAT:
+    case CURLE_UNSUPPORTED_PROTOCOL:
+      e = {HttpErrorDomain::url, HttpErrorCode::other, {}};
+      break;
+    default:
+      e = {HttpErrorDomain::other, HttpErrorCode::other, {}};
+      break;
+  }
+  e.description = curl_easy_strerror(code);
+  if (!detail.empty()) e.description += ": " + detail;
+  return e;
+}
+
+namespace {
+
+spdlog::logger& log() { return logging::get("HttpSession"); }
+
+void globalInitOnce() {
+  static std::once_flag once;
+  std::call_once(once, [] { curl_global_init(CURL_GLOBAL_DEFAULT); });
+}
+
+struct Transfer {
+  CURL* easy = nullptr;
+  curl_slist* headers = nullptr;
+  HttpRequest request;
+  FileDescriptor body;
+  HttpCompletion completion;
+  HttpResponse response;
+  bool readFailed = false;
+  char errorBuffer[CURL_ERROR_SIZE] = {};
+
+  ~Transfer() {
+    if (easy) curl_easy_cleanup(easy);
+    if (headers) curl_slist_free_all(headers);
+  }
+};
+
+size_t readBody(char* buffer, size_t size, size_t nitems, void* userdata) {
+  auto* t = static_cast<Transfer*>(userdata);
+  while (true) {
+    ssize_t n = ::read(t->body.get(), buffer, size * nitems);
+    if (n >= 0) return static_cast<size_t>(n);
+    if (errno == EINTR) continue;
+    t->readFailed = true;
+    return CURL_READFUNC_ABORT;
+  }
+}
+
+int seekBody(void* userdata, curl_off_t offset, int origin) {
+  auto* t = static_cast<Transfer*>(userdata);
+  return ::lseek(t->body.get(), static_cast<off_t>(offset), origin) < 0 ? CURL_SEEKFUNC_FAIL : CURL_SEEKFUNC_OK;
+}
+
+size_t discardBody(char*, size_t size, size_t nmemb, void*) { return size * nmemb; }
+
+size_t collectHeader(char* buffer, size_t size, size_t nitems, void* userdata) {
+  auto* t = static_cast<Transfer*>(userdata);
+  std::string_view line(buffer, size * nitems);
+  while (!line.empty() && (line.back() == '\n' || line.back() == '\r')) line.remove_suffix(1);
+  if (line.starts_with("HTTP/")) {
+    t->response.headers.clear();  // an interim (1xx) response ends here
+  } else if (auto colon = line.find(':'); colon != std::string_view::npos) {
+    auto value = line.substr(colon + 1);
+    while (!value.empty() && value.front() == ' ') value.remove_prefix(1);
+    t->response.headers.emplace_back(std::string(line.substr(0, colon)), std::string(value));
+  }
+  return size * nitems;
+}
+
+// Opens the body without following links; only our own regular files.
+FileDescriptor openBody(const std::filesystem::path& path, int64_t& size, std::string& why) {
+  FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd.valid()) {
+    why = std::string("cannot open the upload file: ") + strerror(errno);
+    return {};
+  }
+  struct stat st {};
+  if (fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
+    why = "the upload file is not a regular file owned by this user";
+    return {};
+  }
+  size = st.st_size;
+  return fd;
+}
+
+class CurlHttpSession final : public HttpClientSession, public std::enable_shared_from_this<CurlHttpSession> {
+ public:
+  explicit CurlHttpSession(HttpSessionConfiguration config) : config_(std::move(config)) {
+    if (!config_.delegateQueue) throw std::invalid_argument("an HTTP session needs a delegate queue");
+    globalInitOnce();
+    multi_ = curl_multi_init();
+    curl_multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, static_cast<long>(std::max(1, config_.maxConnectionsPerHost)));
+    thread_ = std::thread([this] { run(); });
+  }
+
+  ~CurlHttpSession() override {
+    {
+      std::lock_guard lock(mutex_);
+      stop_ = true;
+    }
+    curl_multi_wakeup(multi_);
+    if (thread_.joinable()) {
+      if (thread_.get_id() == std::this_thread::get_id()) {
+        thread_.detach();
+      } else {
+        thread_.join();
+      }
+    }
+    for (auto& [easy, t] : active_) curl_multi_remove_handle(multi_, easy);
+    active_.clear();
+    curl_multi_cleanup(multi_);
+  }
+
+  void uploadFile(HttpRequest request, std::filesystem::path body, HttpCompletion completion) override {
+    {
+      std::lock_guard lock(mutex_);
+      if (invalidating_) {
+        fail(std::move(completion), {HttpErrorDomain::url, HttpErrorCode::cancelled, "the session is invalidated"});
+        return;
+      }
+    }
+    auto t = std::make_unique<Transfer>();
+    int64_t size = 0;
+    std::string why;
+    t->body = openBody(body, size, why);
+    if (!t->body.valid()) {
+      fail(std::move(completion), {HttpErrorDomain::url, HttpErrorCode::fileUnreadable, why});
+      return;
+    }
+    t->request = std::move(request);
+    t->completion = std::move(completion);
+    if (!configure(*t, size)) {
+      fail(std::move(t->completion), {HttpErrorDomain::other, HttpErrorCode::other, "cannot set up the transfer"});
+      return;
+    }
+    {
+      std::lock_guard lock(mutex_);
+      incoming_.push_back(std::move(t));
+    }
+    curl_multi_wakeup(multi_);
+  }
+
+  void finishTasksAndInvalidate() override {
+    {
+      std::lock_guard lock(mutex_);
+      if (invalidating_) return;
+      invalidating_ = true;
+      keepAlive_ = shared_from_this();
+    }
+    curl_multi_wakeup(multi_);
+  }
+
+ private:
+  void fail(HttpCompletion completion, HttpError error) {
+    config_.delegateQueue->async([completion = std::move(completion), error = std::move(error)] {
+      if (completion) completion(std::nullopt, error);
+    });
+  }
+
+  bool configure(Transfer& t, int64_t size) {
+    t.easy = curl_easy_init();
+    if (!t.easy) return false;
+    CURL* e = t.easy;
+    curl_easy_setopt(e, CURLOPT_URL, t.request.url.c_str());
+    curl_easy_setopt(e, CURLOPT_PROTOCOLS_STR, "http,https");
+    curl_easy_setopt(e, CURLOPT_NOSIGNAL, 1L);
+    curl_easy_setopt(e, CURLOPT_PRIVATE, &t);
+    curl_easy_setopt(e, CURLOPT_ERRORBUFFER, t.errorBuffer);
+    curl_easy_setopt(e, CURLOPT_FOLLOWLOCATION, 0L);
+
+    curl_easy_setopt(e, CURLOPT_READFUNCTION, readBody);
+    curl_easy_setopt(e, CURLOPT_READDATA, &t);
+    curl_easy_setopt(e, CURLOPT_SEEKFUNCTION, seekBody);
+    curl_easy_setopt(e, CURLOPT_SEEKDATA, &t);
+    if (t.request.method == "PUT") {
+      curl_easy_setopt(e, CURLOPT_UPLOAD, 1L);
+      curl_easy_setopt(e, CURLOPT_INFILESIZE_LARGE, static_cast<curl_off_t>(size));
+    } else {
+      curl_easy_setopt(e, CURLOPT_POST, 1L);
+      curl_easy_setopt(e, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(size));
+      if (t.request.method != "POST") curl_easy_setopt(e, CURLOPT_CUSTOMREQUEST, t.request.method.c_str());
+    }
+    curl_easy_setopt(e, CURLOPT_WRITEFUNCTION, discardBody);
+    curl_easy_setopt(e, CURLOPT_HEADERFUNCTION, collectHeader);
+    curl_easy_setopt(e, CURLOPT_HEADERDATA, &t);
+
+    bool hasContentType = false;
+    for (const auto& [name, value] : t.request.headers) {
+      if (strcasecmp(name.c_str(), "Content-Type") == 0) hasContentType = true;
+      t.headers = curl_slist_append(t.headers, (name + ": " + value).c_str());
+    }
+    // The body is sent at once, and a request without a Content-Type must go
+    // without one (libcurl would otherwise add a form type to every POST).
+    t.headers = curl_slist_append(t.headers, "Expect:");
+    if (!hasContentType) t.headers = curl_slist_append(t.headers, "Content-Type:");
+    curl_easy_setopt(e, CURLOPT_HTTPHEADER, t.headers);
+
+    curl_easy_setopt(e, CURLOPT_SSL_VERIFYPEER, 1L);
+    curl_easy_setopt(e, CURLOPT_SSL_VERIFYHOST, 2L);
+    if (config_.pinnedPublicKeys) curl_easy_setopt(e, CURLOPT_PINNEDPUBLICKEY, config_.pinnedPublicKeys->c_str());
+    if (config_.caFile) {
+      curl_easy_setopt(e, CURLOPT_CAINFO, config_.caFile->c_str());
+      curl_easy_setopt(e, CURLOPT_CAPATH, nullptr);
+    }
+    // The time-out is an idle time-out: no progress for that long.
+    long timeout = static_cast<long>(std::max<int64_t>(1, t.request.timeout.count()));
+    curl_easy_setopt(e, CURLOPT_CONNECTTIMEOUT, timeout);
+    curl_easy_setopt(e, CURLOPT_LOW_SPEED_LIMIT, 1L);
+    curl_easy_setopt(e, CURLOPT_LOW_SPEED_TIME, timeout);
+    return true;
+  }
+
+  void run() {
+    while (true) {
+      std::vector<std::unique_ptr<Transfer>> incoming;
+      {
+        std::lock_guard lock(mutex_);
+        if (stop_) return;
+        incoming.swap(incoming_);
+      }
+      for (auto& t : incoming) {
+        CURL* easy = t->easy;
+        if (curl_multi_add_handle(multi_, easy) != CURLM_OK) {
+          fail(std::move(t->completion), {HttpErrorDomain::other, HttpErrorCode::other, "cannot start the transfer"});
+          continue;
+        }
+        active_.emplace(easy, std::move(t));
+      }
+      int running = 0;
+      curl_multi_perform(multi_, &running);
+      int queued = 0;
+      while (CURLMsg* msg = curl_multi_info_read(multi_, &queued)) {
+        if (msg->msg == CURLMSG_DONE) finish(msg->easy_handle, msg->data.result);
+      }
+      maybeInvalidate();
+      curl_multi_poll(multi_, nullptr, 0, 1000, nullptr);
+    }
+  }
+
+  void finish(CURL* easy, CURLcode result) {
+    auto node = active_.extract(easy);
+    if (node.empty()) return;
+    std::unique_ptr<Transfer> t = std::move(node.mapped());
+    curl_multi_remove_handle(multi_, easy);
+    std::optional<HttpResponse> response;
+    std::optional<HttpError> error;
+    if (result == CURLE_OK) {
+      long status = 0;
+      curl_easy_getinfo(easy, CURLINFO_RESPONSE_CODE, &status);
+      t->response.statusCode = status;
+      response = std::move(t->response);
+    } else {
+      long osErrno = 0;
+      curl_easy_getinfo(easy, CURLINFO_OS_ERRNO, &osErrno);
+      error = httpErrorFromCurl(t->readFailed ? CURLE_READ_ERROR : result, osErrno, t->errorBuffer);
+      log().debug("Transfer to {} failed: {}", t->request.url, error->description);
+    }
+    config_.delegateQueue->async([completion = std::move(t->completion), response = std::move(response),
+                                  error = std::move(error)]() mutable {
+      if (completion) completion(std::move(response), std::move(error));
+    });
+  }
+
+  void maybeInvalidate() {
+    std::shared_ptr<CurlHttpSession> self;
+    {
+      std::lock_guard lock(mutex_);
+      if (!invalidating_ || invalidated_ || !incoming_.empty() || !active_.empty()) return;
+      invalidated_ = true;
+      self = std::move(keepAlive_);
+    }
+    // The last reference may go with this task, so the session is destroyed
+    // on the delegate queue and never on its own thread.
+    config_.delegateQueue->async([self = std::move(self), onInvalidated = config_.onInvalidated] {
+      if (onInvalidated) onInvalidated();
+    });
+  }
+
+  HttpSessionConfiguration config_;
+  CURLM* multi_ = nullptr;
+  std::thread thread_;
+  std::mutex mutex_;
+  std::vector<std::unique_ptr<Transfer>> incoming_;  // guarded by mutex_
+  bool stop_ = false;                                // guarded by mutex_
+  bool invalidating_ = false;                        // guarded by mutex_
+  bool invalidated_ = false;                         // guarded by mutex_
+  std::shared_ptr<CurlHttpSession> keepAlive_;       // guarded by mutex_
+  std::map<CURL*, std::unique_ptr<Transfer>> active_;  // the session's thread only
+};
+
+}  // namespace
+
+std::shared_ptr<HttpClientSession> makeCurlHttpSession(HttpSessionConfiguration config) {
+  return std::make_shared<CurlHttpSession>(std::move(config));
+}
+
+}  // namespace fbf

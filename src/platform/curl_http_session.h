@@ -1,0 +1,33 @@
+// The upload session over libcurl.
+//
+// One thread per session drives a libcurl multi handle; every completion is
+// posted to the configuration's delegate queue, in the order transfers end.
+// Bodies are streamed from their file (opened without following links; only a
+// regular file owned by this user is sent). No cookies, no cache, no
+// redirects; TLS peer and host verification are always on, the trust store
+// is the configuration's CA file when given, and the public-key pin string
+// restricts the accepted server keys when given. At most
+// `maxConnectionsPerHost` connections are open to one host; further
+// transfers wait for one.
+//
+// Lifetime: `finishTasksAndInvalidate` refuses new tasks, keeps the session
+// alive until its running tasks have ended, then posts `onInvalidated` once
+// to the delegate queue. Destroying the session without it abandons the
+// running tasks; their completions are never called. The destructor joins the
+// session's thread.
+#pragma once
+
+#include "platform/http_session.h"
+
+#include <memory>
+#include <string>
+
+namespace fbf {
+
+std::shared_ptr<HttpClientSession> makeCurlHttpSession(HttpSessionConfiguration config);
+
+// The one mapping from a libcurl result code (with the OS error of the
+// connection attempt, 0 if none) to the error the upload rules look at.
+HttpError httpErrorFromCurl(int curlCode, long osErrno, const std::string& detail);
+
+}  // namespace fbf

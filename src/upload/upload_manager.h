@@ -1,0 +1,101 @@
+// Turns one piece of feedback into one compressed upload file plus one POST
+// request, sends it over the assembly's upload session, and applies the
+// outcome rules: HTTP 200 deletes the file (with a deletion event, reason
+// "uploaded"); an offline-class network error cancels the flush in progress;
+// anything else leaves the file for a later retry, and a retry of a file older
+// than the bag's age limit deletes it (deletion event, reason "too old").
+//
+// One manager is made per flush, on the assembly's work queue, and used only
+// there; completions of its session arrive there too, so it takes no locks.
+// The bag is read once, at construction. The upload session is made at
+// construction and asked to finish its tasks and invalidate when the manager
+// is destroyed; completions that arrive after that still apply the outcome
+// rules but no longer call the delegate.
+//
+// Endpoints: session feedback and every custom type go to the bag's
+// "feedback_url", except "Crowdsourcing", which goes to "crowdsourcing_url"
+// when the bag has one (and to "feedback_url" otherwise).
+#pragma once
+
+#include "flushing/session_filename.h"
+#include "flushing/upload_manager_protocol.h"
+#include "upload/url_request_builder.h"
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace fbf {
+
+// The build facts that decide the "seed" and "internal" query items.
+struct UploadBuildPredicates {
+  std::function<bool()> isSeedBuild;      // default: vireon_isSeedBuild
+  std::function<bool()> isInternalBuild;  // default: vireon_isInternalBuild
+};
+
+class UploadManager final : public UploadManagerProtocol {
+ public:
+  // The client key sent with every upload.
+  static constexpr std::string_view kClientKey = "galleon5290";
+  static constexpr std::chrono::seconds kUploadTimeout{600};
+
+  explicit UploadManager(FBFAssemblyProtocol& assembly, UploadBuildPredicates predicates = {});
+  ~UploadManager() override;
+  UploadManager(const UploadManager&) = delete;
+  UploadManager& operator=(const UploadManager&) = delete;
+
+  // The POST request for `type` (empty: no "type" item) to `url`: query items
+  // v, type, seed, internal, the "VIRDebugParameters" overrides, realtime,
+  // key; headers User-Agent, Content-Encoding and, for "FeedbackV2PB" (exact)
+  // or "UserReport"/"Usage" (any case), Content-Type "application/protobuf".
+  // Throws URLError for a URL that is not http(s) or cannot be parsed.
+  HttpRequest feedbackUploadRequest(const std::string& url, const std::string& type);
+
+  std::optional<UploadRequest> uploadProtobufFeedback(const corevireon::CVClientSession& session,
+                                                      const fs::path& sessionURL) override;
+  std::optional<UploadRequest> uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
+                                                  const fs::path& sessionURL) override;
+  std::optional<UploadRequest> uploadCustomFeedback(const fs::path& fileURL, const std::string& type) override;
+  void enqueue(UploadRequest request, UploadCompletion completion) override;
+  void retryUpload(const fs::path& fileURL, const std::string& typeString) override;
+  void setDelegate(UploadManagerDelegate* delegate) override;
+
+  // The session's upload file (its upload name, in the shared cache
+  // directory), created empty, 0600, open for writing.
+  std::optional<std::pair<FileDescriptor, fs::path>> makeFileForCompressedVireonFeedback(const SessionFilename& session);
+  // "<url>.uploadPending" beside `url`, created empty, 0600, open for writing.
+  std::optional<std::pair<FileDescriptor, fs::path>> makeFileForCompressedCustomFeedback(const fs::path& url);
+  // The path an open descriptor refers to.
+  static std::optional<fs::path> urlForFileHandle(int fd);
+
+  // The forced query items of a "VIRDebugParameters" value: pieces split at
+  // "&", each split at "=" (empty parts dropped); only pieces of exactly two
+  // parts count.
+  static std::vector<QueryItem> debugQueryItems(std::string_view parameters);
+  // The endpoint a custom feedback type is uploaded to (see above).
+  static std::optional<std::string> endpointForCustomType(const ConfigurationBag& bag, const std::string& type);
+  // Whether a file created at `creation` is young enough at `now` for a limit
+  // of `maxAgeDays` days (strictly younger). Overflow stops the process.
+  static bool fileWasCreatedInTheLast(int64_t maxAgeDays, SystemTime creation, SystemTime now);
+
+  // Makes UploadManagers with the default build predicates.
+  static UploadManagerFactory factory();
+
+  size_t uploadsInFlight() const override;
+
+ private:
+  struct Core;
+  bool fileWasCreatedInTheLast(const fs::path& file, int64_t maxAgeDays);
+  void removeQuietly(const fs::path& file);
+
+  FBFAssemblyProtocol& assembly_;
+  UploadBuildPredicates predicates_;
+  std::shared_ptr<HttpClientSession> uploadSession_;
+  std::optional<ConfigurationBag> bag_;
+  FileManager& fileManager_;
+  std::shared_ptr<Core> core_;
+};
+
+}  // namespace fbf

@@ -1,0 +1,513 @@
+#include "ingest.h"
+
+#include "upload/compressed_output_stream.h"
+
+#include "corevireon.pb.h"
+
+#include <asio.hpp>
+#include <asio/ssl.hpp>
+#include <google/protobuf/util/json_util.h>
+#include <openssl/evp.h>
+#include <strings.h>
+#include <zlib.h>
+
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <iostream>
+
+namespace fbf::ingest {
+namespace {
+
+using asio::awaitable;
+using asio::use_awaitable;
+using asio::ip::tcp;
+
+constexpr size_t kMaxHeaderBytes = 64 * 1024;
+constexpr size_t kMaxBodyBytes = 256 * 1024 * 1024;
+
+bool iequals(std::string_view a, std::string_view b) {
+  return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
+}
+
+std::optional<std::string> headerValue(const ReceivedRequest& r, std::string_view name) {
+  for (const auto& [k, v] : r.headers) {
+    if (iequals(k, name)) return v;
+  }
+  return std::nullopt;
+}
+
+std::string hex(const unsigned char* p, size_t n) {
+  static constexpr char kHex[] = "0123456789abcdef";
+  std::string out;
+  for (size_t i = 0; i < n; ++i) {
+    out.push_back(kHex[p[i] >> 4]);
+    out.push_back(kHex[p[i] & 0xf]);
+  }
+  return out;
+}
+
+std::string sha512Hex(const std::string& data) {
+  unsigned char md[64];
+  unsigned int len = 0;
+  EVP_Digest(data.data(), data.size(), md, &len, EVP_sha512(), nullptr);
+  return hex(md, len);
+}
+
+// The digest the uploader's stream computes when `data` is written in
+// pieces of `chunk` bytes (0: one write).
+std::string perPassDigest(const std::string& data, size_t chunk) {
+  CompressedOutputStream stream;
+  stream.open();
+  auto* p = reinterpret_cast<const uint8_t*>(data.data());
+  if (chunk == 0) {
+    stream.write(p, data.size());
+  } else {
+    for (size_t off = 0; off < data.size(); off += chunk) stream.write(p + off, std::min(chunk, data.size() - off));
+  }
+  stream.close();
+  return stream.dataDigestForStream();
+}
+
+int hexValue(char c) {
+  if (c >= '0' && c <= '9') return c - '0';
+  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+  return -1;
+}
+
+std::string percentDecode(std::string_view s) {
+  std::string out;
+  for (size_t i = 0; i < s.size(); ++i) {
+    if (s[i] == '%' && i + 2 < s.size() && hexValue(s[i + 1]) >= 0 && hexValue(s[i + 2]) >= 0) {
+      out.push_back(static_cast<char>(hexValue(s[i + 1]) * 16 + hexValue(s[i + 2])));
+      i += 2;
+    } else {
+      out.push_back(s[i]);
+    }
+  }
+  return out;
+}
+
+std::optional<nlohmann::ordered_json> protobufToJSON(const google::protobuf::Message& m, std::string& error) {
+  std::string text;
+  google::protobuf::util::JsonPrintOptions options;
+  options.preserve_proto_field_names = true;
+  auto status = google::protobuf::util::MessageToJsonString(m, &text, options);
+  if (!status.ok()) {
+    error = status.ToString();
+    return std::nullopt;
+  }
+  return nlohmann::ordered_json::parse(text);
+}
+
+}  // namespace
+
+std::optional<std::string> inflateRaw(const std::string& compressed) {
+  z_stream z{};
+  if (inflateInit2(&z, -15) != Z_OK) return std::nullopt;
+  std::string out;
+  char buf[65536];
+  z.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));
+  z.avail_in = static_cast<uInt>(compressed.size());
+  int rc = Z_OK;
+  while (rc == Z_OK) {
+    z.next_out = reinterpret_cast<Bytef*>(buf);
+    z.avail_out = sizeof buf;
+    rc = inflate(&z, Z_NO_FLUSH);
+    out.append(buf, sizeof buf - z.avail_out);
+    if (rc == Z_BUF_ERROR && z.avail_in == 0) break;
+  }
+  bool complete = rc == Z_STREAM_END && z.avail_in == 0;
+  inflateEnd(&z);
+  if (!complete) return std::nullopt;
+  return out;
+}
+
+nlohmann::ordered_json describeRequest(const ReceivedRequest& request) {
+  nlohmann::ordered_json line;
+  line["method"] = request.method;
+  std::string_view target = request.target;
+  auto q = target.find('?');
+  line["path"] = std::string(target.substr(0, q));
+  nlohmann::ordered_json query = nlohmann::ordered_json::object();
+  std::string type;
+  if (q != std::string_view::npos) {
+    std::string_view rest = target.substr(q + 1);
+    while (!rest.empty()) {
+      auto amp = rest.find('&');
+      auto piece = rest.substr(0, amp);
+      rest = amp == std::string_view::npos ? std::string_view() : rest.substr(amp + 1);
+      if (piece.empty()) continue;
+      auto eq = piece.find('=');
+      auto name = percentDecode(piece.substr(0, eq));
+      if (eq == std::string_view::npos) {
+        query[name] = nullptr;
+      } else {
+        query[name] = percentDecode(piece.substr(eq + 1));
+        if (name == "type") type = query[name].get<std::string>();
+      }
+    }
+  }
+  line["query"] = query;
+  nlohmann::ordered_json headers = nlohmann::ordered_json::object();
+  for (const auto& [k, v] : request.headers) headers[k] = v;
+  line["headers"] = headers;
+  line["body_size"] = request.body.size();
+
+  auto inflated = inflateRaw(request.body);
+  line["inflated_size"] = inflated ? nlohmann::ordered_json(inflated->size()) : nlohmann::ordered_json(nullptr);
+
+  std::string kind = "missing";
+  if (auto digest = headerValue(request, "X-Corvane-Digest"); digest && inflated) {
+    kind = "mismatch";
+    if (*digest == sha512Hex(*inflated)) {
+      kind = "sha512";
+    } else {
+      for (auto [chunk, name] : {std::pair<size_t, const char*>{0, "passes/whole"}, {1024, "passes/1024"},
+                                 {8192, "passes/8192"}}) {
+        if (*digest == perPassDigest(*inflated, chunk)) {
+          kind = name;
+          break;
+        }
+      }
+    }
+  } else if (digest) {
+    kind = "mismatch";
+  }
+  line["digest_ok"] = kind != "missing" && kind != "mismatch";
+  line["digest_kind"] = kind;
+  line["type"] = type;
+
+  nlohmann::ordered_json decoded = nullptr;
+  std::string error;
+  if (!inflated) {
+    error = "the body is not a raw DEFLATE stream";
+  } else if (type == "FeedbackV2PB") {
+    corevireon::CVClientSession session;
+    if (session.ParseFromString(*inflated)) {
+      if (auto j = protobufToJSON(session, error)) decoded = *j;
+    } else {
+      error = "not a CVClientSession";
+    }
+  } else if (iequals(type, "Usage")) {
+    corevireon::CVCohortsFeedback feedback;
+    if (feedback.ParseFromString(*inflated)) {
+      if (auto j = protobufToJSON(feedback, error)) decoded = *j;
+    } else {
+      error = "not a CVCohortsFeedback";
+    }
+  } else if (auto ct = headerValue(request, "Content-Type"); ct && iequals(*ct, "application/protobuf")) {
+    // Protobuf of a type this receiver has no message for: recorded by size only.
+    error = "no message known for type " + type;
+  } else {
+    decoded = nlohmann::ordered_json::parse(*inflated, nullptr, false);
+    if (decoded.is_discarded()) {
+      decoded = nullptr;
+      error = "not JSON";
+    }
+  }
+  line["decoded"] = decoded;
+  if (!error.empty()) line["decode_error"] = error;
+  return line;
+}
+
+namespace {
+
+struct Options {
+  std::string host = "127.0.0.1";
+  unsigned short port = 0;
+  std::optional<std::pair<std::string, std::string>> tls;
+  std::optional<std::string> record;
+  std::vector<int> statuses;
+  int delayMs = 0;
+  bool drop = false;
+  std::optional<std::string> portFile;
+};
+
+int usage(const std::string& why) {
+  std::cerr << "fbf-ingest: " << why << "\n"
+            << "usage: fbf-ingest --listen HOST:PORT [--tls CERT KEY] [--record FILE] [--status CODE ...]\n"
+            << "                  [--delay-ms N] [--drop] [--port-file FILE]\n";
+  return 2;
+}
+
+std::optional<int> parseInt(const std::string& s) {
+  try {
+    size_t pos = 0;
+    int v = std::stoi(s, &pos);
+    if (pos != s.size()) return std::nullopt;
+    return v;
+  } catch (...) {
+    return std::nullopt;
+  }
+}
+
+const char* reason(int code) {
+  switch (code) {
+    case 200: return "OK";
+    case 201: return "Created";
+    case 204: return "No Content";
+    case 400: return "Bad Request";
+    case 404: return "Not Found";
+    case 500: return "Internal Server Error";
+    case 503: return "Service Unavailable";
+    default: return "Status";
+  }
+}
+
+class Server {
+ public:
+  Server(asio::io_context& io, Options options) : io_(io), options_(std::move(options)) {
+    if (options_.record) {
+      record_ = std::fopen(options_.record->c_str(), "a");
+      if (!record_) throw std::runtime_error("cannot open the record file " + *options_.record);
+    }
+  }
+  ~Server() {
+    if (record_) std::fclose(record_);
+  }
+
+  const Options& options() const { return options_; }
+
+  int nextStatus() {
+    if (options_.statuses.empty()) return 200;
+    size_t i = std::min(answered_, options_.statuses.size() - 1);
+    ++answered_;
+    return options_.statuses[i];
+  }
+
+  void record(nlohmann::ordered_json line) {
+    std::string text = line.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace) + "\n";
+    FILE* out = record_ ? record_ : stdout;
+    std::fwrite(text.data(), 1, text.size(), out);
+    std::fflush(out);
+  }
+
+  template <typename Stream>
+  awaitable<void> serve(Stream& stream, tcp::socket& socket) {
+    std::string buffer;
+    while (true) {
+      size_t headerEnd = co_await asio::async_read_until(stream, asio::dynamic_buffer(buffer, kMaxHeaderBytes),
+                                                         "\r\n\r\n", use_awaitable);
+      ReceivedRequest request;
+      std::string head = buffer.substr(0, headerEnd);
+      buffer.erase(0, headerEnd);
+      if (!parseHead(head, request)) co_return;
+
+      if (auto expect = headerValue(request, "Expect"); expect && iequals(*expect, "100-continue")) {
+        static const std::string kContinue = "HTTP/1.1 100 Continue\r\n\r\n";
+        co_await asio::async_write(stream, asio::buffer(kContinue), use_awaitable);
+      }
+      auto te = headerValue(request, "Transfer-Encoding");
+      if (te && iequals(*te, "chunked")) {
+        co_await readChunked(stream, buffer, request.body);
+      } else {
+        size_t length = 0;
+        if (auto cl = headerValue(request, "Content-Length")) length = std::stoull(*cl);
+        if (length > kMaxBodyBytes) co_return;
+        if (buffer.size() < length) {
+          co_await asio::async_read(stream, asio::dynamic_buffer(buffer), asio::transfer_exactly(length - buffer.size()),
+                                    use_awaitable);
+        }
+        request.body = buffer.substr(0, length);
+        buffer.erase(0, length);
+      }
+
+      auto line = describeRequest(request);
+      if (options_.delayMs > 0) {
+        asio::steady_timer timer(io_, std::chrono::milliseconds(options_.delayMs));
+        co_await timer.async_wait(use_awaitable);
+      }
+      if (options_.drop) {
+        line["status"] = "dropped";
+        record(std::move(line));
+        std::error_code ec;
+        socket.shutdown(tcp::socket::shutdown_both, ec);
+        socket.close(ec);
+        co_return;
+      }
+      int status = nextStatus();
+      line["status"] = status;
+      record(std::move(line));
+      bool close = false;
+      if (auto c = headerValue(request, "Connection"); c && iequals(*c, "close")) close = true;
+      std::string response = "HTTP/1.1 " + std::to_string(status) + " " + reason(status) + "\r\n";
+      if (status != 204) response += "Content-Length: 0\r\n";
+      response += close ? "Connection: close\r\n\r\n" : "\r\n";
+      co_await asio::async_write(stream, asio::buffer(response), use_awaitable);
+      if (close) co_return;
+    }
+  }
+
+ private:
+  static bool parseHead(const std::string& head, ReceivedRequest& r) {
+    std::string_view rest = head;
+    auto eol = rest.find("\r\n");
+    std::string_view first = rest.substr(0, eol);
+    rest = rest.substr(eol + 2);
+    auto sp1 = first.find(' ');
+    auto sp2 = first.rfind(' ');
+    if (sp1 == std::string_view::npos || sp2 == sp1) return false;
+    r.method = std::string(first.substr(0, sp1));
+    r.target = std::string(first.substr(sp1 + 1, sp2 - sp1 - 1));
+    while (!rest.empty()) {
+      eol = rest.find("\r\n");
+      std::string_view line = rest.substr(0, eol);
+      rest = eol == std::string_view::npos ? std::string_view() : rest.substr(eol + 2);
+      if (line.empty()) break;
+      auto colon = line.find(':');
+      if (colon == std::string_view::npos) return false;
+      auto value = line.substr(colon + 1);
+      while (!value.empty() && (value.front() == ' ' || value.front() == '\t')) value.remove_prefix(1);
+      while (!value.empty() && (value.back() == ' ' || value.back() == '\t')) value.remove_suffix(1);
+      r.headers.emplace_back(std::string(line.substr(0, colon)), std::string(value));
+    }
+    return true;
+  }
+
+  template <typename Stream>
+  awaitable<void> readLine(Stream& stream, std::string& buffer, std::string& line) {
+    size_t n = co_await asio::async_read_until(stream, asio::dynamic_buffer(buffer, kMaxBodyBytes), "\r\n",
+                                               use_awaitable);
+    line = buffer.substr(0, n - 2);
+    buffer.erase(0, n);
+  }
+
+  template <typename Stream>
+  awaitable<void> readChunked(Stream& stream, std::string& buffer, std::string& body) {
+    std::string line;
+    while (true) {
+      co_await readLine(stream, buffer, line);
+      size_t size = std::stoull(line.substr(0, line.find(';')), nullptr, 16);
+      if (size == 0) break;
+      if (body.size() + size > kMaxBodyBytes) throw std::runtime_error("body too large");
+      if (buffer.size() < size + 2) {
+        co_await asio::async_read(stream, asio::dynamic_buffer(buffer), asio::transfer_exactly(size + 2 - buffer.size()),
+                                  use_awaitable);
+      }
+      body.append(buffer, 0, size);
+      buffer.erase(0, size + 2);
+    }
+    do {  // trailers, up to the empty line
+      co_await readLine(stream, buffer, line);
+    } while (!line.empty());
+  }
+
+  asio::io_context& io_;
+  Options options_;
+  FILE* record_ = nullptr;
+  size_t answered_ = 0;
+};
+
+awaitable<void> handlePlain(Server& server, tcp::socket socket) {
+  try {
+    co_await server.serve(socket, socket);
+  } catch (const std::exception&) {
+    // The peer went away or sent something unreadable; the connection ends.
+  }
+}
+
+awaitable<void> handleTLS(Server& server, asio::ssl::context& context, tcp::socket socket) {
+  asio::ssl::stream<tcp::socket> stream(std::move(socket), context);
+  try {
+    co_await stream.async_handshake(asio::ssl::stream_base::server, use_awaitable);
+    co_await server.serve(stream, stream.next_layer());
+  } catch (const std::exception&) {
+    // Failed handshakes (a client refusing our key) end here.
+  }
+}
+
+awaitable<void> acceptLoop(Server& server, tcp::acceptor& acceptor, asio::ssl::context* tls) {
+  while (true) {
+    tcp::socket socket = co_await acceptor.async_accept(use_awaitable);
+    if (tls) {
+      asio::co_spawn(acceptor.get_executor(), handleTLS(server, *tls, std::move(socket)), asio::detached);
+    } else {
+      asio::co_spawn(acceptor.get_executor(), handlePlain(server, std::move(socket)), asio::detached);
+    }
+  }
+}
+
+}  // namespace
+
+int run(int argc, char** argv) {
+  Options options;
+  bool haveListen = false;
+  std::vector<std::string> args(argv + 1, argv + argc);
+  for (size_t i = 0; i < args.size(); ++i) {
+    const auto& a = args[i];
+    auto needs = [&](size_t n) { return i + n < args.size(); };
+    if (a == "--listen" && needs(1)) {
+      auto spec = args[++i];
+      auto colon = spec.rfind(':');
+      auto port = colon == std::string::npos ? std::nullopt : parseInt(spec.substr(colon + 1));
+      if (!port || *port < 0 || *port > 65535) return usage("--listen needs HOST:PORT");
+      options.host = spec.substr(0, colon);
+      options.port = static_cast<unsigned short>(*port);
+      haveListen = true;
+    } else if (a == "--tls" && needs(2)) {
+      options.tls = std::make_pair(args[i + 1], args[i + 2]);
+      i += 2;
+    } else if (a == "--record" && needs(1)) {
+      options.record = args[++i];
+    } else if (a == "--status") {
+      while (i + 1 < args.size() && !args[i + 1].starts_with("--")) {
+        auto code = parseInt(args[++i]);
+        if (!code || *code < 100 || *code > 999) return usage("bad status code " + args[i]);
+        options.statuses.push_back(*code);
+      }
+      if (options.statuses.empty()) return usage("--status needs at least one code");
+    } else if (a == "--delay-ms" && needs(1)) {
+      auto ms = parseInt(args[++i]);
+      if (!ms || *ms < 0) return usage("bad --delay-ms");
+      options.delayMs = *ms;
+    } else if (a == "--drop") {
+      options.drop = true;
+    } else if (a == "--port-file" && needs(1)) {
+      options.portFile = args[++i];
+    } else if (a == "--help" || a == "-h") {
+      usage("a reference receiver for feedback uploads");
+      return 0;
+    } else {
+      return usage("unknown or incomplete argument " + a);
+    }
+  }
+  if (!haveListen) return usage("--listen is required");
+
+  try {
+    asio::io_context io(1);
+    std::unique_ptr<asio::ssl::context> tls;
+    if (options.tls) {
+      tls = std::make_unique<asio::ssl::context>(asio::ssl::context::tls_server);
+      tls->set_options(asio::ssl::context::default_workarounds | asio::ssl::context::no_sslv2 |
+                       asio::ssl::context::no_sslv3);
+      tls->use_certificate_chain_file(options.tls->first);
+      tls->use_private_key_file(options.tls->second, asio::ssl::context::pem);
+    }
+    tcp::endpoint endpoint(asio::ip::make_address(options.host), options.port);
+    tcp::acceptor acceptor(io, endpoint);
+    unsigned short port = acceptor.local_endpoint().port();
+    if (options.portFile) {
+      std::string tmp = *options.portFile + ".tmp";
+      {
+        std::ofstream out(tmp, std::ios::trunc);
+        out << port << "\n";
+      }
+      std::filesystem::rename(tmp, *options.portFile);
+    }
+    std::cerr << "fbf-ingest: listening on " << options.host << ":" << port << (tls ? " (https)" : " (http)")
+              << std::endl;
+    Server server(io, options);
+    asio::signal_set signals(io, SIGINT, SIGTERM);
+    signals.async_wait([&](const std::error_code&, int) { io.stop(); });
+    asio::co_spawn(io, acceptLoop(server, acceptor, tls.get()), asio::detached);
+    io.run();
+  } catch (const std::exception& e) {
+    std::cerr << "fbf-ingest: " << e.what() << std::endl;
+    return 1;
+  }
+  return 0;
+}
+
+}  // namespace fbf::ingest

@@ -1,0 +1,3 @@
+#include "ingest.h"
+
+int main(int argc, char** argv) { return fbf::ingest::run(argc, argv); }
