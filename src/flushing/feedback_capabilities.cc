@@ -1,0 +1,132 @@
+#include "flushing/feedback_capabilities.h"
+
+#include "flushing/message_cast.h"
+
+namespace fbf {
+
+using corevireon::CVSearchResultForFeedback;
+using corevireon::CVSearchSuggestionForFeedback;
+using google::protobuf::FieldDescriptor;
+using google::protobuf::Message;
+
+std::optional<std::string> CVIdentifiable::identifier() const {
+  if (auto* r = result()) return r->has_identifier() ? std::optional(r->identifier()) : std::nullopt;
+  auto* s = suggestion();
+  return s->has_identifier() ? std::optional(s->identifier()) : std::nullopt;
+}
+
+void CVIdentifiable::setIdentifier(const std::optional<std::string>& identifier) const {
+  if (auto* r = result()) {
+    identifier ? r->set_identifier(*identifier) : r->clear_identifier();
+    return;
+  }
+  auto* s = suggestion();
+  identifier ? s->set_identifier(*identifier) : s->clear_identifier();
+}
+
+int32_t CVIdentifiable::rType() const {
+  if (auto* r = result()) return r->type();
+  return suggestion()->type();
+}
+
+CVSearchResultForFeedback* CVIdentifiable::result() const {
+  auto* p = std::get_if<CVSearchResultForFeedback*>(&item_);
+  return p ? *p : nullptr;
+}
+
+CVSearchSuggestionForFeedback* CVIdentifiable::suggestion() const {
+  auto* p = std::get_if<CVSearchSuggestionForFeedback*>(&item_);
+  return p ? *p : nullptr;
+}
+
+void redact(CVSearchResultForFeedback& result) {
+  if (result.type() == 1) return;
+  result.clear_userinput();
+  result.clear_completedquery();
+  result.clear_intendedquery();
+  result.clear_punchout();
+}
+
+namespace {
+
+using Results = std::vector<const CVSearchResultForFeedback*>;
+
+void appendAll(Results& out, const google::protobuf::RepeatedPtrField<CVSearchResultForFeedback>& list) {
+  for (const auto& r : list) out.push_back(&r);
+}
+
+void appendSection(Results& out, const corevireon::CVResultSection& section) {
+  if (section.has_results()) appendAll(out, section.results().items());
+}
+
+}  // namespace
+
+Results containedResults(const Message& feedback) {
+  Results out;
+  if (auto* m = messageAs<corevireon::CVVisibleResultsFeedback>(feedback)) {
+    appendAll(out, m->results());
+  } else if (auto* m = messageAs<corevireon::CVResultsReceivedAfterTimeoutFeedback>(feedback)) {
+    appendAll(out, m->results());
+  } else if (auto* m = messageAs<corevireon::CVSectionRankingFeedback>(feedback)) {
+    if (m->has_section()) appendSection(out, m->section());
+  } else if (auto* m = messageAs<corevireon::CVResultRankingFeedback>(feedback)) {
+    appendAll(out, m->duplicateresults());
+    appendAll(out, m->hiddenresults());
+    if (m->has_result()) out.push_back(&m->result());
+  } else if (auto* m = messageAs<corevireon::CVRankingFeedback>(feedback)) {
+    for (const auto& sectionRanking : m->sections()) {
+      if (sectionRanking.has_section()) appendSection(out, sectionRanking.section());
+    }
+  } else if (auto* m = messageAs<corevireon::CVResultEngagementFeedback>(feedback)) {
+    if (m->has_result()) out.push_back(&m->result());
+  } else if (auto* m = messageAs<corevireon::CVResultGradingFeedback>(feedback)) {
+    if (m->has_result()) out.push_back(&m->result());
+  } else if (auto* m = messageAs<corevireon::CVLateSectionsAppendedFeedback>(feedback)) {
+    for (const auto& section : m->sections()) appendSection(out, section);
+  } else if (auto* m = messageAs<corevireon::CVSectionEngagementFeedback>(feedback)) {
+    if (m->has_section()) appendSection(out, m->section());
+  }
+  return out;
+}
+
+const Message* codableMessage(const corevireon::CVFeedbackPayload& payload) {
+  if (payload.codable_case() == corevireon::CVFeedbackPayload::CODABLE_NOT_SET) return nullptr;
+  const auto* reflection = payload.GetReflection();
+  static const auto* const oneof = corevireon::CVFeedbackPayload::descriptor()->FindOneofByName("codable");
+  const FieldDescriptor* field = reflection->GetOneofFieldDescriptor(payload, oneof);
+  return field ? &reflection->GetMessage(payload, field) : nullptr;
+}
+
+Message* mutableCodableMessage(corevireon::CVFeedbackPayload& payload) {
+  if (payload.codable_case() == corevireon::CVFeedbackPayload::CODABLE_NOT_SET) return nullptr;
+  const auto* reflection = payload.GetReflection();
+  static const auto* const oneof = corevireon::CVFeedbackPayload::descriptor()->FindOneofByName("codable");
+  const FieldDescriptor* field = reflection->GetOneofFieldDescriptor(payload, oneof);
+  return field ? reflection->MutableMessage(&payload, field) : nullptr;
+}
+
+namespace {
+
+const FieldDescriptor* timestampField(const Message& feedback) {
+  const FieldDescriptor* field = feedback.GetDescriptor()->FindFieldByNumber(1);
+  if (field == nullptr || field->cpp_type() != FieldDescriptor::CPPTYPE_UINT64 || field->is_repeated()) {
+    return nullptr;
+  }
+  return field;
+}
+
+}  // namespace
+
+std::optional<uint64_t> feedbackTimestamp(const Message& feedback) {
+  const FieldDescriptor* field = timestampField(feedback);
+  if (field == nullptr) return std::nullopt;
+  return feedback.GetReflection()->GetUInt64(feedback, field);
+}
+
+void setFeedbackTimestamp(Message& feedback, uint64_t timestamp) {
+  if (const FieldDescriptor* field = timestampField(feedback)) {
+    feedback.GetReflection()->SetUInt64(&feedback, field, timestamp);
+  }
+}
+
+}  // namespace fbf

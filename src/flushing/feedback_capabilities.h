@@ -1,0 +1,72 @@
+// Capabilities that session processing attaches to the search service's
+// feedback messages: identifiable items (results and suggestions carry an
+// identifier and an item type), the redaction of a result's query texts, the
+// list of results a feedback message carries, and the access to the
+// `timestamp` that every feedback message has as field 1.
+//
+// The generated message classes cannot gain members, so each capability is a
+// small value or free function that dispatches on the concrete message type.
+// Everything here is stateless and callable from any thread; the handles do
+// not own the messages they point into.
+#pragma once
+
+#include "corevireon.pb.h"
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+namespace fbf {
+
+// A result or a suggestion whose identifier processing replaces. A handle:
+// it points into a message owned elsewhere and must not outlive it.
+class CVIdentifiable {
+ public:
+  explicit CVIdentifiable(corevireon::CVSearchResultForFeedback* result) : item_(result) {}
+  explicit CVIdentifiable(corevireon::CVSearchSuggestionForFeedback* suggestion) : item_(suggestion) {}
+
+  // The identifier, absent when the field is not set.
+  std::optional<std::string> identifier() const;
+  // Sets the identifier, or clears the field for an absent value.
+  void setIdentifier(const std::optional<std::string>& identifier) const;
+  // The item's own `type`.
+  int32_t rType() const;
+
+  // The underlying message; exactly one of the two is non-null.
+  corevireon::CVSearchResultForFeedback* result() const;
+  corevireon::CVSearchSuggestionForFeedback* suggestion() const;
+
+ private:
+  std::variant<corevireon::CVSearchResultForFeedback*, corevireon::CVSearchSuggestionForFeedback*> item_;
+};
+
+// Removes what the user typed and where the result leads from a result that
+// is not of type 1: `userInput`, `completedQuery`, `intendedQuery` and
+// `punchout` are cleared. A type 1 result is left as it is.
+void redact(corevireon::CVSearchResultForFeedback& result);
+
+// The results a feedback message carries, in this order:
+//   visible results, results received after timeout: `results`;
+//   section ranking: the results of its section;
+//   result ranking: `duplicateResults`, `hiddenResults`, then `result`;
+//   ranking: the section results of each of its section rankings, in order;
+//   result engagement, result grading: `result`;
+//   late sections appended: the results of every section;
+//   section engagement: the results of its section;
+//   anything else (and absent lists or messages): nothing.
+// The pointers point into `feedback`.
+std::vector<const corevireon::CVSearchResultForFeedback*> containedResults(
+    const google::protobuf::Message& feedback);
+
+// The feedback message a payload carries, or null when it carries none.
+const google::protobuf::Message* codableMessage(const corevireon::CVFeedbackPayload& payload);
+google::protobuf::Message* mutableCodableMessage(corevireon::CVFeedbackPayload& payload);
+
+// `timestamp` (field 1) of a feedback message; absent for a message that has
+// no such field (never the case for the feedback messages of a session).
+std::optional<uint64_t> feedbackTimestamp(const google::protobuf::Message& feedback);
+void setFeedbackTimestamp(google::protobuf::Message& feedback, uint64_t timestamp);
+
+}  // namespace fbf

@@ -1,0 +1,297 @@
+#include "flushing/flushable_session.h"
+
+#include "flushing/cba_filter_controller.h"
+#include "flushing/feedback_capabilities.h"
+#include "flushing/session_json.h"
+#include "flushing/session_processing_helper.h"
+
+#include <algorithm>
+#include <array>
+#include <cmath>
+
+namespace fbf {
+
+using corevireon::CVFeedbackPayload;
+using nlohmann::ordered_json;
+
+namespace {
+
+constexpr uint64_t kNanosecondsPerMillisecond = 1'000'000;
+
+// Sorts a range of payload pointers for processing, ascending by the
+// timestamp of the feedback message. A payload without a feedback message
+// compares neither before nor after anything, so it is a fixed point: the runs
+// between such payloads are sorted stably on their own.
+template <class It>
+void sortForProcessing(It begin, It end) {
+  using Pointer = typename std::iterator_traits<It>::value_type;
+  struct Keyed {
+    uint64_t timestamp;
+    Pointer payload;
+  };
+  std::vector<Keyed> keyed;
+  keyed.reserve(static_cast<size_t>(std::distance(begin, end)));
+  auto byTimestamp = [](const Keyed& a, const Keyed& b) { return a.timestamp < b.timestamp; };
+  size_t runStart = 0;
+  for (It it = begin; it != end; ++it) {
+    const google::protobuf::Message* message = codableMessage(**it);
+    if (message == nullptr) {
+      std::stable_sort(keyed.begin() + static_cast<std::ptrdiff_t>(runStart), keyed.end(), byTimestamp);
+      runStart = keyed.size() + 1;
+    }
+    keyed.push_back({message ? feedbackTimestamp(*message).value_or(0) : 0, *it});
+  }
+  std::stable_sort(keyed.begin() + static_cast<std::ptrdiff_t>(runStart), keyed.end(), byTimestamp);
+  It out = begin;
+  for (const Keyed& k : keyed) *out++ = k.payload;
+}
+
+// Moves the last element of the list to the front.
+void moveLastToFront(google::protobuf::RepeatedPtrField<CVFeedbackPayload>* list) {
+  std::rotate(list->pointer_begin(), std::prev(list->pointer_end()), list->pointer_end());
+}
+
+}  // namespace
+
+std::optional<std::vector<CVFeedbackPayload>> FlushableSession::sessionFeedbacks() const {
+  if (!backingStore_.has_feedbacks()) return std::nullopt;
+  const auto& items = backingStore_.feedbacks().items();
+  std::vector<const CVFeedbackPayload*> order;
+  order.reserve(items.size());
+  for (const auto& p : items) order.push_back(&p);
+  sortForProcessing(order.begin(), order.end());
+  std::vector<CVFeedbackPayload> out;
+  out.reserve(order.size());
+  for (const CVFeedbackPayload* p : order) out.push_back(*p);
+  return out;
+}
+
+const std::vector<EngagementReporter>& FlushableSession::engagements() {
+  if (!engagements_) {
+    std::vector<EngagementReporter> list;
+    const corevireon::CVClient client = cohortsClient(backingStore_);
+    if (backingStore_.has_feedbacks()) {
+      for (const auto& payload : backingStore_.feedbacks().items()) {
+        const google::protobuf::Message* message = codableMessage(payload);
+        if (message == nullptr) continue;
+        auto reporter = EngagementReporter::from(*message);
+        if (reporter && reporter->isEngagement(client)) list.push_back(std::move(*reporter));
+      }
+    }
+    engagements_ = std::move(list);
+  }
+  return *engagements_;
+}
+
+void FlushableSession::setEngagements(std::vector<EngagementReporter> engagements) {
+  engagements_ = std::move(engagements);
+}
+
+const std::vector<KeystrokeReporter>& FlushableSession::keystrokes() {
+  if (!keystrokes_) {
+    std::vector<KeystrokeReporter> list;
+    if (backingStore_.has_feedbacks()) {
+      for (const auto& payload : backingStore_.feedbacks().items()) {
+        const google::protobuf::Message* message = codableMessage(payload);
+        if (message == nullptr) continue;
+        auto reporter = KeystrokeReporter::from(*message);
+        if (reporter && reporter->isKeystroke()) list.push_back(std::move(*reporter));
+      }
+    }
+    keystrokes_ = std::move(list);
+  }
+  return *keystrokes_;
+}
+
+void FlushableSession::setKeystrokes(std::vector<KeystrokeReporter> keystrokes) { keystrokes_ = std::move(keystrokes); }
+
+const std::map<std::string, corevireon::CVSearchResultForFeedback>& FlushableSession::resultsById() {
+  if (!resultsById_) {
+    std::map<std::string, corevireon::CVSearchResultForFeedback> map;
+    if (backingStore_.has_feedbacks()) {
+      for (const auto& payload : backingStore_.feedbacks().items()) {
+        const google::protobuf::Message* message = codableMessage(payload);
+        if (message == nullptr) continue;
+        for (const auto* result : containedResults(*message)) {
+          if (result->has_identifier()) map.insert_or_assign(result->identifier(), *result);
+        }
+      }
+    }
+    resultsById_ = std::move(map);
+  }
+  return *resultsById_;
+}
+
+void FlushableSession::setResultsById(std::map<std::string, corevireon::CVSearchResultForFeedback> resultsById) {
+  resultsById_ = std::move(resultsById);
+}
+
+void FlushableSession::postProcessFeedback(UsageEventSink* storageContainer) {
+  if (storageContainer != nullptr) storageContainer->reportUsageEvents(backingStore_);
+  if (!backingStore_.has_feedbacks()) return;
+
+  auto* list = backingStore_.mutable_feedbacks()->mutable_items();
+  sortForProcessing(list->pointer_begin(), list->pointer_end());
+
+  uint64_t baseTime = 0;
+  if (!list->empty()) {
+    if (const auto* first = codableMessage(list->Get(0))) baseTime = feedbackTimestamp(*first).value_or(0);
+  }
+
+  SessionProcessingHelper helper;
+  for (auto& payload : *list) {
+    google::protobuf::Message* message = mutableCodableMessage(payload);
+    if (message == nullptr) continue;
+    const uint64_t timestamp = feedbackTimestamp(*message).value_or(0);
+    if (timestamp >= baseTime) {
+      setFeedbackTimestamp(*message, (timestamp - baseTime) / kNanosecondsPerMillisecond);
+    }
+    helper.process(message);
+  }
+
+  CBAFilterController().filter(*list);
+
+  if (auto missing = helper.missingResults(); missing && !missing->empty()) {
+    CVFeedbackPayload* payload = list->Add();
+    payload->set_type(corevireon::CV_FEEDBACK_EVENT_TYPE_SESSION_MISSING_RESULTS);
+    auto* feedback = payload->mutable_sessionmissingresults();
+    feedback->set_timestamp(0);
+    for (auto& r : *missing) *feedback->add_results() = std::move(r);
+    moveLastToFront(list);
+  }
+  if (auto missing = helper.missingSuggestions(); missing && !missing->empty()) {
+    CVFeedbackPayload* payload = list->Add();
+    payload->set_type(corevireon::CV_FEEDBACK_EVENT_TYPE_SESSION_MISSING_SUGGESTIONS);
+    auto* feedback = payload->mutable_sessionmissingsuggestions();
+    feedback->set_timestamp(0);
+    for (auto& s : *missing) *feedback->add_suggestions() = std::move(s);
+    moveLastToFront(list);
+  }
+
+  if (backingStore_.removetimestamps() && backingStore_.sessionstart() != 0) backingStore_.set_sessionstart(0);
+}
+
+std::string feedbackEventName(int32_t type) {
+  static constexpr std::array<std::string_view, 42> kNames = {
+      "unknown",
+      "search_view_appear",
+      "search_view_disappear",
+      "rank_sections",
+      "rank_sections",
+      "result_ranking",
+      "result",
+      "result_engagement",
+      "visible_results",
+      "card_section",
+      "card_engagement",
+      "card_engagement",
+      "search_start",
+      "search_end",
+      "network_search_start",
+      "network_search_end",
+      "local_search_start",
+      "local_search_end",
+      "error",
+      "custom_unknown",
+      "suggestion_engagement",
+      "card_view_disappear",
+      "visible_suggestions",
+      "results_received_after_timeout",
+      "late_sections_appended",
+      "clear_input",
+      "section_engagement",
+      "visible_section_header",
+      "did_go_to_site",
+      "did_go_to_search",
+      "session_missing_results",
+      "session_missing_suggestions",
+      "result_grade",
+      "lookup_hint_graded",
+      "connection_invalidated",
+      "card_section_engagement",
+      "session_end",
+      "card_view_appear",
+      "skip_vireon_search",
+      "cache_hit",
+      "cba_engagement",
+      "client_timing",
+  };
+  if (type >= 0 && type < static_cast<int32_t>(kNames.size())) return std::string(kNames[type]);
+  switch (type) {
+    case 100: return "custom_crowdsourcing";
+    case 101: return "custom_wayfin_autofill";
+    case 102: return "custom_scoutlume_result_features";
+    case 103: return "last_";
+    default: return "(unknown: " + std::to_string(type) + ")";
+  }
+}
+
+std::string sessionEndReasonName(int32_t reason) {
+  static constexpr std::array<std::string_view, 9> kNames = {
+      "unknown",      "no_previous_session", "external_request",    "session_idle", "max_session_time_passed",
+      "guid_changed", "critical_memory",     "engagement_received", "last_",
+  };
+  if (reason >= 0 && reason < static_cast<int32_t>(kNames.size())) return std::string(kNames[reason]);
+  return "(unknown: " + std::to_string(reason) + ")";
+}
+
+std::optional<ordered_json> feedbackDictionary(const CVFeedbackPayload& payload) {
+  const google::protobuf::Message* message = codableMessage(payload);
+  if (message == nullptr) return std::nullopt;
+  ordered_json dictionary;
+  if (payload.has_custom()) {
+    if (!payload.custom().has_feedbackjson()) return std::nullopt;
+    dictionary = ordered_json::parse(payload.custom().feedbackjson(), nullptr, /*allow_exceptions=*/false);
+    if (!dictionary.is_object()) return std::nullopt;
+  } else {
+    dictionary = protobufDictionary(*message);
+  }
+  dictionary["query_id"] = payload.queryid();
+  dictionary["type"] = feedbackEventName(payload.type());
+  return dictionary;
+}
+
+ordered_json FlushableSession::generateSessionJSON() const {
+  const auto& s = backingStore_;
+  ordered_json json = ordered_json::object();
+
+  if (s.has_feedbacks()) {
+    ordered_json fb = ordered_json::array();
+    for (const auto& payload : s.feedbacks().items()) {
+      if (auto dictionary = feedbackDictionary(payload)) fb.push_back(std::move(*dictionary));
+    }
+    json[FeedbackKey] = std::move(fb);
+  } else {
+    json[FeedbackKey] = nullptr;
+  }
+  json[AgentKey] = s.has_agent() ? s.agent() : std::string();
+  json[UserGuidKey] = s.has_userguidstring() ? s.userguidstring() : std::string();
+  json[CountryCode] = s.has_countrycode() ? s.countrycode() : std::string();
+  json[Locale] = s.has_locale() ? s.locale() : std::string();
+  if (s.resourceversions().empty()) {
+    json[ResourceVersionsKey] = nullptr;
+  } else {
+    std::map<std::string, std::string> sorted(s.resourceversions().begin(), s.resourceversions().end());
+    ordered_json versions = ordered_json::object();
+    for (const auto& [name, version] : sorted) versions[name] = version;
+    json[ResourceVersionsKey] = std::move(versions);
+  }
+
+  int64_t baseTime = 0;
+  // 2^63: the first value a signed 64-bit integer cannot hold.
+  constexpr double kInt64Limit = 9223372036854775808.0;
+  if (!s.removetimestamps() && s.sessionstart() > 0 && s.sessionstart() < kInt64Limit) {
+    baseTime = static_cast<int64_t>(std::trunc(s.sessionstart()));
+  }
+  json[BaseTime] = baseTime;
+  json[PreviousEndReason] = sessionEndReasonName(s.previoussessionendreason());
+  json[DiagnosticsAndUsageEnabled] = s.duenabled();
+  if (s.has_usagesincelookback()) json[UsageSinceLookback] = protobufDictionary(s.usagesincelookback());
+  if (s.has_cohortsfeedback()) {
+    const int kind = s.cohortsfeedback().whichKind_case();
+    if (kind >= 2 && kind <= 5) json[UsagePropensity] = protobufDictionary(s.cohortsfeedback());
+  }
+  return json;
+}
+
+}  // namespace fbf

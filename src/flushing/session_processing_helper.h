@@ -1,0 +1,101 @@
+// Replaces the result and suggestion identifiers of one session's feedback by
+// small session-local numbers and notes which items the session only
+// referenced (showed, engaged, graded) without ever delivering them in full.
+//
+// One helper per session: the flushable session feeds it every feedback
+// message in timestamp order, then reads `missingResults` and
+// `missingSuggestions`. Numbering starts at 1 for every helper, so a
+// replacement means something only within its session. Not thread-safe; it
+// lives on the work queue for the processing of one session.
+//
+// Rules, per feedback message (the first matching kind decides):
+//   visible results .............. `results` ............................ referenced
+//   visible suggestions .......... `suggestions` ........................ expanded
+//   suggestion engagement ........ `suggestion` ......................... referenced
+//   results received after timeout `results` ............................ expanded
+//   section ranking .............. each result ranking is processed as its own
+//                                  feedback first, then the section's `results` expanded
+//   result ranking ............... `duplicateResults`, `hiddenResults`, `result` expanded
+//   ranking ...................... each section ranking processed in turn
+//   result engagement ............ `result` ............................. referenced
+//   result grading ............... `result` ............................. referenced
+//   late sections appended ....... every section's `results` ............ expanded
+//   section engagement ........... the section's `results` .............. referenced
+// Rewrites made on the way:
+//   * result engagement: unless the result's type is 9, 10, 11, 12, 13, 14,
+//     18 or 19, `titleText` is cleared and `matchesUnengagedSuggestion` is
+//     set to false;
+//   * section ranking with result rankings: the section's `results` are
+//     cleared once gathered;
+//   * section engagement whose trigger event is not 2 (expand): the section's
+//     `results` are cleared once gathered (they still count as referenced);
+//   * a local-application result whose type is not 20 gets the bundle codes
+//     `knownApplicationBundleIdentifier` and `knownResultBundleId` set to 2.
+#pragma once
+
+#include "corevireon.pb.h"
+#include "flushing/feedback_capabilities.h"
+
+#include <cstdint>
+#include <map>
+#include <optional>
+#include <set>
+#include <string>
+#include <unordered_map>
+#include <variant>
+#include <vector>
+
+namespace fbf {
+
+class SessionProcessingHelper {
+ public:
+  SessionProcessingHelper() = default;
+
+  // Maps and records the items of one feedback message, rewriting it in
+  // place. Null does nothing.
+  void process(google::protobuf::Message* feedback);
+
+  // The session-local replacement of an identifier under an item type: the
+  // decimal strings "1", "2", ... in order of first appearance of the key
+  // (identifier immediately followed by the decimal type, no separator, so
+  // "ab" with type 17 and "ab1" with type 7 share one replacement). Absent or
+  // empty identifiers yield absent and use up no number.
+  std::optional<std::string> replacementForIdentifier(const std::optional<std::string>& identifier,
+                                                      int32_t rType);
+
+  // Bookkeeping by replacement identifier. An item referenced before it is
+  // expanded is not missing; one referenced after its expansion is never
+  // recorded; of several references the first is kept.
+  void didReference(const std::optional<CVIdentifiable>& item);
+  void didExpand(const std::optional<CVIdentifiable>& item);
+
+  // Items referenced but never expanded, in the order of their replacement
+  // numbers; empty when there are none.
+  std::optional<std::vector<corevireon::CVSearchResultForFeedback>> missingResults() const;
+  std::optional<std::vector<corevireon::CVSearchSuggestionForFeedback>> missingSuggestions() const;
+
+  int64_t nextMappedId() const { return nextMappedId_; }
+  const std::set<std::string>& allIdSet() const { return allIdSet_; }
+  const std::set<std::string>& expandedIdSet() const { return expandedIdSet_; }
+
+ private:
+  // Orders decimal strings by value ("2" before "10").
+  struct ByNumericValue {
+    bool operator()(const std::string& a, const std::string& b) const {
+      return a.size() != b.size() ? a.size() < b.size() : a < b;
+    }
+  };
+  // A copy of a referenced item as it stands after its rewrites; the original
+  // may be removed from its feedback later (cleared section results).
+  using Item = std::variant<corevireon::CVSearchResultForFeedback, corevireon::CVSearchSuggestionForFeedback>;
+
+  void processItems(const std::vector<CVIdentifiable>& items, bool expanded);
+
+  int64_t nextMappedId_ = 1;
+  std::unordered_map<std::string, std::string> idMapping_;
+  std::map<std::string, Item, ByNumericValue> identifiableMapping_;
+  std::set<std::string> expandedIdSet_;
+  std::set<std::string> allIdSet_;
+};
+
+}  // namespace fbf
