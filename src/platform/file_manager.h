@@ -31,6 +31,8 @@ struct FileAttributes {
   uint64_t size = 0;
   // Birth time where the file system records it, else the modification time.
   SystemTime creationDate;
+  // False when `creationDate` is only the modification time standing in.
+  bool creationDateIsBirthTime = false;
   SystemTime modificationDate;
   uid_t owner = 0;
   mode_t mode = 0;
@@ -111,6 +113,15 @@ class FileManager {
   // Owner-only permissions; where a platform has data-protection classes this
   // is where the class would be set.
   virtual bool setOwnerOnlyProtection(const fs::path& path, std::error_code& error) = 0;
+
+  // Sets the modification date of the file or link itself (never its target).
+  // Implementations that cannot do this report "function not supported".
+  virtual bool setModificationDate(const fs::path& path, SystemTime date, std::error_code& error) {
+    (void)path;
+    (void)date;
+    error = std::make_error_code(std::errc::function_not_supported);
+    return false;
+  }
 };
 
 // The real file system; the caches directory comes from `dirs.cacheHome`.

@@ -31,6 +31,7 @@ FileAttributes fromStatx(const struct statx& st) {
   a.size = st.stx_size;
   a.modificationDate = fromTimestamp(st.stx_mtime);
   a.creationDate = (st.stx_mask & STATX_BTIME) ? fromTimestamp(st.stx_btime) : a.modificationDate;
+  a.creationDateIsBirthTime = (st.stx_mask & STATX_BTIME) != 0;
   a.owner = st.stx_uid;
   a.mode = st.stx_mode & 07777;
   return a;
@@ -236,6 +237,21 @@ class PosixFileManager final : public FileManager {
     }
     mode_t want = a->isDirectory() ? 0700 : 0600;
     if (a->mode != want && fchmodat(AT_FDCWD, path.c_str(), want, 0) != 0) {
+      error = lastError();
+      return false;
+    }
+    return true;
+  }
+
+  bool setModificationDate(const fs::path& path, SystemTime date, std::error_code& error) override {
+    auto since = date.time_since_epoch();
+    auto seconds = std::chrono::floor<std::chrono::seconds>(since);
+    struct timespec times[2];
+    times[0].tv_sec = 0;
+    times[0].tv_nsec = UTIME_OMIT;
+    times[1].tv_sec = static_cast<time_t>(seconds.count());
+    times[1].tv_nsec = static_cast<long>(std::chrono::duration_cast<std::chrono::nanoseconds>(since - seconds).count());
+    if (utimensat(AT_FDCWD, path.c_str(), times, AT_SYMLINK_NOFOLLOW) != 0) {
       error = lastError();
       return false;
     }
