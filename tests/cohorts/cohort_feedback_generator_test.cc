@@ -1,0 +1,311 @@
+// Cohort envelopes built from a real store: what each period writes, what
+// the listener sees, the lookback, the shares and the bucketing.
+
+#include "cohorts/cohort_feedback_generator.h"
+#include "cohorts/cohorts_usage_store.h"
+#include "cohorts_test_support.h"
+
+#include <sys/stat.h>
+#include <unicode/locid.h>
+
+#include <gtest/gtest.h>
+
+namespace fbf::testing {
+namespace {
+
+using corevireon::CVCohortsFeedback;
+
+int64_t wholeSeconds(SystemTime t) { return static_cast<int64_t>(secondsSinceEpoch(t)); }
+
+class RecordingConduit final : public ClientConduit {
+ public:
+  void willUploadData(const std::string&, const std::string&) override {}
+  void willGenerateCohortFeebacks(const std::string& data) override { received.push_back(data); }
+  std::vector<std::string> received;
+};
+
+class CohortEnvelopes : public StoreFixture {
+ protected:
+  void SetUp() override {
+    makeCohortsDirectory();
+    store = bringUpAndSettle();
+    ASSERT_NE(store, nullptr);
+  }
+  std::unique_ptr<CohortFeedbackGenerator> makeGenerator(std::optional<ConfigurationBag> bag = std::nullopt) {
+    CohortFeedbackGenerator::Collaborators c;
+    c.bag = std::move(bag);
+    c.deviceContext = &env.assembly().deviceContext();
+    c.today = localTime(2030, 12, 31);
+    c.calendar = CohortCalendar("America/New_York", "en_US");
+    c.random = std::make_shared<SeededRandomSource>(7);
+    c.persist = [this](const std::string& bytes) { persisted.push_back(decode(bytes)); };
+    c.offer = [this](const std::string& bytes) { offered.push_back(bytes); };
+    return std::make_unique<CohortFeedbackGenerator>(*store, std::move(c));
+  }
+  static CVCohortsFeedback decode(const std::string& bytes) {
+    CVCohortsFeedback f;
+    EXPECT_TRUE(f.ParseFromString(bytes));
+    return f;
+  }
+  void addSentinel(corevireon::CVClient client, SystemTime t) {
+    onStore(*store, [&] {
+      auto e = store->eventFactory().createUsageEvent();
+      e->setTimestamp(t);
+      e->usageCategory()->setClientIntVal(client);
+    });
+  }
+  void addWayfinSession(SystemTime t, std::initializer_list<std::pair<VIRWayfinSession::Counter, int>> counts) {
+    onStore(*store, [&] {
+      auto s = store->eventFactory().createWayfinSession();
+      s->setTimestamp(t);
+      for (auto [counter, n] : counts) {
+        for (int i = 0; i < n; ++i) s->incrementCounter(counter);
+      }
+    });
+  }
+  void setMarker(FlushFrequency f, SystemTime t) {
+    onStore(*store, [&] { store->lastAggregations()[f]->setTimestamp(t); });
+  }
+  std::optional<SystemTime> marker(FlushFrequency f) {
+    std::optional<SystemTime> t;
+    onStore(*store, [&] { t = store->lastAggregations()[f]->timestamp(); });
+    return t;
+  }
+  std::vector<corevireon::CVUsageEnvelope> usageEnvelopes() const {
+    std::vector<corevireon::CVUsageEnvelope> out;
+    for (const auto& f : persisted) {
+      if (f.whichKind_case() == CVCohortsFeedback::kUsageEnvelope) out.push_back(f.usageenvelope());
+    }
+    return out;
+  }
+
+  ScopedTimeZone newYork{"America/New_York"};
+  std::unique_ptr<ObjectGraphStorageContainer> store;
+  std::vector<CVCohortsFeedback> persisted;
+  std::vector<std::string> offered;
+};
+
+TEST_F(CohortEnvelopes, ADayWritesOneUsageEnvelopePerSurfaceInClientOrder) {
+  addSentinel(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, localTime(2030, 6, 5, 9));
+  addSentinel(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, localTime(2030, 6, 5, 23, 59));
+  addSentinel(corevireon::CV_CLIENT_NEWS, localTime(2030, 6, 6));  // the next day
+  setMarker(FlushFrequency::daily, localTime(2030, 6, 5, 10));
+  saveOrLogError(store->managedObjectContext());
+
+  makeGenerator()->aggregateNext(FlushFrequency::daily);
+
+  ASSERT_EQ(persisted.size(), 4u);
+  std::vector<int> clients, activeDays;
+  std::set<std::string> uuids;
+  for (const auto& f : persisted) {
+    ASSERT_EQ(f.whichKind_case(), CVCohortsFeedback::kUsageEnvelope);
+    const auto& e = f.usageenvelope();
+    clients.push_back(e.client());
+    activeDays.push_back(static_cast<int>(e.usagesincelookback().activedaysincollectionperiod()));
+    EXPECT_EQ(e.configuredlookbacktimeindays(), 1);
+    EXPECT_EQ(e.collectionendtimestamp(), wholeSeconds(localTime(2030, 6, 6)));
+    EXPECT_EQ(e.collectionstarttimestamp(), wholeSeconds(store->collectionStartDate()));
+    EXPECT_EQ(e.context().localeidentifier(), *env.assembly().deviceContext().localeIdentifier());
+    ASSERT_EQ(e.uuid().size(), 16u);
+    EXPECT_EQ(static_cast<uint8_t>(e.uuid()[6]) >> 4, 4) << "a version 4 UUID";
+    uuids.insert(e.uuid());
+  }
+  EXPECT_EQ(clients, (std::vector<int>{2, 1, 4, 3}));
+  EXPECT_EQ(activeDays, (std::vector<int>{1, 0, 0, 0}));
+  EXPECT_EQ(uuids.size(), 4u);
+  // The listener sees exactly the bytes of the files.
+  ASSERT_EQ(offered.size(), 4u);
+  EXPECT_EQ(decode(offered[0]).usageenvelope().client(), 2);
+}
+
+TEST_F(CohortEnvelopes, AggregatingAdvancesAndSavesTheMarkerToThePeriodEnd) {
+  setMarker(FlushFrequency::weekly, localTime(2030, 6, 5, 10));
+  makeGenerator()->aggregateNext(FlushFrequency::weekly);
+  EXPECT_EQ(marker(FlushFrequency::weekly), localTime(2030, 6, 9));
+  RawDatabase raw(databasePath());
+  EXPECT_EQ(raw.scalar("SELECT CAST(timestamp AS INTEGER) FROM VIRFlushEvent WHERE type = 1"),
+            std::to_string(wholeSeconds(localTime(2030, 6, 9))));
+}
+
+TEST_F(CohortEnvelopes, AWeekCountsDistinctLocalDaysInsideItsRange) {
+  addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 1, 23, 59));  // Saturday before
+  addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 2));          // Sunday, first instant
+  addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 2, 20));
+  addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 4, 7));
+  addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 8, 23, 59));  // Saturday, last day
+  addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 9));          // next Sunday
+  setMarker(FlushFrequency::weekly, localTime(2030, 6, 5));
+  saveOrLogError(store->managedObjectContext());
+  makeGenerator()->aggregateNext(FlushFrequency::weekly);
+  auto envelopes = usageEnvelopes();
+  ASSERT_EQ(envelopes.size(), 4u);
+  EXPECT_EQ(envelopes[1].client(), 1);
+  EXPECT_EQ(envelopes[1].usagesincelookback().activedaysincollectionperiod(), 3u);
+  EXPECT_EQ(envelopes[1].configuredlookbacktimeindays(), 7);
+}
+
+TEST_F(CohortEnvelopes, AMonthAlsoWritesLookbackUsageAndOnePropensityEnvelope) {
+  addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 2, 10, 12));  // lookback only
+  addWayfinSession(localTime(2030, 2, 10, 12), {{VIRWayfinSession::goToSite, 1}, {VIRWayfinSession::other, 3}});
+  addWayfinSession(localTime(2030, 2, 3, 12), {{VIRWayfinSession::localTap, 9}});  // before the lookback
+  setMarker(FlushFrequency::monthly, localTime(2030, 3, 15));
+  saveOrLogError(store->managedObjectContext());
+
+  makeGenerator()->aggregateNext(FlushFrequency::monthly);
+
+  ASSERT_EQ(persisted.size(), 9u);
+  auto envelopes = usageEnvelopes();
+  ASSERT_EQ(envelopes.size(), 8u);
+  EXPECT_EQ(envelopes[1].configuredlookbacktimeindays(), 31);
+  EXPECT_EQ(envelopes[1].usagesincelookback().activedaysincollectionperiod(), 0u);
+  EXPECT_EQ(envelopes[5].client(), 1);
+  EXPECT_EQ(envelopes[5].configuredlookbacktimeindays(), 56);
+  EXPECT_EQ(envelopes[5].usagesincelookback().activedaysincollectionperiod(), 1u);
+  EXPECT_EQ(envelopes[5].collectionendtimestamp(), wholeSeconds(localTime(2030, 4, 1)));
+
+  ASSERT_EQ(persisted.back().whichKind_case(), CVCohortsFeedback::kPropensityEnvelope);
+  const auto& p = persisted.back().propensityenvelope();
+  EXPECT_EQ(p.configuredlookbacktimeindays(), 56);
+  EXPECT_EQ(p.collectionendtimestamp(), wholeSeconds(localTime(2030, 4, 1)));
+  ASSERT_TRUE(p.has_wayfinusagepropensity());
+  EXPECT_EQ(p.wayfinusagepropensity().gotosite(), "0.25");
+  EXPECT_EQ(p.wayfinusagepropensity().other(), "0.75");
+  EXPECT_EQ(p.wayfinusagepropensity().localtap(), "0");
+  EXPECT_EQ(p.wayfinusagepropensity().totalengagements(), 4);
+  EXPECT_FALSE(p.has_scoutlumeusagepropensity()) << "no engagement, no message";
+  EXPECT_FALSE(p.has_imagesusagepropensity());
+  EXPECT_TRUE(p.has_newsusagepropensity());
+  EXPECT_EQ(p.newsusagepropensity().ByteSizeLong(), 0u);
+  EXPECT_EQ(p.uuid().size(), 16u);
+  EXPECT_EQ(offered.size(), 8u) << "only usage envelopes go to the listener";
+  EXPECT_EQ(marker(FlushFrequency::monthly), localTime(2030, 4, 1));
+}
+
+TEST_F(CohortEnvelopes, TheLookbackIs56DaysWithoutABagAndTheBagsValueOtherwise) {
+  EXPECT_EQ(makeGenerator()->cohortsLookbackInDays(), 56);
+  EXPECT_EQ(makeGenerator(ConfigurationBag(PropertyList{{"feedback_url", "https://x"}}))->cohortsLookbackInDays(), 56);
+  auto generator = makeGenerator(ConfigurationBag(PropertyList{{"cohorts_lookback_in_days", 28}}));
+  EXPECT_EQ(generator->cohortsLookbackInDays(), 28);
+  EXPECT_EQ(generator->dateRangeForLookbackPeriod(localTime(2030, 3, 15)),
+            (DateInterval{localTime(2030, 3, 4), localTime(2030, 4, 1)}));
+  EXPECT_EQ(makeGenerator()->dateRangeForLookbackPeriod(localTime(2028, 3, 31, 23)),
+            (DateInterval{localTime(2028, 2, 5), localTime(2028, 4, 1)}));
+}
+
+TEST_F(CohortEnvelopes, SharesUseAFullStopWhateverTheLocale) {
+  icu::Locale previous = icu::Locale::getDefault();
+  UErrorCode status = U_ZERO_ERROR;
+  icu::Locale::setDefault(icu::Locale("de_DE"), status);
+  addWayfinSession(localTime(2030, 3, 2), {{VIRWayfinSession::goToSite, 1}, {VIRWayfinSession::localTap, 2}});
+  saveOrLogError(store->managedObjectContext());
+  auto envelopes = makeGenerator()->generatePropensityFeedback(localTime(2030, 3, 1), localTime(2030, 4, 1));
+  icu::Locale::setDefault(previous, status);
+  ASSERT_EQ(envelopes.size(), 1u);
+  EXPECT_EQ(envelopes[0].wayfinusagepropensity().gotosite(), "0.33");
+  EXPECT_EQ(envelopes[0].wayfinusagepropensity().localtap(), "0.67");
+  EXPECT_EQ(envelopes[0].wayfinusagepropensity().totalengagements(), 3);
+}
+
+TEST_F(CohortEnvelopes, TotalEngagementsAreBucketedByFifty) {
+  addWayfinSession(localTime(2030, 3, 2), {{VIRWayfinSession::vireonTap, 90}});
+  addWayfinSession(localTime(2030, 3, 3), {{VIRWayfinSession::other, 30}});
+  saveOrLogError(store->managedObjectContext());
+  auto envelopes = makeGenerator()->generatePropensityFeedback(localTime(2030, 3, 1), localTime(2030, 4, 1));
+  EXPECT_EQ(envelopes[0].wayfinusagepropensity().totalengagements(), 100);
+  EXPECT_EQ(envelopes[0].wayfinusagepropensity().vireontap(), "0.75");
+}
+
+TEST(EngagementBuckets, BelowTheBucketExactAboveRoundedDown) {
+  EXPECT_EQ(CohortFeedbackGenerator::bucketEngagementCount(0, 50), 0u);
+  EXPECT_EQ(CohortFeedbackGenerator::bucketEngagementCount(49, 50), 49u);
+  EXPECT_EQ(CohortFeedbackGenerator::bucketEngagementCount(50, 50), 50u);
+  EXPECT_EQ(CohortFeedbackGenerator::bucketEngagementCount(51, 50), 50u);
+  EXPECT_EQ(CohortFeedbackGenerator::bucketEngagementCount(149, 50), 100u);
+}
+
+TEST(EngagementBuckets, ABucketOfZeroStopsTheProcess) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(CohortFeedbackGenerator::bucketEngagementCount(0, 0), "bucket size of zero");
+}
+
+TEST_F(CohortEnvelopes, InTheDaemonEnvelopesBecomeUsageFilesAndReachTheListenerOnTheWorkQueue) {
+  auto listener = std::make_shared<RecordingConduit>();
+  env.assembly().setCohortsListener(listener);
+  fs::create_directories(env.cacheDir() / "CustomFeedback");
+  setMarker(FlushFrequency::daily, localTime(2030, 6, 5, 10));
+  CohortFeedbackGenerator generator(env.assembly(), *store, std::make_shared<SeededRandomSource>(1),
+                                    CohortCalendar("America/New_York", "en_US"));
+  generator.aggregateNext(FlushFrequency::daily);
+
+  fs::path usageDir = env.cacheDir() / "CustomFeedback" / "Usage";
+  std::vector<fs::path> files;
+  for (const auto& entry : fs::directory_iterator(usageDir)) files.push_back(entry.path());
+  ASSERT_EQ(files.size(), 4u);
+  std::set<int> clients;
+  for (const auto& file : files) {
+    EXPECT_EQ(file.filename().string().rfind("cohorts.", 0), 0u) << file;
+    struct stat st {};
+    ASSERT_EQ(stat(file.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+    clients.insert(decode(readFile(file)).usageenvelope().client());
+  }
+  EXPECT_EQ(clients, (std::set<int>{1, 2, 3, 4}));
+  EXPECT_TRUE(listener->received.empty()) << "delivered on the work queue, not the store's";
+  env.manualQueue->drain();
+  ASSERT_EQ(listener->received.size(), 4u);
+  EXPECT_EQ(decode(listener->received[0]).usageenvelope().client(), 2);
+}
+
+// --- The cohort flush of one flush ----------------------------------------
+
+TEST_F(CohortEnvelopes, TheCohortFlushAggregatesDueDaysAndPurgesOnlyWhatNoPeriodNeeds) {
+  fs::create_directories(env.cacheDir() / "CustomFeedback");
+  env.writeBag({{"cohorts_lookback_in_days", 7}});
+  for (auto f : kAllFlushFrequencies) setMarker(f, localTime(2030, 6, 10, 12));
+  addSentinel(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, localTime(2030, 4, 1));  // long gone
+  addSentinel(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, localTime(2030, 6, 1));  // this month's
+  addSentinel(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, localTime(2030, 6, 10, 13));
+  saveOrLogError(store->managedObjectContext());
+  env.clock->set(localTime(2030, 6, 12, 6));
+
+  CohortsUsageStore usage(env.assembly(), std::move(store), std::make_shared<SeededRandomSource>(5));
+  FlushUsageStore& flush = usage;
+  flush.flushCohortsFeedback();
+  onStore(usage.store(), [] {});
+
+  std::vector<corevireon::CVUsageEnvelope> envelopes;
+  for (const auto& entry : fs::directory_iterator(env.cacheDir() / "CustomFeedback" / "Usage")) {
+    envelopes.push_back(decode(readFile(entry.path())).usageenvelope());
+  }
+  // 10 June is certain (30 hours ago); 11 June ended 6 hours ago.
+  ASSERT_TRUE(envelopes.size() == 4u || envelopes.size() == 8u) << envelopes.size();
+  bool sawJune10 = false;
+  for (const auto& e : envelopes) {
+    if (e.client() == 2 && e.collectionendtimestamp() == wholeSeconds(localTime(2030, 6, 11))) {
+      sawJune10 = true;
+      EXPECT_EQ(e.usagesincelookback().activedaysincollectionperiod(), 1u);
+    }
+  }
+  EXPECT_TRUE(sawJune10);
+  // The month of June is still to be aggregated and needs its lookback: the
+  // 1 June sentinel stays, the April one is purged.
+  RawDatabase raw(databasePath());
+  EXPECT_EQ(raw.count("VIRUsageEvent"), 2);
+  EXPECT_EQ(raw.scalar("SELECT count(*) FROM VIRUsageEvent WHERE timestamp < " +
+                       std::to_string(secondsSinceEpoch(localTime(2030, 5, 1)))),
+            "0");
+  flush.resetRowCache();
+}
+
+TEST_F(CohortEnvelopes, TheFlushCountsSessionsThroughItsUsageSink) {
+  CohortsUsageStore usage(env.assembly(), std::move(store), nullptr);
+  FlushUsageStore& flush = usage;
+  auto session = makeSession("Messages", localTime(2030, 6, 1, 8));
+  addResultEngagement(session, ResultSpec{});
+  flush.usageEventSink()->reportUsageEvents(session);
+  RawDatabase raw(databasePath());
+  EXPECT_EQ(raw.count("VIRImagesSession"), 1);
+}
+
+}  // namespace
+}  // namespace fbf::testing

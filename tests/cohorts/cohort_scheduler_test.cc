@@ -1,0 +1,188 @@
+// When cohorts are due: the period boundary, the age-weighted coin and
+// catching up after idle periods, with a seeded coin and a store whose
+// markers are set by hand.
+
+#include "cohorts/cohort_scheduler.h"
+#include "cohorts_test_support.h"
+
+#include <gtest/gtest.h>
+
+namespace fbf::testing {
+namespace {
+
+// Aggregates nothing; records each period it was asked for and advances the
+// marker as the real generator does.
+class RecordingGenerator final : public CohortFeedbackGeneratorProtocol {
+ public:
+  RecordingGenerator(DataStorageContainerProtocol& store, CohortCalendar calendar)
+      : store_(store), calendar_(std::move(calendar)) {}
+  void aggregateNext(FlushFrequency f) override {
+    auto& marker = store_.lastAggregations()[f];
+    auto range = calendar_.containingCaptureRange(f, *marker->timestamp());
+    periods.emplace_back(f, *range);
+    marker->setTimestamp(range->end);
+  }
+  std::vector<DateInterval> periodsOf(FlushFrequency f) const {
+    std::vector<DateInterval> out;
+    for (const auto& [freq, range] : periods) {
+      if (freq == f) out.push_back(range);
+    }
+    return out;
+  }
+  std::vector<std::pair<FlushFrequency, DateInterval>> periods;
+
+ private:
+  DataStorageContainerProtocol& store_;
+  CohortCalendar calendar_;
+};
+
+class CohortSchedule : public StoreFixture {
+ protected:
+  void SetUp() override {
+    makeCohortsDirectory();
+    store = bringUpAndSettle();
+    ASSERT_NE(store, nullptr);
+  }
+  void setMarker(FlushFrequency f, SystemTime t) {
+    onStore(*store, [&] { store->lastAggregations()[f]->setTimestamp(t); });
+  }
+  void setAllMarkers(SystemTime t) {
+    for (auto f : kAllFlushFrequencies) setMarker(f, t);
+  }
+  CohortScheduler& makeScheduler(SystemTime today, uint64_t seed = 1) {
+    CohortCalendar calendar("America/New_York", "en_US");
+    auto generator = std::make_unique<RecordingGenerator>(*store, calendar);
+    recorder = generator.get();
+    scheduler = std::make_unique<CohortScheduler>(*store, std::move(generator), today, calendar,
+                                                  std::make_shared<SeededRandomSource>(seed));
+    return *scheduler;
+  }
+  bool shouldAggregate(FlushFrequency f) {
+    bool answer = false;
+    onStore(*store, [&] { answer = scheduler->shouldAggregate(f); });
+    return answer;
+  }
+
+  ScopedTimeZone newYork{"America/New_York"};
+  std::unique_ptr<ObjectGraphStorageContainer> store;
+  std::unique_ptr<CohortScheduler> scheduler;
+  RecordingGenerator* recorder = nullptr;
+};
+
+TEST_F(CohortSchedule, APeriodEndingExactlyTodayIsNotDue) {
+  setMarker(FlushFrequency::daily, localTime(2030, 6, 5, 10));
+  for (uint64_t seed = 0; seed < 50; ++seed) {
+    makeScheduler(localTime(2030, 6, 6), seed);
+    EXPECT_FALSE(shouldAggregate(FlushFrequency::daily));
+  }
+}
+
+TEST_F(CohortSchedule, TheFirstHourAfterThePeriodNeverGenerates) {
+  setMarker(FlushFrequency::daily, localTime(2030, 6, 5, 10));
+  for (uint64_t seed = 0; seed < 200; ++seed) {
+    makeScheduler(localTime(2030, 6, 6, 0, 59, 59), seed);
+    EXPECT_FALSE(shouldAggregate(FlushFrequency::daily)) << "seed " << seed;
+  }
+}
+
+TEST_F(CohortSchedule, TwentyFourHoursAfterThePeriodAlwaysGenerates) {
+  setMarker(FlushFrequency::daily, localTime(2030, 6, 5, 10));
+  for (uint64_t seed = 0; seed < 200; ++seed) {
+    makeScheduler(localTime(2030, 6, 7), seed);
+    EXPECT_TRUE(shouldAggregate(FlushFrequency::daily)) << "seed " << seed;
+  }
+}
+
+TEST_F(CohortSchedule, WithoutAMaximumAgeEveryEndedPeriodGenerates) {
+  setMarker(FlushFrequency::daily, localTime(2030, 6, 5, 10));
+  for (int64_t maxAge : {0, -5}) {
+    makeScheduler(localTime(2030, 6, 6, 0, 0, 1)).setMaxAgeInHours(maxAge);
+    EXPECT_TRUE(shouldAggregate(FlushFrequency::daily));
+  }
+}
+
+TEST_F(CohortSchedule, AFrequencyWithoutAMarkerIsNeverAggregated) {
+  onStore(*store, [&] { store->lastAggregations().erase(FlushFrequency::weekly); });
+  makeScheduler(localTime(2040, 1, 1));
+  EXPECT_FALSE(shouldAggregate(FlushFrequency::weekly));
+}
+
+TEST_F(CohortSchedule, ThreeSkippedDaysGiveUpToThreeDailyPeriods) {
+  bool sawTwo = false, sawThree = false;
+  for (uint64_t seed = 0; seed < 40; ++seed) {
+    // Wednesday 5 June; the week (Sunday to Saturday) and the month run on.
+    setAllMarkers(localTime(2030, 6, 5, 10));
+    makeScheduler(localTime(2030, 6, 8, 12), seed).doPeriodicUsageCalculations();
+    auto days = recorder->periodsOf(FlushFrequency::daily);
+    ASSERT_GE(days.size(), 2u) << "days that ended 36 hours or more ago always generate";
+    ASSERT_LE(days.size(), 3u);
+    EXPECT_EQ(days[0], (DateInterval{localTime(2030, 6, 5), localTime(2030, 6, 6)}));
+    EXPECT_EQ(days[1], (DateInterval{localTime(2030, 6, 6), localTime(2030, 6, 7)}));
+    if (days.size() == 3) {
+      EXPECT_EQ(days[2], (DateInterval{localTime(2030, 6, 7), localTime(2030, 6, 8)}));
+    }
+    (days.size() == 2 ? sawTwo : sawThree) = true;
+    EXPECT_TRUE(recorder->periodsOf(FlushFrequency::weekly).empty());
+    EXPECT_TRUE(recorder->periodsOf(FlushFrequency::monthly).empty());
+  }
+  EXPECT_TRUE(sawTwo && sawThree) << "the 12-hour-old day passes its own coin about half the time";
+}
+
+TEST_F(CohortSchedule, TheCoinRateAtHHoursIsHOver24) {
+  SystemTime today = localTime(2030, 6, 10, 12);
+  makeScheduler(today, 20240601);
+  constexpr int kDraws = 24000;
+  for (int h : {1, 6, 12, 18, 23}) {
+    int heads = 0;
+    for (int i = 0; i < kDraws; ++i) heads += scheduler->flipAgeWeightedCoin(today - hours(h)) ? 1 : 0;
+    EXPECT_NEAR(static_cast<double>(heads) / kDraws, h / 24.0, 0.015) << h << " hours";
+  }
+}
+
+TEST_F(CohortSchedule, CatchingUpMonthsCoversLeapFebruary) {
+  setAllMarkers(localTime(2028, 1, 15));
+  makeScheduler(localTime(2028, 4, 10)).doPeriodicUsageCalculations();
+  auto months = recorder->periodsOf(FlushFrequency::monthly);
+  ASSERT_EQ(months.size(), 3u);
+  EXPECT_EQ(months[1], (DateInterval{localTime(2028, 2, 1), localTime(2028, 3, 1)}));
+  EXPECT_EQ(months[1].end - months[1].start, hours(29 * 24));
+  EXPECT_EQ(months[2].start, localTime(2028, 3, 1));
+}
+
+TEST_F(CohortSchedule, DaylightSavingDaysAreAggregatedWhole) {
+  setAllMarkers(localTime(2030, 11, 2, 18));
+  makeScheduler(localTime(2030, 11, 6, 6)).doPeriodicUsageCalculations();
+  auto days = recorder->periodsOf(FlushFrequency::daily);
+  ASSERT_GE(days.size(), 3u);
+  EXPECT_EQ(days[1].start, localTime(2030, 11, 3));
+  EXPECT_EQ(days[1].end - days[1].start, hours(25));
+  EXPECT_EQ(days[2].end - days[2].start, hours(24));
+
+  setAllMarkers(localTime(2030, 3, 9, 18));
+  makeScheduler(localTime(2030, 3, 12, 6)).doPeriodicUsageCalculations();
+  days = recorder->periodsOf(FlushFrequency::daily);
+  ASSERT_GE(days.size(), 2u);
+  EXPECT_EQ(days[1].end - days[1].start, hours(23));
+}
+
+TEST_F(CohortSchedule, TheWeekAcrossNewYearIsOnePeriod) {
+  setAllMarkers(localTime(2030, 12, 30, 9));
+  makeScheduler(localTime(2031, 1, 10)).doPeriodicUsageCalculations();
+  auto weeks = recorder->periodsOf(FlushFrequency::weekly);
+  ASSERT_EQ(weeks.size(), 1u);
+  EXPECT_EQ(weeks[0], (DateInterval{localTime(2030, 12, 29), localTime(2031, 1, 5)}));
+  ASSERT_EQ(recorder->periodsOf(FlushFrequency::monthly).size(), 1u);
+}
+
+TEST_F(CohortSchedule, TodayAndEagernessComeFromTheAssembly) {
+  env.clock->set(localTime(2031, 2, 3, 4));
+  env.assembly().setFlushingEagerly(true);
+  CohortScheduler fromAssembly(env.assembly(), *store, std::make_shared<SeededRandomSource>(3));
+  EXPECT_EQ(fromAssembly.today(), localTime(2031, 2, 3, 4));
+  EXPECT_TRUE(fromAssembly.isFlushingEagerly());
+  env.clock->advance(hours(48));
+  EXPECT_EQ(fromAssembly.today(), localTime(2031, 2, 3, 4)) << "fixed at construction";
+}
+
+}  // namespace
+}  // namespace fbf::testing

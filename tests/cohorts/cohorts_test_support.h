@@ -1,0 +1,189 @@
+// Shared pieces of the cohort tests: a time zone set for one test, local
+// dates, session builders, a raw SQLite handle for looking at the file from
+// outside, and a fixture with a real store in a temporary cache directory.
+#pragma once
+
+#include "cohorts/object_graph_storage_container.h"
+#include "corevireon.pb.h"
+#include "support/test_support.h"
+
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <cstdlib>
+#include <ctime>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+namespace fbf::testing {
+
+// Sets TZ (and the C library's zone) for the lifetime of the object.
+class ScopedTimeZone {
+ public:
+  explicit ScopedTimeZone(const char* zone) {
+    if (const char* old = std::getenv("TZ")) previous_ = old;
+    setenv("TZ", zone, 1);
+    tzset();
+  }
+  ~ScopedTimeZone() {
+    if (previous_) {
+      setenv("TZ", previous_->c_str(), 1);
+    } else {
+      unsetenv("TZ");
+    }
+    tzset();
+  }
+
+ private:
+  std::optional<std::string> previous_;
+};
+
+// A wall-clock time in the current TZ.
+inline SystemTime localTime(int year, int month, int day, int hour = 0, int minute = 0, int second = 0) {
+  std::tm tm{};
+  tm.tm_year = year - 1900;
+  tm.tm_mon = month - 1;
+  tm.tm_mday = day;
+  tm.tm_hour = hour;
+  tm.tm_min = minute;
+  tm.tm_sec = second;
+  tm.tm_isdst = -1;
+  return std::chrono::system_clock::from_time_t(std::mktime(&tm));
+}
+
+inline SystemTime utcTime(int year, int month, int day, int hour = 0, int minute = 0, int second = 0) {
+  std::tm tm{};
+  tm.tm_year = year - 1900;
+  tm.tm_mon = month - 1;
+  tm.tm_mday = day;
+  tm.tm_hour = hour;
+  tm.tm_min = minute;
+  tm.tm_sec = second;
+  return std::chrono::system_clock::from_time_t(timegm(&tm));
+}
+
+using std::chrono::hours;
+using std::chrono::minutes;
+using std::chrono::seconds;
+
+// --- Sessions ---------------------------------------------------------------
+
+inline corevireon::CVClientSession makeSession(const std::string& agent, SystemTime start) {
+  corevireon::CVClientSession s;
+  s.set_agent(agent);
+  s.set_sessionstart(secondsSinceEpoch(start));
+  s.mutable_feedbacks();
+  return s;
+}
+
+inline void addSearch(corevireon::CVClientSession& s, const std::string& input = "weather") {
+  s.mutable_feedbacks()->add_items()->mutable_startlocalsearch()->set_input(input);
+}
+
+struct ResultSpec {
+  std::optional<std::string> identifier = "r1";
+  int32_t knownResultBundleId = 0;
+  int32_t knownSectionBundleIdentifier = 0;
+  bool isLocalApplicationResult = false;
+  bool punchout = false;
+};
+
+inline corevireon::CVSearchResultForFeedback makeResult(const ResultSpec& spec) {
+  corevireon::CVSearchResultForFeedback r;
+  if (spec.identifier) r.set_identifier(*spec.identifier);
+  r.set_knownresultbundleid(spec.knownResultBundleId);
+  r.set_knownsectionbundleidentifier(spec.knownSectionBundleIdentifier);
+  r.set_islocalapplicationresult(spec.isLocalApplicationResult);
+  if (spec.punchout) r.mutable_punchout()->set_bundleidentifier("com.example.app");
+  return r;
+}
+
+inline void addResultEngagement(corevireon::CVClientSession& s, std::optional<ResultSpec> result,
+                                corevireon::CVTriggerEngagementEvent trigger = corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP,
+                                int32_t destination = 0) {
+  auto* e = s.mutable_feedbacks()->add_items()->mutable_resultengagement();
+  if (result) *e->mutable_result() = makeResult(*result);
+  e->set_triggerevent(trigger);
+  e->set_destination(destination);
+}
+
+inline void addVisibleResult(corevireon::CVClientSession& s, const ResultSpec& result) {
+  *s.mutable_feedbacks()->add_items()->mutable_visibleresults()->add_results() = makeResult(result);
+}
+
+inline void addDidGoToSite(corevireon::CVClientSession& s) { s.mutable_feedbacks()->add_items()->mutable_didgotosite(); }
+inline void addDidGoToSearch(corevireon::CVClientSession& s) {
+  s.mutable_feedbacks()->add_items()->mutable_didgotosearch();
+}
+
+// --- Looking at the file from outside ---------------------------------------
+
+class RawDatabase {
+ public:
+  explicit RawDatabase(const fs::path& path) {
+    if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) != SQLITE_OK) {
+      ADD_FAILURE() << "cannot open " << path;
+    }
+  }
+  ~RawDatabase() { sqlite3_close_v2(db_); }
+  bool exec(const std::string& sql) {
+    char* message = nullptr;
+    int rc = sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &message);
+    if (rc != SQLITE_OK) {
+      lastError_ = message ? message : "error";
+      sqlite3_free(message);
+      return false;
+    }
+    return true;
+  }
+  // The first column of the first row, as text ("" when there is none).
+  std::string scalar(const std::string& sql) {
+    sqlite3_stmt* stmt = nullptr;
+    std::string out;
+    if (sqlite3_prepare_v2(db_, sql.c_str(), -1, &stmt, nullptr) == SQLITE_OK && sqlite3_step(stmt) == SQLITE_ROW) {
+      if (auto* text = sqlite3_column_text(stmt, 0)) out = reinterpret_cast<const char*>(text);
+    }
+    sqlite3_finalize(stmt);
+    return out;
+  }
+  int64_t count(const std::string& table) { return std::stoll(scalar("SELECT count(*) FROM " + table)); }
+  const std::string& lastError() const { return lastError_; }
+
+ private:
+  sqlite3* db_ = nullptr;
+  std::string lastError_;
+};
+
+// --- A store in a temporary cache directory ---------------------------------
+
+class StoreFixture : public ::testing::Test {
+ protected:
+  StoreFixture() : zone_("UTC") {}
+
+  fs::path cohortsDir() const { return env.cacheDir() / "Cohorts"; }
+  fs::path databasePath() const { return cohortsDir() / "cohorts.sqlite"; }
+  void makeCohortsDirectory() { fs::create_directories(cohortsDir()); }
+
+  std::unique_ptr<ObjectGraphStorageContainer> bringUp(FileManager* fileManager = nullptr) {
+    ObjectGraphStoreOptions options;
+    options.busyTimeout = std::chrono::milliseconds(0);
+    return ObjectGraphStorageContainer::make(fileManager ? *fileManager : *env.fileManager,
+                                             [this] { return env.clock->now(); }, options);
+  }
+  // Brings the store up and waits for the last aggregations to load.
+  std::unique_ptr<ObjectGraphStorageContainer> bringUpAndSettle() {
+    auto store = bringUp();
+    if (store) store->managedObjectContext().performAndWait([] {});
+    return store;
+  }
+  static void onStore(DataStorageContainerProtocol& store, const std::function<void()>& work) {
+    store.managedObjectContext().performAndWait(work);
+  }
+
+  ScopedTimeZone zone_;
+  TestEnvironment env;
+};
+
+}  // namespace fbf::testing
