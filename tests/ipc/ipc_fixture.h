@@ -1,0 +1,256 @@
+// A daemon's IPC side running in-process: a real listening socket in a
+// temporary runtime directory, a FlusherService over a real work queue, a
+// flush runner and an installed-app controller that record what they are
+// asked and complete when told. Clients connect over the socket from their
+// own threads.
+#pragma once
+
+#include "assembly/fbf_strings.h"
+#include "ipc/daemon_connection.h"
+#include "ipc/flusher_service.h"
+#include "support/test_support.h"
+
+#include <gtest/gtest.h>
+
+#include <asio.hpp>
+
+#include <chrono>
+#include <future>
+#include <mutex>
+#include <thread>
+
+namespace fbf::testing {
+
+// Polls `done` until it holds; gives up (returning false) only after a very
+// generous bound, so a hang fails the test instead of blocking the suite.
+template <class Predicate>
+bool eventually(Predicate done) {
+  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  while (!done()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  return true;
+}
+
+class FakeFlushRunner final : public FlushRunner {
+ public:
+  explicit FakeFlushRunner(fs::path cacheDir) : cacheDir_(std::move(cacheDir)) {}
+
+  void flushAll(std::function<void()> completion) override {
+    record("flushAll", std::move(completion));
+  }
+  void flushCustomFeedbackType(const std::string& type, std::function<void()> completion) override {
+    record("flushCustomFeedbackType " + type, std::move(completion));
+  }
+  std::optional<std::string> flushSessionEagerly(const fs::path& path,
+                                                 std::function<void()> completion) override {
+    if (path.parent_path() != cacheDir_)
+      return "refused: " + path.string() + " is outside the cache directory";
+    if (path.filename().string().rfind("session.", 0) != 0) {
+      return "refused: " + path.filename().string() + " is not a session file name";
+    }
+    record("flushSessionEagerly " + path.string(), std::move(completion));
+    return std::nullopt;
+  }
+  ipc::StatusReply status() override {
+    ipc::StatusReply reply;
+    auto* closed = reply.add_sessions();
+    closed->set_name("closed");
+    closed->set_files(3);
+    closed->set_bytes(4096);
+    closed->set_oldestageseconds(90);
+    auto* reports = reply.add_customfeedback();
+    reports->set_name("UserReport");
+    reports->set_files(1);
+    reports->set_bytes(10);
+    return reply;
+  }
+
+  // When held, completions wait for `releaseAll` (called on the work queue).
+  void holdCompletions(bool hold) {
+    std::lock_guard l(m_);
+    hold_ = hold;
+  }
+  void releaseAll() {
+    std::vector<std::function<void()>> held;
+    {
+      std::lock_guard l(m_);
+      held.swap(held_);
+    }
+    for (auto& c : held) c();
+  }
+  size_t heldCount() const {
+    std::lock_guard l(m_);
+    return held_.size();
+  }
+  std::vector<std::string> calls() const {
+    std::lock_guard l(m_);
+    return calls_;
+  }
+
+ private:
+  void record(std::string call, std::function<void()> completion) {
+    bool hold;
+    {
+      std::lock_guard l(m_);
+      calls_.push_back(std::move(call));
+      hold = hold_;
+      if (hold) held_.push_back(std::move(completion));
+    }
+    if (!hold) completion();
+  }
+
+  fs::path cacheDir_;
+  mutable std::mutex m_;
+  bool hold_ = false;
+  std::vector<std::string> calls_;
+  std::vector<std::function<void()>> held_;
+};
+
+// Stores a signature derived from the condition, then completes.
+class FakeInstalledAppController final : public InstalledAppControllerProtocol {
+ public:
+  explicit FakeInstalledAppController(UserDefaults& defaults) : defaults_(defaults) {}
+  void updateWhitelists(uint64_t condition, std::function<void()> completion) override {
+    conditions.push_back(condition);
+    defaults_.setObject(FBFStrings::kVIRAppWhitelistSignatureKey,
+                        "signature-" + std::to_string(condition));
+    if (completion) completion();
+  }
+  std::vector<uint64_t> conditions;  // work queue only
+
+ private:
+  UserDefaults& defaults_;
+};
+
+class FixedDeviceContext final : public DeviceContextProtocol {
+ public:
+  std::optional<std::string> localeIdentifier() const override { return "en_US"; }
+  std::optional<std::string> country() const override { return "US"; }
+  std::optional<std::string> deviceModel() const override { return "TestBox1,1"; }
+  std::optional<std::string> osVersion() const override { return "1.0"; }
+  std::string userAgent() const override { return "test"; }
+};
+
+class IpcFixture : public ::testing::Test {
+ protected:
+  // Whether the assembly has an installed-app controller.
+  virtual bool withWhitelistController() const { return true; }
+
+  void SetUp() override {
+    FBFAssemblyDependencies deps;
+    deps.preferences = env.preferences;
+    deps.fileManager = env.fileManager;
+    deps.clock = env.clock;
+    deps.analytics = env.analytics;
+    deps.transactions = env.transactions;
+    deps.deviceContext = std::make_shared<FixedDeviceContext>();
+    if (withWhitelistController()) {
+      deps.installedAppControllerFactory = [this](FBFAssembly& a) {
+        auto c = std::make_unique<FakeInstalledAppController>(a.userDefaults());
+        controller = c.get();
+        return c;
+      };
+    }
+    assembly = std::make_unique<FBFAssembly>(std::move(deps));
+    runner = std::make_shared<FakeFlushRunner>(env.cacheDir());
+    service = std::make_unique<FlusherService>(*assembly, runner);
+
+    fs::create_directories(env.dirs.runtimeDir);
+    acceptor.emplace(io, asio::local::stream_protocol::endpoint(socketPath().string()));
+    acceptNext();
+    ioThread = std::thread([this] { io.run(); });
+  }
+
+  void TearDown() override {
+    std::promise<void> acceptorClosed;
+    asio::post(io, [&] {
+      acceptor->close();
+      acceptorClosed.set_value();
+    });
+    acceptorClosed.get_future().wait();
+    service.reset();
+    // Let the closes run and their invalidations reach the work queue.
+    std::promise<void> ioIdle;
+    asio::post(io, [&] { ioIdle.set_value(); });
+    ioIdle.get_future().wait();
+    runner->holdCompletions(false);
+    assembly->workloop().sync([this] {
+      runner->releaseAll();
+      assembly->setUploadListener(nullptr);
+      assembly->setCohortsListener(nullptr);
+    });
+    guard.reset();
+    io.stop();
+    ioThread.join();
+    assembly.reset();
+  }
+
+  fs::path socketPath() const { return env.dirs.socketPath(); }
+
+  std::shared_ptr<ipc::DaemonConnection> connectClient() {
+    std::string error;
+    auto c = ipc::DaemonConnection::connect(socketPath(), &error);
+    EXPECT_TRUE(c) << error;
+    return c;
+  }
+
+  size_t openConnections() {
+    size_t n = 0;
+    assembly->workloop().sync([&] { n = service->openConnectionCount(); });
+    return n;
+  }
+  std::shared_ptr<ClientConduit> uploadListener() {
+    std::shared_ptr<ClientConduit> l;
+    assembly->workloop().sync([&] { l = assembly->uploadListener(); });
+    return l;
+  }
+  std::shared_ptr<ClientConduit> cohortsListener() {
+    std::shared_ptr<ClientConduit> l;
+    assembly->workloop().sync([&] { l = assembly->cohortsListener(); });
+    return l;
+  }
+
+  LogCapture logs;
+  asio::io_context io;
+  asio::executor_work_guard<asio::io_context::executor_type> guard{io.get_executor()};
+  TestEnvironment env{true};
+  std::unique_ptr<FBFAssembly> assembly;
+  FakeInstalledAppController* controller = nullptr;
+  std::shared_ptr<FakeFlushRunner> runner;
+  std::unique_ptr<FlusherService> service;
+  std::optional<asio::local::stream_protocol::acceptor> acceptor;
+  std::thread ioThread;
+
+ private:
+  void acceptNext() {
+    acceptor->async_accept(
+        [this](const std::error_code& ec, asio::local::stream_protocol::socket socket) {
+          if (ec) return;
+          if (service) service->accept(std::move(socket));
+          acceptNext();
+        });
+  }
+};
+
+// Sends one request and waits for its answer or for the reason none came.
+struct Answer {
+  std::optional<ipc::DaemonMessage> message;
+  std::string error;
+};
+inline Answer ask(ipc::DaemonConnection& connection, ipc::Request request) {
+  auto promise = std::make_shared<std::promise<Answer>>();
+  auto future = promise->get_future();
+  connection.send(
+      std::move(request),
+      [promise](const ipc::DaemonMessage& m) {
+        promise->set_value({m, ""});
+      },
+      [promise](const std::string& e) {
+        promise->set_value({std::nullopt, e});
+      });
+  return future.get();
+}
+
+}  // namespace fbf::testing
