@@ -56,6 +56,11 @@ class FBFAssembly final : public FBFAssemblyProtocol {
   bool shouldProceed() override;
   bool isCancelled() override { return cancelled_.load(); }
   void setCancelled(bool c) override { cancelled_.store(c); }
+  bool isTerminating() override { return terminating_.load(); }
+  void setTerminating() override {
+    terminating_.store(true);
+    cancelled_.store(true);
+  }
   bool isDiagnosticsAndUsageEnabled() override;
   bool isFlushingEagerly() override { return flushingEagerly_.load(); }
   void setFlushingEagerly(bool e) override { flushingEagerly_.store(e); }
@@ -90,6 +95,7 @@ class FBFAssembly final : public FBFAssemblyProtocol {
   Atomic<bool> flushingEagerly_{false};
   Atomic<bool> cellularUploads_{false};
   Atomic<bool> cancelled_{false};
+  Atomic<bool> terminating_{false};
 };
 
 }  // namespace fbf

@@ -78,6 +78,10 @@ class FBFAssemblyProtocol {
   virtual bool shouldProceed() = 0;
   virtual bool isCancelled() = 0;
   virtual void setCancelled(bool cancelled) = 0;
+  // Set by a termination signal: cancels for the rest of the process, where
+  // an offline cancellation only stops the flush it happened in.
+  virtual bool isTerminating() { return false; }
+  virtual void setTerminating() {}
   virtual bool isDiagnosticsAndUsageEnabled() = 0;
   virtual bool isFlushingEagerly() = 0;
   virtual void setFlushingEagerly(bool eager) = 0;

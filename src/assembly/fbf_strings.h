@@ -35,6 +35,14 @@ struct FBFStrings {
     // Domain "vireond": certificate pinning and trust for uploads.
     static constexpr std::string_view UploadPinnedPublicKeys = "VIRUploadPinnedPublicKeys";
     static constexpr std::string_view UploadCAFile = "VIRUploadCAFile";
+    // The search UI's preferences: the bundles disabled for search.
+    static constexpr std::string_view SearchUIDomain = "vireon.scoutlume";
+    static constexpr std::string_view DisabledApplications = "DisabledApplications";
+    // The voice assistant's preferences.
+    static constexpr std::string_view AssistantDomain = "vireon.assistant";
+    static constexpr std::string_view AssistantEnabled = "Assistant Enabled";
+    // Domain "vireond", for tests: seconds a "soon" whitelist update waits.
+    static constexpr std::string_view WhitelistSoonDelaySeconds = "VIRWhitelistSoonDelaySeconds";
   };
 
   static constexpr std::string_view FBFReverseDomainIdentifier = "vireon-fbf";
@@ -44,6 +52,9 @@ struct FBFStrings {
   static constexpr std::string_view UploadSessionTransactionName = "vireon-fbf.urlSession";
   static constexpr std::string_view FeedbackLossEventName = "vireond.feedbackLoss";
   static constexpr std::string_view kVIRAppWhitelistSignatureKey = "VIRAppWhitelistSignature";
+  static constexpr std::string_view LowPriorityQueueLabel = "vireon-fbf.lowPriority";
+  static constexpr std::string_view WhitelistTransactionName = "vireon-fbf.transaction";
+  static constexpr std::string_view SKAppDataChangedNotification = "vireon-fbf.skapp_data_changed";
   static constexpr std::string_view VIRFileDownloadCompletedNotification = "VIRFileDownloadCompletedNotification";
   static constexpr std::string_view VireonFeedbackType = "FeedbackV2";
   static constexpr std::string_view VireonProtobufFeedbackType = "FeedbackV2PB";

@@ -12,13 +12,13 @@
 
 namespace fbf {
 
-// Raw values of the shared framework's deletion reasons that callers pass.
+// Raw values of the deletion reasons (CVFeedbackDeletionReason) that callers pass.
 struct FeedbackDeletionReason {
   static constexpr int32_t tooOld = 1;
   static constexpr int32_t tooLarge = 2;
   static constexpr int32_t empty = 3;
-  static constexpr int32_t noConsent = 4;
-  static constexpr int32_t pruned = 5;
+  static constexpr int32_t pruned = 4;
+  static constexpr int32_t noConsent = 5;
   static constexpr int32_t unreadable = 6;
   static constexpr int32_t uploaded = 12;
 };

@@ -1,7 +1,14 @@
 #include "daemon/daemon.h"
 
 #include "assembly/fbf_strings.h"
+#include "cohorts/cohorts_usage_store.h"
+#include "daemon/daemon_flush_runner.h"
 #include "daemon/listener_socket.h"
+#include "daemon/periodic_activity.h"
+#include "ipc/flusher_service.h"
+#include "platform/curl_http_session.h"
+#include "upload/upload_manager.h"
+#include "whitelist/installed_app_controller.h"
 #include "platform/change_watcher.h"
 #include "platform/logging.h"
 #include "platform/device_info.h"
@@ -58,10 +65,48 @@ class LinuxDaemon final : public Daemon {
     deps.analytics = makeJsonLinesAnalyticsSink(dirs.analyticsFile(), *fm, *clock);
     deps.transactions = transactions_;
     deps.deviceContext = std::make_shared<DeviceContext>(*deviceInfo, kDaemonNameAndVersion);
+    deps.httpSessionFactory = makeCurlHttpSession;
+    deps.installedAppControllerFactory = [dirs](FBFAssembly& a) { return makeInstalledAppController(a, dirs); };
     assembly_ = std::make_unique<FBFAssembly>(std::move(deps));
 
     // 3. Serve clients.
+    auto flusherDependencies = [] {
+      FlusherDependencies d;
+      d.uploadManagerFactory = UploadManager::factory();
+      d.usageStoreFactory = [](FBFAssemblyProtocol& a) -> std::unique_ptr<FlushUsageStore> {
+        return CohortsUsageStore::make(a);
+      };
+      return d;
+    };
+    service_ = std::make_unique<FlusherService>(
+        *assembly_, std::make_shared<DaemonFlushRunner>(*assembly_, flusherDependencies));
     if (acceptor_) accept();
+
+    // 4. The periodic flush.
+    PeriodicActivityHooks hooks;
+    hooks.beginFlush = [this, flusherDependencies](std::function<void()> completion) -> std::function<void()> {
+      auto flusher = FeedbackFlusher::make(*assembly_, flusherDependencies());
+      flusher->beginEnumeratingFeedback({}, std::move(completion));
+      return [flusher] { flusher->stopEnumeratingFeedback(); };
+    };
+    hooks.invalidateListener = [this] {
+      asio::post(io_, [this] {
+        std::error_code ec;
+        if (acceptor_) acceptor_->close(ec);
+      });
+    };
+    hooks.onMainQueueAfter = [this](std::chrono::seconds delay, std::function<void()> task) {
+      auto timer = std::make_shared<asio::steady_timer>(io_, delay);
+      timer->async_wait([timer, task = std::move(task)](const std::error_code& ec) {
+        if (!ec) task();
+      });
+    };
+    hooks.requestCleanExit = [this] { transactions_->requestCleanExit(); };
+    activityQueue_ = makeSerialQueue("vireon-fbf.activity");
+    auto cacheDir = dirs.cacheHome / FBFStrings::VireondReverseDomainIdentifier;
+    scheduler_ = std::make_unique<PeriodicActivityScheduler>(*assembly_, activityQueue_, makeSysfsPowerSource(),
+                                                             std::move(hooks), cacheDir / "fbf-last-flush");
+    scheduler_->start();
 
     // 5./6. Application and preference changes invalidate the whitelist.
     std::vector<WatchSpec> specs;
@@ -94,7 +139,7 @@ class LinuxDaemon final : public Daemon {
     signals_.async_wait([this](const std::error_code& ec, int signo) {
       if (ec) return;
       mainLog().debug(signo == SIGINT ? "fbf got SIGINT" : "fbf got SIGTERM");
-      assembly_->setCancelled(true);
+      assembly_->setTerminating();
       transactions_->requestCleanExit();
       waitForSignal();
     });
@@ -108,11 +153,7 @@ class LinuxDaemon final : public Daemon {
     });
   }
 
-  void onConnection(asio::local::stream_protocol::socket socket) {
-    // No service answers yet: refuse politely by closing.
-    std::error_code ec;
-    socket.close(ec);
-  }
+  void onConnection(asio::local::stream_protocol::socket socket) { service_->accept(std::move(socket)); }
 
   DaemonOptions options_;
   asio::io_context io_;
@@ -120,6 +161,10 @@ class LinuxDaemon final : public Daemon {
   std::shared_ptr<TransactionRegistry> transactions_;
   std::optional<UnixAcceptor> acceptor_;
   std::unique_ptr<FBFAssembly> assembly_;
+  // Destroyed before the assembly: closes every open connection.
+  std::unique_ptr<FlusherService> service_;
+  std::shared_ptr<TaskQueue> activityQueue_;
+  std::unique_ptr<PeriodicActivityScheduler> scheduler_;
   std::unique_ptr<ChangeWatcher> watcher_;
 };
 

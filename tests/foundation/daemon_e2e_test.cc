@@ -45,7 +45,8 @@ TEST(DaemonStartUp, LeavesAFileThatIsNotASocketAlone) {
   writeFile(socket, "not a socket");
   ChildProcess daemon(binDir() / "vireon-fbf", {}, env, home.path() / "out.log", home.path() / "err.log");
   ASSERT_TRUE(waitUntil([&] { return readFile(home.path() / "err.log").find("setup") != std::string::npos; },
-                        std::chrono::seconds(10)));
+                        std::chrono::seconds(10)))
+      << readFile(home.path() / "err.log");
   EXPECT_EQ(readFile(socket), "not a socket");
   EXPECT_NE(readFile(home.path() / "err.log").find("is not a socket"), std::string::npos);
   daemon.signal(SIGTERM);
