@@ -57,7 +57,7 @@ echo "== sample applications for the whitelist"
 if [ -f scripts/demo-apps.sh ]; then bash scripts/demo-apps.sh "$ROOT"; fi
 
 echo "== the daemon"
-"$BIN/vireon-fbf" 2>"$ROOT/daemon.log" &
+${DEMO_DAEMON_WRAPPER:-} "$BIN/vireon-fbf" 2>"$ROOT/daemon.log" &
 pids+=($!)
 for _ in $(seq 100); do [ -S "$ROOT/run/vireon-fbf.sock" ] && break; sleep 0.1; done
 

@@ -78,16 +78,14 @@ class LinuxDaemon final : public Daemon {
       };
       return d;
     };
-    service_ = std::make_unique<FlusherService>(
-        *assembly_, std::make_shared<DaemonFlushRunner>(*assembly_, flusherDependencies));
+    auto runner = std::make_shared<DaemonFlushRunner>(*assembly_, flusherDependencies);
+    service_ = std::make_unique<FlusherService>(*assembly_, runner);
     if (acceptor_) accept();
 
     // 4. The periodic flush.
     PeriodicActivityHooks hooks;
-    hooks.beginFlush = [this, flusherDependencies](std::function<void()> completion) -> std::function<void()> {
-      auto flusher = FeedbackFlusher::make(*assembly_, flusherDependencies());
-      flusher->beginEnumeratingFeedback({}, std::move(completion));
-      return [flusher] { flusher->stopEnumeratingFeedback(); };
+    hooks.beginFlush = [runner](std::function<void()> completion) {
+      return runner->beginPeriodicFlush(std::move(completion));
     };
     hooks.invalidateListener = [this] {
       asio::post(io_, [this] {

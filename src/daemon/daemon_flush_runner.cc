@@ -10,35 +10,58 @@ namespace fbf {
 DaemonFlushRunner::DaemonFlushRunner(FBFAssemblyProtocol& assembly, std::function<FlusherDependencies()> deps)
     : assembly_(assembly), dependencies_(std::move(deps)) {}
 
-std::shared_ptr<FeedbackFlusher> DaemonFlushRunner::makeFlusher() {
-  auto flusher = FeedbackFlusher::make(assembly_, dependencies_());
-  running_.insert(flusher);
-  // A client is waiting: uploads carry the real-time marker.
-  assembly_.setFlushingEagerly(true);
-  return flusher;
+void DaemonFlushRunner::schedule(PendingFlush flush) {
+  waiting_.push_back(std::move(flush));
+  startNextIfIdle();
 }
 
-std::function<void()> DaemonFlushRunner::finishing(std::shared_ptr<FeedbackFlusher> flusher,
-                                                   std::function<void()> completion) {
-  return [this, flusher, completion = std::move(completion)] {
+void DaemonFlushRunner::startNextIfIdle() {
+  if (current_ || waiting_.empty()) return;
+  PendingFlush next = std::move(waiting_.front());
+  waiting_.pop_front();
+  auto flusher = FeedbackFlusher::make(assembly_, dependencies_());
+  current_ = flusher;
+  if (next.handle) *next.handle = flusher;
+  // A client is waiting: its uploads carry the real-time marker.
+  assembly_.setFlushingEagerly(next.clientRequested);
+  next.start(flusher, [this, flusher, completion = std::move(next.completion)] {
     // Released on the work queue after this call returns, not inside the
     // flusher's own call stack.
     assembly_.workloop().async([this, flusher] {
-      running_.erase(flusher);
-      if (running_.empty()) assembly_.setFlushingEagerly(false);
+      if (current_ == flusher) current_.reset();
+      assembly_.setFlushingEagerly(false);
+      startNextIfIdle();
     });
     if (completion) completion();
-  };
+  });
 }
 
 void DaemonFlushRunner::flushAll(std::function<void()> completion) {
-  auto flusher = makeFlusher();
-  flusher->beginEnumeratingFeedback({}, finishing(flusher, std::move(completion)));
+  schedule({[](const auto& flusher, auto done) { flusher->beginEnumeratingFeedback({}, std::move(done)); },
+            std::move(completion), true, nullptr});
 }
 
 void DaemonFlushRunner::flushCustomFeedbackType(const std::string& type, std::function<void()> completion) {
-  auto flusher = makeFlusher();
-  flusher->beginEnumeratingFeedback({type}, finishing(flusher, std::move(completion)));
+  schedule({[type](const auto& flusher, auto done) { flusher->beginEnumeratingFeedback({type}, std::move(done)); },
+            std::move(completion), true, nullptr});
+}
+
+std::function<void()> DaemonFlushRunner::beginPeriodicFlush(std::function<void()> completion) {
+  auto handle = std::make_shared<std::weak_ptr<FeedbackFlusher>>();
+  auto stopped = std::make_shared<std::atomic<bool>>(false);
+  assembly_.workloop().async([this, handle, stopped, completion = std::move(completion)]() mutable {
+    schedule({[stopped](const auto& flusher, auto done) {
+                flusher->beginEnumeratingFeedback({}, std::move(done));
+                if (*stopped) flusher->stopEnumeratingFeedback();
+              },
+              std::move(completion), false, handle});
+  });
+  return [this, handle, stopped] {
+    *stopped = true;
+    assembly_.workloop().async([handle] {
+      if (auto flusher = handle->lock()) flusher->stopEnumeratingFeedback();
+    });
+  };
 }
 
 std::optional<std::string> DaemonFlushRunner::flushSessionEagerly(const std::filesystem::path& path,
@@ -52,8 +75,8 @@ std::optional<std::string> DaemonFlushRunner::flushSessionEagerly(const std::fil
   auto normal = path.lexically_normal();
   if (normal.parent_path() != cacheDir->lexically_normal()) return "not in the cache directory: " + path.string();
   if (!SessionFilename::fromString(normal.filename().string())) return "not a session file name: " + path.string();
-  auto flusher = makeFlusher();
-  flusher->flushSessionEagerly(normal, finishing(flusher, std::move(completion)));
+  schedule({[normal](const auto& flusher, auto done) { flusher->flushSessionEagerly(normal, std::move(done)); },
+            std::move(completion), true, nullptr});
   return std::nullopt;
 }
 

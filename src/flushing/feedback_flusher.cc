@@ -128,6 +128,8 @@ void FeedbackFlusher::flushFeedbackFile(const FeedbackFile& file) {
 }
 
 void FeedbackFlusher::retryPendingUpload(const FeedbackFile& file) {
+  // The walk may come across the upload files this flush has just made.
+  if (enqueuedFiles_.count(file.fileURL)) return;
   if (assembly_.isCancelled()) {
     log().debug("Flushing is cancelled, skipping {}.", file.fileName());
     return;
@@ -275,6 +277,7 @@ void FeedbackFlusher::tee(const std::string& payload, const std::string& format)
 
 void FeedbackFlusher::enqueue(UploadRequest request, uint64_t fileSize) {
   auto self = shared_from_this();
+  enqueuedFiles_.insert(request.fileURL);
   std::string type = request.typeString;
   auto size = static_cast<unsigned long>(request.uncompressedSize);
   auto compressed = static_cast<unsigned long>(request.compressedSize);

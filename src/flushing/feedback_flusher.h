@@ -24,6 +24,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -100,6 +101,7 @@ class FeedbackFlusher final : public UploadManagerDelegate, public std::enable_s
   std::function<void()> enumerationCompletion_;
   std::unique_ptr<SignpostInterval> flushInterval_;
   bool walkFinished_ = false;
+  std::set<fs::path> enqueuedFiles_;
   std::atomic<bool> stopRequested_{false};
 };
 

@@ -58,7 +58,7 @@ std::optional<std::string> publicSuffixOf(const std::string& domain) {
 
 }  // namespace
 
-std::optional<URLComponents> parseURLComponents(std::string_view text) {
+std::optional<MatchURLComponents> parseURLComponents(std::string_view text) {
   std::string owned(text);
   ParsedUri parsed;
   const char* errorPos = nullptr;
@@ -69,7 +69,7 @@ std::optional<URLComponents> parseURLComponents(std::string_view text) {
   // A normalisation failure (out of memory) leaves the text as written.
   (void)uriNormalizeSyntaxA(&parsed.uri);
 
-  URLComponents c;
+  MatchURLComponents c;
   c.scheme = textOf(parsed.uri.scheme);
   c.userInfo = textOf(parsed.uri.userInfo);
   c.host = textOf(parsed.uri.hostText);
@@ -97,7 +97,7 @@ std::optional<std::string> registrableDomain(std::string_view host) {
   return std::string(domain);
 }
 
-std::optional<std::string> embeddedAMPURL(const URLComponents& components) {
+std::optional<std::string> embeddedAMPURL(const MatchURLComponents& components) {
   if (!components.host || components.hostIsIPLiteral) return std::nullopt;
   const std::string& host = *components.host;
   std::vector<std::string_view> segments = splitPath(components.path);
@@ -135,7 +135,7 @@ std::optional<std::string> embeddedAMPURL(const URLComponents& components) {
   return url;
 }
 
-std::optional<URLComponents> componentsForEmbeddedAMPURL(const URLComponents& components) {
+std::optional<MatchURLComponents> componentsForEmbeddedAMPURL(const MatchURLComponents& components) {
   auto embedded = embeddedAMPURL(components);
   if (!embedded) return std::nullopt;
   auto parsed = parseURLComponents(*embedded);
@@ -144,16 +144,16 @@ std::optional<URLComponents> componentsForEmbeddedAMPURL(const URLComponents& co
   return parsed;
 }
 
-std::optional<URLComponents> componentsAfterRemovingSubdomains(const URLComponents& components) {
+std::optional<MatchURLComponents> componentsAfterRemovingSubdomains(const MatchURLComponents& components) {
   if (!components.host || components.hostIsIPLiteral) return std::nullopt;
   auto domain = registrableDomain(*components.host);
   if (!domain) return std::nullopt;
-  URLComponents reduced = components;
+  MatchURLComponents reduced = components;
   reduced.host = std::move(domain);
   return reduced;
 }
 
-std::optional<std::string> normalizedURLStringForTLDFeatures(const URLComponents& components) {
+std::optional<std::string> normalizedURLStringForTLDFeatures(const MatchURLComponents& components) {
   if (!components.host || components.host->empty()) return std::nullopt;
   const std::string& host = *components.host;
   if (components.hostIsIPLiteral) return host;
@@ -166,7 +166,7 @@ std::optional<std::string> normalizedURLStringForTLDFeatures(const URLComponents
 
 namespace {
 
-URLComponents sanitised(const URLComponents& parsed) {
+MatchURLComponents sanitised(const MatchURLComponents& parsed) {
   if (embeddedAMPURL(parsed)) {
     if (auto embedded = componentsForEmbeddedAMPURL(parsed)) return *embedded;
   } else if (auto reduced = componentsAfterRemovingSubdomains(parsed)) {
@@ -184,9 +184,9 @@ corevireon::CVCBAEngagementType cbaMatchBetween(std::optional<std::string_view> 
   auto b = parseURLComponents(*visited);
   if (!a || !b) return corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH;
 
-  URLComponents x = sanitised(*a);
-  URLComponents y = sanitised(*b);
-  for (URLComponents* c : {&x, &y}) {
+  MatchURLComponents x = sanitised(*a);
+  MatchURLComponents y = sanitised(*b);
+  for (MatchURLComponents* c : {&x, &y}) {
     c->scheme.reset();
     if (!c->path.empty() && c->path.back() == '/') c->path.pop_back();
   }

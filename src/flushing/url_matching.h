@@ -39,7 +39,7 @@ namespace fbf {
 
 // The parts of one parsed address. The path is the decoded-form text as
 // written, "/"-separated, with its leading "/" when it has one.
-struct URLComponents {
+struct MatchURLComponents {
   std::optional<std::string> scheme;
   std::optional<std::string> userInfo;
   std::optional<std::string> host;
@@ -49,27 +49,27 @@ struct URLComponents {
   std::optional<std::string> fragment;
   bool hostIsIPLiteral = false;
 
-  bool operator==(const URLComponents&) const = default;
+  bool operator==(const MatchURLComponents&) const = default;
 };
 
 // Parses an RFC 3986 URI reference (relative references included) and
 // normalises its syntax; none when the text is not a URI reference.
-std::optional<URLComponents> parseURLComponents(std::string_view text);
+std::optional<MatchURLComponents> parseURLComponents(std::string_view text);
 
 // The address embedded in an AMP cache or viewer address, as text; none when
 // `components` is not such an address.
-std::optional<std::string> embeddedAMPURL(const URLComponents& components);
+std::optional<std::string> embeddedAMPURL(const MatchURLComponents& components);
 
 // The embedded AMP address, parsed and reduced to its registrable domain;
 // none when there is no embedded address or it does not parse.
-std::optional<URLComponents> componentsForEmbeddedAMPURL(const URLComponents& components);
+std::optional<MatchURLComponents> componentsForEmbeddedAMPURL(const MatchURLComponents& components);
 
 // The components with the host reduced to its registrable domain; none when
 // there is no host or the host has no registrable domain.
-std::optional<URLComponents> componentsAfterRemovingSubdomains(const URLComponents& components);
+std::optional<MatchURLComponents> componentsAfterRemovingSubdomains(const MatchURLComponents& components);
 
 // The site string for top-level-domain features (see above).
-std::optional<std::string> normalizedURLStringForTLDFeatures(const URLComponents& components);
+std::optional<std::string> normalizedURLStringForTLDFeatures(const MatchURLComponents& components);
 
 // The registrable domain of a lower-case host name, if it has one.
 std::optional<std::string> registrableDomain(std::string_view host);
