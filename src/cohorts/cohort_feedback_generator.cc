@@ -124,7 +124,10 @@ corevireon::CVDeviceContext CohortFeedbackGenerator::deviceContextMessage() cons
 void CohortFeedbackGenerator::persist(const corevireon::CVCohortsFeedback& feedback, bool offerToListener) {
   std::string bytes = feedback.SerializeAsString();
   if (collaborators_.persist) collaborators_.persist(bytes);
-  if (offerToListener && collaborators_.offer) collaborators_.offer(bytes);
+  // The listener is sent the envelope itself, not the file's wrapper.
+  if (offerToListener && collaborators_.offer && feedback.has_usageenvelope()) {
+    collaborators_.offer(feedback.usageenvelope().SerializeAsString());
+  }
 }
 
 void CohortFeedbackGenerator::aggregateNext(FlushFrequency frequency) {

@@ -9,9 +9,9 @@
 // Every envelope is written as a custom feedback file of type "Usage"
 // (CustomFeedback/Usage/cohorts.<UUID>.pb, owner-only) holding one serialised
 // CVCohortsFeedback: kind 1 (usageEnvelope) or kind 6 (propensityEnvelope).
-// The next flush uploads them like any other custom feedback. The bytes of
-// each usage envelope's file are also offered to the cohorts listener
-// (`willGenerateCohortFeebacks`), posted to the work queue.
+// The next flush uploads them like any other custom feedback. Each usage
+// envelope is also offered to the cohorts listener as a serialised
+// CVUsageEnvelope (`willGenerateCohortFeebacks`), posted to the work queue.
 //
 // Lifetime and threading: made per cohort flush; runs on the store's context
 // queue (inside the scheduler's synchronous block). Holds the store, the file
@@ -48,7 +48,7 @@ class CohortFeedbackGenerator final : public CohortFeedbackGeneratorProtocol {
 
   // Writes one serialised cohort feedback record as a "Usage" file.
   using Persist = std::function<void(const std::string& bytes)>;
-  // Hands one usage envelope's file bytes to the cohorts listener.
+  // Hands one serialised CVUsageEnvelope to the cohorts listener.
   using Offer = std::function<void(const std::string& bytes)>;
 
   struct Collaborators {

@@ -4,9 +4,12 @@
 #include "util/lock.h"
 
 #include <fmt/format.h>
+#include <fmt/ranges.h>
 
 #include <exception>
+#include <string_view>
 #include <unordered_map>
+#include <vector>
 
 namespace fbf {
 namespace {
@@ -19,22 +22,14 @@ std::string selectList(const EntityDescription& entity) {
 }
 
 std::string insertSql(const EntityDescription& entity, bool withRowid) {
-  std::string columns;
-  std::string marks;
-  if (withRowid) {
-    columns = "rowid";
-    marks = "?";
-  }
-  for (const auto& a : entity.attributes) {
-    if (!columns.empty()) {
-      columns += ", ";
-      marks += ", ";
-    }
-    columns += a.name;
-    marks += "?";
-  }
-  return fmt::format("{} INTO {} ({}) VALUES ({})", withRowid ? "INSERT OR REPLACE" : "INSERT", entity.name, columns,
-                     marks);
+  // Joined from a list rather than appended piecewise: GCC 12 at -O3 reports
+  // a bogus overlapping copy (-Wrestrict) for the appending form.
+  std::vector<std::string_view> columns;
+  if (withRowid) columns.emplace_back("rowid");
+  for (const auto& a : entity.attributes) columns.push_back(a.name);
+  std::vector<std::string_view> marks(columns.size(), "?");
+  return fmt::format("{} INTO {} ({}) VALUES ({})", withRowid ? "INSERT OR REPLACE" : "INSERT", entity.name,
+                     fmt::join(columns, ", "), fmt::join(marks, ", "));
 }
 
 }  // namespace

@@ -70,17 +70,17 @@
 #include "cohorts/usage_store.h"
 #include "corevireon.pb.h"
 #include "flushing/flushable_session.h"
+#include "flushing/reporters.h"
 
-#include <optional>
-#include <string_view>
+#include <vector>
 
 namespace fbf {
 
 namespace usage {
 
-// The cohort client named by an agent string (see above).
-corevireon::CVClient cohortsClient(std::optional<std::string_view> agent);
-corevireon::CVClient cohortsClient(const corevireon::CVClientSession& session);
+// The session's surface is `cohortsClient` of flushing/reporters.h; which
+// feedback is an engagement or a search is decided by its EngagementReporter
+// and KeystrokeReporter.
 
 inline constexpr int32_t kQuerySuggestionResultBundleIds[] = {44, 66, 86};
 inline constexpr int32_t kSectionVireonServer = 100;
@@ -114,7 +114,7 @@ class UsageProcessor final : public UsageProcessorProtocol {
   void process(const corevireon::CVClientSession& session);
   void stageSessionSentinel(const corevireon::CVClientSession& session, corevireon::CVClient client);
   void stageSessionPropensity(const corevireon::CVClientSession& session, corevireon::CVClient client,
-                              const std::vector<const corevireon::CVFeedbackPayload*>& engagements);
+                              const std::vector<EngagementReporter>& engagements);
 
   DataStorageContainerProtocol& persistentStore_;
 };

@@ -36,6 +36,11 @@ constexpr uint64_t kUpdateSoon = 1;
 class LinuxDaemon final : public Daemon {
  public:
   explicit LinuxDaemon(DaemonOptions options) : options_(std::move(options)) {}
+  ~LinuxDaemon() override {
+    // The activity's thread uses the scheduler, the assembly and the main
+    // loop: stop it before any of them goes.
+    if (activityQueue_) activityQueue_->shutdown();
+  }
 
   void setup() {
     auto& dirs = options_.dirs;
@@ -127,6 +132,13 @@ class LinuxDaemon final : public Daemon {
 
   int run() override {
     io_.run();
+    // A client may still be connected (waiting for its flush). Closing its
+    // channel is posted to the loop, so run the loop once more after closing:
+    // the closure releases the connection instead of leaving it unreachable.
+    acceptor_.reset();
+    service_.reset();
+    io_.restart();
+    io_.poll();
     return 0;
   }
 
@@ -151,7 +163,9 @@ class LinuxDaemon final : public Daemon {
     });
   }
 
-  void onConnection(asio::local::stream_protocol::socket socket) { service_->accept(std::move(socket)); }
+  void onConnection(asio::local::stream_protocol::socket socket) {
+    if (service_) service_->accept(std::move(socket));
+  }
 
   DaemonOptions options_;
   asio::io_context io_;

@@ -2,6 +2,7 @@
 
 #include "assembly/cache_paths.h"
 #include "assembly/feedback_types.h"
+#include "cohorts/cohorts_status.h"
 #include "flushing/session_filename.h"
 
 #include <map>
@@ -125,6 +126,7 @@ ipc::StatusReply DaemonFlushRunner::status() {
       if (t.files) emit(reply.mutable_customfeedback(), type, t);
     }
   }
+  fillCohortsStatus(fm, reply);
   return reply;
 }
 

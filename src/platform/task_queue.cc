@@ -46,7 +46,9 @@ class AsioSerialQueue final : public TaskQueue {
       tCurrentQueue = nullptr;
     });
   }
-  ~AsioSerialQueue() override {
+  ~AsioSerialQueue() override { shutdown(); }
+
+  void shutdown() override {
     work_.reset();
     io_.stop();
     if (thread_.joinable()) {

@@ -35,6 +35,9 @@ class TaskQueue {
   virtual void asyncAfter(std::chrono::steady_clock::duration delay, Task task) = 0;
   virtual bool isCurrent() const = 0;
   virtual std::unique_ptr<Timer> makeTimer() = 0;
+  // Lets the task in progress finish, drops the rest and stops the queue's
+  // thread; nothing runs afterwards. Not to be called from the queue itself.
+  virtual void shutdown() {}
 };
 
 // A queue backed by an Asio io_context run by exactly one thread of its own.

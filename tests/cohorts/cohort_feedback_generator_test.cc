@@ -113,9 +113,13 @@ TEST_F(CohortEnvelopes, ADayWritesOneUsageEnvelopePerSurfaceInClientOrder) {
   EXPECT_EQ(clients, (std::vector<int>{2, 1, 4, 3}));
   EXPECT_EQ(activeDays, (std::vector<int>{1, 0, 0, 0}));
   EXPECT_EQ(uuids.size(), 4u);
-  // The listener sees exactly the bytes of the files.
+  // The listener sees each usage envelope itself, as the file holds it.
   ASSERT_EQ(offered.size(), 4u);
-  EXPECT_EQ(decode(offered[0]).usageenvelope().client(), 2);
+  for (size_t i = 0; i < offered.size(); ++i) {
+    corevireon::CVUsageEnvelope offeredEnvelope;
+    ASSERT_TRUE(offeredEnvelope.ParseFromString(offered[i]));
+    EXPECT_EQ(offeredEnvelope.SerializeAsString(), persisted[i].usageenvelope().SerializeAsString());
+  }
 }
 
 TEST_F(CohortEnvelopes, AggregatingAdvancesAndSavesTheMarkerToThePeriodEnd) {
@@ -253,7 +257,9 @@ TEST_F(CohortEnvelopes, InTheDaemonEnvelopesBecomeUsageFilesAndReachTheListenerO
   EXPECT_TRUE(listener->received.empty()) << "delivered on the work queue, not the store's";
   env.manualQueue->drain();
   ASSERT_EQ(listener->received.size(), 4u);
-  EXPECT_EQ(decode(listener->received[0]).usageenvelope().client(), 2);
+  corevireon::CVUsageEnvelope first;
+  ASSERT_TRUE(first.ParseFromString(listener->received[0]));
+  EXPECT_EQ(first.client(), 2);
 }
 
 // --- The cohort flush of one flush ----------------------------------------

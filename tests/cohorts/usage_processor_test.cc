@@ -126,15 +126,6 @@ TEST(UsageRule, OnFlags) {
   EXPECT_FALSE(UsageProcessor::session(true, true, corevireon::CV_CLIENT_NONE));
 }
 
-TEST(CohortsClient, FromTheLowerCasedAgentFirstRuleWins) {
-  EXPECT_EQ(usage::cohortsClient(std::string_view("Wayfin/1.0")), corevireon::CV_CLIENT_WEB_BROWSER);
-  EXPECT_EQ(usage::cohortsClient(std::string_view("ScoutLume")), corevireon::CV_CLIENT_SYSTEM_SEARCH_UI);
-  EXPECT_EQ(usage::cohortsClient(std::string_view("news and messages")), corevireon::CV_CLIENT_NEWS);
-  EXPECT_EQ(usage::cohortsClient(std::string_view("Messages")), corevireon::CV_CLIENT_MESSAGING);
-  EXPECT_EQ(usage::cohortsClient(std::string_view("")), corevireon::CV_CLIENT_NONE);
-  EXPECT_EQ(usage::cohortsClient(std::nullopt), corevireon::CV_CLIENT_NONE);
-}
-
 // --- Every counter is reachable -------------------------------------------
 
 struct CounterCase {

@@ -7,6 +7,8 @@
 #include "util/build_info.h"
 
 #include <charconv>
+#include <cmath>
+#include <ctime>
 #include <cstdint>
 #include <filesystem>
 #include <memory>
@@ -29,7 +31,8 @@ constexpr const char* kUsageText =
     "signature\n"
     "  tee uploads|cohorts [--count N]   print each payload as one JSON line until interrupted\n"
     "                                    (or until N payloads were printed)\n"
-    "  status [--json]                   pending feedback per state and type\n"
+    "  status [--json]                   pending feedback per state and type, and the usage\n"
+    "                                    cohorts (collection start, last aggregations, sentinels)\n"
     "  defaults read DOMAIN [KEY]\n"
     "  defaults write DOMAIN KEY [-bool|-int|-string] VALUE\n"
     "  defaults delete DOMAIN [KEY]      read and change preferences (no daemon needed)\n";
@@ -261,7 +264,78 @@ class Command {
     out["customFeedback"] = pendingJson(reply.customfeedback());
     out["uploadsListener"] = reply.uploadslistener();
     out["cohortsListener"] = reply.cohortslistener();
+    out["cohorts"] = cohortsJson(reply);
     return out;
+  }
+
+  static bool hasCohorts(const ipc::StatusReply& reply) {
+    return reply.has_cohortscollectionstart() || !reply.cohortslastaggregations().empty() ||
+           !reply.cohortssentinels().empty();
+  }
+
+  // Null while the daemon has no readable usage store.
+  static nlohmann::ordered_json cohortsJson(const ipc::StatusReply& reply) {
+    if (!hasCohorts(reply)) return nullptr;
+    nlohmann::ordered_json out;
+    out["collectionStart"] =
+        reply.has_cohortscollectionstart() ? nlohmann::ordered_json(reply.cohortscollectionstart()) : nullptr;
+    auto aggregations = nlohmann::ordered_json::object();
+    for (const auto& a : reply.cohortslastaggregations()) aggregations[a.frequency()] = a.timestamp();
+    out["lastAggregations"] = std::move(aggregations);
+    auto sentinels = nlohmann::ordered_json::array();
+    for (const auto& c : reply.cohortssentinels()) {
+      nlohmann::ordered_json item;
+      item["client"] = c.client();
+      item["count"] = c.count();
+      sentinels.push_back(std::move(item));
+    }
+    out["sentinels"] = std::move(sentinels);
+    return out;
+  }
+
+  // UTC, to the second: "2024-03-31T22:00:00Z".
+  static std::string describeDate(double secondsSince1970) {
+    auto t = static_cast<std::time_t>(std::floor(secondsSince1970));
+    std::tm tm{};
+    if (gmtime_r(&t, &tm) == nullptr) return std::to_string(secondsSince1970);
+    char text[32];
+    std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%SZ", &tm);
+    return text;
+  }
+
+  static std::string describeClient(int32_t client) {
+    switch (client) {
+      case 1:
+        return "browser (1)";
+      case 2:
+        return "system search (2)";
+      case 3:
+        return "messages (3)";
+      case 4:
+        return "news (4)";
+      default:
+        return "client " + std::to_string(client);
+    }
+  }
+
+  void printCohorts(const ipc::StatusReply& reply) {
+    if (!hasCohorts(reply)) {
+      *env_.out << "cohorts: no usage store\n";
+      return;
+    }
+    *env_.out << "cohorts:\n  collecting since: "
+              << (reply.has_cohortscollectionstart() ? describeDate(reply.cohortscollectionstart()) : "unknown")
+              << "\n  last aggregation:";
+    if (reply.cohortslastaggregations().empty()) *env_.out << " none";
+    for (const auto& a : reply.cohortslastaggregations()) {
+      *env_.out << "\n    " << a.frequency() << ": " << describeDate(a.timestamp());
+    }
+    *env_.out << "\n  session sentinels:";
+    if (reply.cohortssentinels().empty()) *env_.out << " none";
+    for (const auto& c : reply.cohortssentinels()) {
+      *env_.out << "\n    " << describeClient(c.client()) << ": " << c.count();
+    }
+    *env_.out << "\n";
   }
 
   static std::string describeAge(int64_t seconds) {
@@ -291,6 +365,7 @@ class Command {
     printPending("custom feedback", reply.customfeedback());
     *env_.out << "uploads listener: " << (reply.uploadslistener() ? "yes" : "no")
               << "\ncohorts listener: " << (reply.cohortslistener() ? "yes" : "no") << "\n";
+    printCohorts(reply);
   }
 
   const Environment& env_;
