@@ -184,6 +184,13 @@ class IpcFixture : public ::testing::Test {
     guard.reset();
     io.stop();
     ioThread.join();
+    // Handlers still queued (a channel's last close, posted back from the
+    // work queue) hold the connections: run them out before tearing down.
+    for (int i = 0; i < 3; ++i) {
+      assembly->workloop().sync([] {});
+      io.restart();
+      io.poll();
+    }
     assembly.reset();
   }
 
