@@ -64,13 +64,37 @@ std::shared_ptr<HttpClientSession> FBFAssembly::makeUploadSession() {
   if (!deps_.httpSessionFactory) return nullptr;
   HttpSessionConfiguration config;
   config.delegateQueue = workloop_;
-  config.maxConnectionsPerHost = 1;
+  // Over HTTP/1.1 a few connections let uploads overlap a slow server's
+  // replies; over HTTP/2 they are streams of one connection instead.
+  config.maxConnectionsPerHost = kUploadConnectionsPerHost;
   config.pinnedPublicKeys = userDefaults_->stringForKey(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys);
   if (auto ca = userDefaults_->stringForKey(FBFStrings::LinuxDefaults::UploadCAFile)) config.caFile = *ca;
   config.onInvalidated = [this] { uploadSessionDidBecomeInvalid(); };
   auto session = deps_.httpSessionFactory(std::move(config));
-  if (session) didMakeUploadSession();
+  if (!session) return session;
+  didMakeUploadSession();
+  bool cancelNow = false;
+  {
+    std::lock_guard lock(sessionsMutex_);
+    std::erase_if(sessions_, [](const auto& weak) { return weak.expired(); });
+    sessions_.push_back(session);
+    cancelNow = isTerminating();
+  }
+  if (cancelNow) session->cancelAllTasks();
   return session;
+}
+
+void FBFAssembly::setTerminating() {
+  terminating_.store(true);
+  cancelled_.store(true);
+  std::vector<std::shared_ptr<HttpClientSession>> live;
+  {
+    std::lock_guard lock(sessionsMutex_);
+    for (auto& weak : sessions_) {
+      if (auto s = weak.lock()) live.push_back(std::move(s));
+    }
+  }
+  for (auto& s : live) s->cancelAllTasks();
 }
 
 void FBFAssembly::didMakeUploadSession() {
@@ -92,7 +116,12 @@ void FBFAssembly::didDeleteFeedbackFile(const FeedbackDeletionEvent& event) {
     if (payload.is_discarded() || !payload.is_object()) return std::nullopt;
     return payload;
   });
+  if (deps_.lossLedger) deps_.lossLedger->record(event, currentDate());
   log().debug("Reported deletion of feedback type {} reason {}", event.feedbackType, event.reason);
+}
+
+std::vector<FeedbackLossCount> FBFAssembly::feedbackLossesSince(SystemTime since) {
+  return deps_.lossLedger ? deps_.lossLedger->countsSince(since) : std::vector<FeedbackLossCount>{};
 }
 
 }  // namespace fbf

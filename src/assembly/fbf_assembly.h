@@ -13,6 +13,7 @@
 #include "platform/transactions.h"
 #include "util/atomic.h"
 
+#include <mutex>
 #include <vector>
 
 namespace fbf {
@@ -28,6 +29,8 @@ struct FBFAssemblyDependencies {
   std::shared_ptr<DeviceContextProtocol> deviceContext;
   // Optional: made on first use when absent.
   std::shared_ptr<TaskQueue> workloop;
+  // Optional: where deletion events are kept for `fbfctl status`.
+  std::shared_ptr<FeedbackLossLedger> lossLedger;
   // Optional: without it `makeUploadSession` returns null.
   HttpSessionFactory httpSessionFactory;
   // Optional: made lazily on the first `installedAppController()` call.
@@ -36,6 +39,8 @@ struct FBFAssemblyDependencies {
 
 class FBFAssembly final : public FBFAssemblyProtocol {
  public:
+  static constexpr int kUploadConnectionsPerHost = 4;
+
   explicit FBFAssembly(FBFAssemblyDependencies deps);
   ~FBFAssembly() override;
 
@@ -57,10 +62,10 @@ class FBFAssembly final : public FBFAssemblyProtocol {
   bool isCancelled() override { return cancelled_.load(); }
   void setCancelled(bool c) override { cancelled_.store(c); }
   bool isTerminating() override { return terminating_.load(); }
-  void setTerminating() override {
-    terminating_.store(true);
-    cancelled_.store(true);
-  }
+  // Also abandons every upload in flight: the process is about to stop, and
+  // a stalled transfer must not hold it past the service manager's patience.
+  // Their files stay for the next run.
+  void setTerminating() override;
   bool isDiagnosticsAndUsageEnabled() override;
   bool isFlushingEagerly() override { return flushingEagerly_.load(); }
   void setFlushingEagerly(bool e) override { flushingEagerly_.store(e); }
@@ -74,6 +79,7 @@ class FBFAssembly final : public FBFAssemblyProtocol {
   std::shared_ptr<HttpClientSession> makeUploadSession() override;
   SystemTime currentDate() override { return deps_.clock->now(); }
   void didDeleteFeedbackFile(const FeedbackDeletionEvent& event) override;
+  std::vector<FeedbackLossCount> feedbackLossesSince(SystemTime since) override;
 
   TransactionRegistry& transactions() { return *deps_.transactions; }
   const Clock& clock() const { return *deps_.clock; }
@@ -92,6 +98,8 @@ class FBFAssembly final : public FBFAssemblyProtocol {
   std::shared_ptr<ClientConduit> cohortsListener_;
   std::shared_ptr<ConduitActivity> conduitActivity_;
   std::vector<std::shared_ptr<Transaction>> openTransactions_;
+  std::mutex sessionsMutex_;
+  std::vector<std::weak_ptr<HttpClientSession>> sessions_;  // guarded by sessionsMutex_
   Atomic<bool> flushingEagerly_{false};
   Atomic<bool> cellularUploads_{false};
   Atomic<bool> cancelled_{false};

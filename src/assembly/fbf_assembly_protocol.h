@@ -6,6 +6,7 @@
 
 #include "assembly/configuration_bag.h"
 #include "assembly/feedback_deletion_event.h"
+#include "assembly/feedback_loss_ledger.h"
 #include "platform/clock.h"
 #include "platform/file_manager.h"
 #include "platform/http_session.h"
@@ -17,6 +18,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace fbf {
 
@@ -96,6 +98,12 @@ class FBFAssemblyProtocol {
   virtual std::shared_ptr<HttpClientSession> makeUploadSession() = 0;
   virtual SystemTime currentDate() = 0;
   virtual void didDeleteFeedbackFile(const FeedbackDeletionEvent& event) = 0;
+  // The deletion events at or after `since`, by type and reason; empty where
+  // no ledger is kept.
+  virtual std::vector<FeedbackLossCount> feedbackLossesSince(SystemTime since) {
+    (void)since;
+    return {};
+  }
 };
 
 }  // namespace fbf

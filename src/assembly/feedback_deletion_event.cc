@@ -22,4 +22,19 @@ nlohmann::json FeedbackDeletionEvent::toJSON() const {
   return {{"feedbackType", feedbackType}, {"reason", reason}, {"size", size}, {"age", age}};
 }
 
+std::string deletionReasonName(int32_t reason) {
+  switch (reason) {
+    case 1: return "tooOld";
+    case 2: return "tooLarge";
+    case 3: return "empty";
+    case 4: return "pruned";
+    case 5: return "noConsent";
+    case 6: return "unreadable";
+    case 7: return "undecodable";
+    case 8: return "noFeedback";
+    case 12: return "uploaded";
+    default: return "(unknown: " + std::to_string(reason) + ")";
+  }
+}
+
 }  // namespace fbf

@@ -9,6 +9,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <string>
 
 namespace fbf {
 
@@ -22,6 +23,9 @@ struct FeedbackDeletionReason {
   static constexpr int32_t unreadable = 6;
   static constexpr int32_t uploaded = 12;
 };
+
+// "tooOld", "pruned", "uploaded" ...; "(unknown: N)" for other codes.
+std::string deletionReasonName(int32_t reason);
 
 struct FeedbackDeletionEvent {
   int32_t feedbackType = 0;  // known feedback type code

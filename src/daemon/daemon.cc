@@ -5,6 +5,7 @@
 #include "daemon/daemon_flush_runner.h"
 #include "daemon/listener_socket.h"
 #include "daemon/periodic_activity.h"
+#include "flushing/session_recovery.h"
 #include "ipc/flusher_service.h"
 #include "platform/curl_http_session.h"
 #include "upload/upload_manager.h"
@@ -69,10 +70,19 @@ class LinuxDaemon final : public Daemon {
     deps.clock = clock;
     deps.analytics = makeJsonLinesAnalyticsSink(dirs.analyticsFile(), *fm, *clock);
     deps.transactions = transactions_;
+    deps.lossLedger =
+        std::make_shared<FeedbackLossLedger>(dirs.analyticsFile().parent_path() / "losses.jsonl", *fm, clock->now());
     deps.deviceContext = std::make_shared<DeviceContext>(*deviceInfo, kDaemonNameAndVersion);
     deps.httpSessionFactory = makeCurlHttpSession;
     deps.installedAppControllerFactory = [dirs](FBFAssembly& a) { return makeInstalledAppController(a, dirs); };
     assembly_ = std::make_unique<FBFAssembly>(std::move(deps));
+
+    // Files an earlier run left half-way, before any flush of this run can
+    // meet them (the work queue runs tasks in order).
+    assembly_->workloop().async([this] {
+      bool leave = assembly_->userDefaults().boolForKey(FBFStrings::Defaults::LeaveFeedbackAfterUpload);
+      recoverInterruptedFiles(assembly_->fileManager(), leave);
+    });
 
     // 3. Serve clients.
     auto flusherDependencies = [] {
@@ -156,10 +166,27 @@ class LinuxDaemon final : public Daemon {
   }
 
   void accept() {
+    if (!acceptor_) return;
     acceptor_->async_accept([this](const std::error_code& ec, asio::local::stream_protocol::socket socket) {
       if (ec == asio::error::operation_aborted) return;
-      if (!ec) onConnection(std::move(socket));
-      accept();
+      if (!ec) {
+        acceptFailing_ = false;
+        acceptBackoff_ = kMinimumAcceptBackoff;
+        onConnection(std::move(socket));
+        accept();
+        return;
+      }
+      // Out of descriptors (or another refusal): the pending connection stays
+      // queued, so accepting again at once would spin. Wait, and say so once.
+      if (!acceptFailing_) {
+        mainLog().error("Cannot accept connections: {}; retrying with back-off", ec.message());
+        acceptFailing_ = true;
+      }
+      acceptTimer_.expires_after(acceptBackoff_);
+      acceptBackoff_ = std::min(acceptBackoff_ * 2, kMaximumAcceptBackoff);
+      acceptTimer_.async_wait([this](const std::error_code& waitError) {
+        if (!waitError) accept();
+      });
     });
   }
 
@@ -167,8 +194,14 @@ class LinuxDaemon final : public Daemon {
     if (service_) service_->accept(std::move(socket));
   }
 
+  static constexpr std::chrono::milliseconds kMinimumAcceptBackoff{50};
+  static constexpr std::chrono::milliseconds kMaximumAcceptBackoff{2000};
+
   DaemonOptions options_;
   asio::io_context io_;
+  asio::steady_timer acceptTimer_{io_};
+  std::chrono::milliseconds acceptBackoff_ = kMinimumAcceptBackoff;
+  bool acceptFailing_ = false;
   asio::signal_set signals_{io_};
   std::shared_ptr<TransactionRegistry> transactions_;
   std::optional<UnixAcceptor> acceptor_;

@@ -4,6 +4,7 @@
 #include "assembly/feedback_types.h"
 #include "cohorts/cohorts_status.h"
 #include "flushing/session_filename.h"
+#include "flushing/session_recovery.h"
 
 #include <map>
 
@@ -127,6 +128,14 @@ ipc::StatusReply DaemonFlushRunner::status() {
     }
   }
   fillCohortsStatus(fm, reply);
+  for (const auto& loss : assembly_.feedbackLossesSince(now - FeedbackLossLedger::kWindow)) {
+    auto* item = reply.add_losseslast7days();
+    item->set_type(knownFeedbackTypeName(loss.feedbackType));
+    item->set_reason(deletionReasonName(loss.reason));
+    item->set_reasoncode(loss.reason);
+    item->set_files(loss.files);
+  }
+  for (const auto& poison : poisonSessionFiles(fm)) reply.add_poisonfiles(poison.filename().string());
   return reply;
 }
 

@@ -152,11 +152,14 @@ void vireon_cleanup(FileManager& fm, SystemTime now) {
   }
 }
 
-std::vector<fs::path> vireon_getPrunedSessionFiles(const FileManager& fm, int maximum) {
+std::vector<fs::path> vireon_getPrunedSessionFiles(const FileManager& fm, int maximum,
+                                                   const SessionFileExemption& exempt) {
   std::vector<DatedPath> files;
   if (auto list = sessionFiles(fm)) {
-    while (auto entry = list->next())
+    while (auto entry = list->next()) {
+      if (exempt && exempt(entry->path)) continue;
       files.push_back({entry->attributes.creationDate, std::move(entry->path)});
+    }
   }
   size_t limit = static_cast<size_t>(std::max(maximum, 0));
   if (files.size() <= limit) return {};
@@ -169,9 +172,10 @@ std::vector<fs::path> vireon_getPrunedSessionFiles(const FileManager& fm, int ma
 }
 
 size_t vireon_pruneSessionFiles(FileManager& fm, int maximum,
-                                const SessionFileRemovalObserver& willRemove) {
+                                const SessionFileRemovalObserver& willRemove,
+                                const SessionFileExemption& exempt) {
   size_t removed = 0;
-  for (const auto& path : vireon_getPrunedSessionFiles(fm, maximum)) {
+  for (const auto& path : vireon_getPrunedSessionFiles(fm, maximum, exempt)) {
     if (willRemove) willRemove(path);
     std::error_code error;
     if (fm.removeItem(path, error)) {

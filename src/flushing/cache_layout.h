@@ -58,9 +58,14 @@ std::optional<fs::path> vireon_renameForStateChange(FileManager& fm, const fs::p
 // than 1800 s before `now`). Processing and uploaded files are left alone.
 void vireon_cleanup(FileManager& fm, SystemTime now);
 
+// Session files that pruning neither counts nor removes (uploads a flush has
+// queued). Empty: none.
+using SessionFileExemption = std::function<bool(const fs::path& file)>;
+
 // When there are more than `maximum` session files, the oldest by creation
 // date (ties by name) to remove so that `maximum / 2` remain; else nothing.
-std::vector<fs::path> vireon_getPrunedSessionFiles(const FileManager& fm, int maximum);
+std::vector<fs::path> vireon_getPrunedSessionFiles(const FileManager& fm, int maximum,
+                                                   const SessionFileExemption& exempt = {});
 
 // Called with each file just before pruning removes it, so that its loss can
 // be reported while its attributes can still be read.
@@ -69,7 +74,8 @@ using SessionFileRemovalObserver = std::function<void(const fs::path& file)>;
 // Removes the files `vireon_getPrunedSessionFiles` selects, logging each
 // failure and going on. Returns how many were removed.
 size_t vireon_pruneSessionFiles(FileManager& fm, int maximum,
-                                const SessionFileRemovalObserver& willRemove = {});
+                                const SessionFileRemovalObserver& willRemove = {},
+                                const SessionFileExemption& exempt = {});
 
 // Removes the item; on failure logs "<message>: <error>" and returns false.
 bool vireon_removeItemOrLogError(FileManager& fm, const fs::path& path, std::string_view message);

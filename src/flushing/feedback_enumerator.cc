@@ -81,7 +81,21 @@ std::optional<FeedbackEnumerator> FeedbackEnumerator::make(const FileManager& fm
 
   FeedbackEnumerator result(std::move(typeFilter), std::move(choose));
   auto add = [&](const fs::path& dir) {
-    if (auto walk = fm.enumerate(dir)) result.walks_.push_back(std::move(walk));
+    if (auto walk = fm.enumerate(dir)) {
+      result.walks_.push_back(std::move(walk));
+      return;
+    }
+    // A missing directory is normal; anything else in its place is not ours
+    // to read, and someone should know why its files are not sent.
+    auto attrs = fm.attributes(dir);
+    if (!attrs) return;
+    if (attrs->kind == FileKind::symlink) {
+      log().warn("Skipping {}: it is a symbolic link, which is never followed.", dir.string());
+    } else if (!attrs->isDirectory() || attrs->owner != geteuid()) {
+      log().warn("Skipping {}: not a directory owned by this user.", dir.string());
+    } else {
+      log().warn("Skipping {}: it cannot be opened.", dir.string());
+    }
   };
   const auto& filter = result.typeFilter_;
   if (filter.empty()) add(*cacheDir);
@@ -114,6 +128,8 @@ std::optional<FeedbackFile> FeedbackEnumerator::next() {
       log().info("Feedback enumerator skipped {}", entry->path.string());
       continue;
     }
+    // Hidden files are partial uploads being written, never feedback.
+    if (entry->name.starts_with(".")) continue;
     FeedbackFile file(std::move(entry->path), attrs);
     if (file.fileType == FeedbackFileType::unknown) {
       log().debug("Feedback enumerator skipped {}", file.fileURL.string());

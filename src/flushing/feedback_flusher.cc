@@ -6,9 +6,12 @@
 #include "corevireon.pb.h"
 #include "flushing/cache_layout.h"
 #include "flushing/flushable_session.h"
+#include "flushing/session_recovery.h"
 #include "platform/logging.h"
 
 #include <algorithm>
+
+#include <unistd.h>
 
 namespace fbf {
 namespace {
@@ -27,7 +30,11 @@ std::shared_ptr<FeedbackFlusher> FeedbackFlusher::make(FBFAssemblyProtocol& asse
 }
 
 FeedbackFlusher::FeedbackFlusher(FBFAssemblyProtocol& assembly, FlusherDependencies deps)
-    : assembly_(assembly), deps_(std::move(deps)), bag_(assembly.cachedBag()) {
+    : assembly_(assembly),
+      deps_(std::move(deps)),
+      bag_(assembly.cachedBag()),
+      ageLimit_(FeedbackAgeLimit::fromBag(bag_)),
+      leaveFeedbackAfterUpload_(assembly.userDefaults().boolForKey(FBFStrings::Defaults::LeaveFeedbackAfterUpload)) {
   if (deps_.uploadManagerFactory) uploadManager_ = deps_.uploadManagerFactory(assembly_);
   if (uploadManager_) uploadManager_->setDelegate(this);
 }
@@ -46,13 +53,6 @@ const std::vector<std::string>& FeedbackFlusher::customFeedbackTypesWithPrivacyE
   return types;
 }
 
-int64_t FeedbackFlusher::feedbackMaxAgeInDays() const {
-  if (bag_) {
-    if (auto v = bag_->feedbackMaxAgeInDays()) return *v;
-  }
-  return FBFConstants::DefaultFeedbackMaxAgeInDays;
-}
-
 uint64_t FeedbackFlusher::sizeLimitFor(const std::string& type) const {
   if (bag_) {
     auto sizes = bag_->maxCustomFeedbackSizes();
@@ -62,22 +62,22 @@ uint64_t FeedbackFlusher::sizeLimitFor(const std::string& type) const {
 }
 
 bool FeedbackFlusher::createdWithinMaxAge(SystemTime creation) const {
-  int64_t maxAge = 0;
-  if (__builtin_mul_overflow(feedbackMaxAgeInDays(), FBFConstants::SecondsPerDay, &maxAge)) return false;
-  double age = std::chrono::duration<double>(assembly_.currentDate() - creation).count();
-  return static_cast<double>(maxAge) > age;
+  return ageLimit_.allows(creation, assembly_.currentDate());
 }
 
 void FeedbackFlusher::beginEnumeratingFeedback(std::vector<std::string> types, std::function<void()> completion) {
   auto self = shared_from_this();
   assembly_.workloop().async([self, types = std::move(types), completion = std::move(completion)]() mutable {
     self->enumerationCompletion_ = std::move(completion);
+    self->pruneWhenSettled_ = true;
     self->flushInterval_ = std::make_unique<SignpostInterval>("flush");
     // An offline cancellation ends the flush it happened in, not this one.
     if (self->assembly_.isCancelled() && !self->assembly_.isTerminating()) self->assembly_.setCancelled(false);
     if (self->bag_) {
       vireon_cleanup(self->assembly_.fileManager(), self->assembly_.currentDate());
       if (self->deps_.usageStoreFactory) self->usageStore_ = self->deps_.usageStoreFactory(self->assembly_);
+      self->poisonSessionIDs_ = interruptedSessionIDs(self->assembly_.fileManager());
+      self->collectPendingUploads(types);
     }
     self->feedbackEnumerator_ = FeedbackEnumerator::make(self->assembly_, std::move(types), self->deps_.randomChoice);
     if (!self->feedbackEnumerator_) log().error("Cannot locate the cache directory; nothing to flush");
@@ -105,7 +105,12 @@ void FeedbackFlusher::flushNext() {
       self->enumeratingFeedbackDidFinish();
       return;
     }
-    auto file = self->feedbackEnumerator_->next();
+    if (self->uploadManager_ && self->uploadManager_->uploadsInFlight() >= kMaximumUploadsInFlight) {
+      // Resumed by the next upload's completion.
+      self->walkWaiting_ = true;
+      return;
+    }
+    auto file = self->nextFile();
     if (!file) {
       self->enumeratingFeedbackDidFinish();
       return;
@@ -115,30 +120,99 @@ void FeedbackFlusher::flushNext() {
   });
 }
 
+std::optional<FeedbackFile> FeedbackFlusher::nextFile() {
+  if (!pendingUploads_.empty()) {
+    FeedbackFile file = std::move(pendingUploads_.front());
+    pendingUploads_.pop_front();
+    return file;
+  }
+  while (auto file = feedbackEnumerator_->next()) {
+    // Every upload file the walk meets was either retried above or made by
+    // this flush.
+    if (!file->uploadPending()) return file;
+  }
+  return std::nullopt;
+}
+
+void FeedbackFlusher::collectPendingUploads(const std::vector<std::string>& types) {
+  auto& fm = assembly_.fileManager();
+  std::vector<std::pair<SystemTime, FeedbackFile>> found;
+  if (types.empty()) {
+    for (auto& entry : sessionFilesAwaitingUpload(fm)) {
+      found.emplace_back(entry.attributes.creationDate, FeedbackFile(entry.path, entry.attributes));
+    }
+  }
+  if (auto custom = customFeedbackDir(fm)) {
+    for (const auto& type : allCustomFeedbackDirectories()) {
+      if (!types.empty() && std::find(types.begin(), types.end(), type) == types.end()) continue;
+      auto walk = fm.enumerate(*custom / type);
+      if (!walk) continue;
+      while (auto e = walk->next()) {
+        if (!e->attributes.isRegular() || e->attributes.owner != geteuid()) continue;
+        if (!e->name.ends_with(FBFStrings::UploadPendingSuffix) || e->name.starts_with(".")) continue;
+        found.emplace_back(e->attributes.creationDate, FeedbackFile(e->path, e->attributes));
+      }
+    }
+  }
+  std::stable_sort(found.begin(), found.end(), [](const auto& a, const auto& b) { return a.first < b.first; });
+  for (auto& [date, file] : found) pendingUploads_.push_back(std::move(file));
+}
+
 void FeedbackFlusher::flushFeedbackFile(const FeedbackFile& file) {
   if (file.uploadPending()) {
     retryPendingUpload(file);
   } else if (file.fileType == FeedbackFileType::session) {
-    // Open files belong to a writer; processing and uploaded ones are left
-    // as they are.
-    if (file.sessionFilename && file.sessionFilename->state == SessionFileState::closed) postProcessAndUpload(file);
+    // Open files belong to a writer; uploaded ones are left as they are, and
+    // processing ones belong to this flush or to start-up recovery.
+    if (!file.sessionFilename) return;
+    if (file.sessionFilename->state == SessionFileState::closed) {
+      postProcessAndUpload(file);
+    } else if (file.sessionFilename->state == SessionFileState::processing) {
+      checkAgeOfPoisonFile(file);
+    }
   } else if (file.fileType == FeedbackFileType::custom) {
     validateAndUploadCustomFeedback(file);
   }
 }
 
+void FeedbackFlusher::checkAgeOfPoisonFile(const FeedbackFile& file) {
+  if (!poisonSessionIDs_.count(file.sessionFilename->sessionIDString())) return;
+  auto attrs = file.attributes ? file.attributes : assembly_.fileManager().attributes(file.fileURL);
+  if (!attrs || createdWithinMaxAge(attrs->creationDate)) return;
+  log().info("Discarding session because it's too old: {}.", file.fileName());
+  discardFeedback(file.fileURL, *knownFeedbackTypeFromName(FBFStrings::VireonProtobufFeedbackType),
+                  FeedbackDeletionReason::tooOld);
+}
+
 void FeedbackFlusher::retryPendingUpload(const FeedbackFile& file) {
-  // The walk may come across the upload files this flush has just made.
-  if (enqueuedFiles_.count(file.fileURL)) return;
   if (assembly_.isCancelled()) {
     log().debug("Flushing is cancelled, skipping {}.", file.fileName());
     return;
   }
-  if (uploadManager_) uploadManager_->retryUpload(file.fileURL, file.typeString());
+  if (!uploadManager_) return;
+  // A retry that was sent is in flight until its outcome; pruning must leave
+  // it alone until then.
+  const size_t before = uploadManager_->uploadsInFlight();
+  uploadManager_->retryUpload(file.fileURL, file.typeString());
+  if (uploadManager_->uploadsInFlight() > before) queuedUploads_.insert(file.fileURL);
+}
+
+void FeedbackFlusher::returnToClosed(const fs::path& processing) {
+  std::error_code ec;
+  if (vireon_renameForStateChange(assembly_.fileManager(), processing, SessionFileState::closed, ec)) {
+    log().info("Returned {} to closed for a later flush.", processing.filename().string());
+  } else {
+    log().error("Error trying to move file {} back to closed state: {}", processing.string(), ec.message());
+  }
 }
 
 void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
   auto& fm = assembly_.fileManager();
+  const bool protobufFormat = bag_ && bag_->vireonFeedbackFormat() == FBFStrings::VireonProtobufFeedbackType;
+  const std::string typeString(protobufFormat ? FBFStrings::VireonProtobufFeedbackType : FBFStrings::VireonFeedbackType);
+  // Without a usable endpoint the session is not claimed: it stays closed.
+  if (!uploadManager_ || !uploadManager_->canFormRequest(typeString)) return;
+
   std::error_code ec;
   auto processing = vireon_renameForStateChange(fm, file.fileURL, SessionFileState::processing, ec);
   if (!processing) {
@@ -170,16 +244,17 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
   auto bytes = readWholeFile(fm, path);
   if (!bytes) {
     log().error("Couldn't open file for reading.");
+    returnToClosed(path);
     return;
   }
 
-  const bool protobufFormat = bag_ && bag_->vireonFeedbackFormat() == FBFStrings::VireonProtobufFeedbackType;
-  const std::string typeString(protobufFormat ? FBFStrings::VireonProtobufFeedbackType : FBFStrings::VireonFeedbackType);
   std::optional<UploadRequest> request;
   {
     std::string guid = file.sessionFilename ? file.sessionFilename->sessionIDString() : name;
     SignpostInterval serialize("serialize session", ("file GUID:" + guid).c_str());
     corevireon::CVClientSession session;
+    // Undecodable and empty sessions stay in "processing": they are the
+    // file's own fault, and `fbfctl status` shows them.
     if (!session.ParseFromString(*bytes)) {
       log().error("File contents did not deserialize into a _CVClientSession");
       return;
@@ -190,7 +265,6 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
     }
     FlushableSession flushable(std::move(session));
     flushable.postProcessFeedback(usageStore_ ? usageStore_->usageEventSink() : nullptr);
-    if (!uploadManager_) return;
     if (protobufFormat) {
       if (assembly_.uploadListener()) tee(flushable.backingStore().SerializeAsString(), typeString);
       request = uploadManager_->uploadProtobufFeedback(flushable.backingStore(), path);
@@ -200,7 +274,11 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
       request = uploadManager_->uploadJSONFeedback(json, path);
     }
   }
-  if (!request) return;
+  if (!request) {
+    // No upload file was made (no space, no endpoint, ...): try again later.
+    returnToClosed(path);
+    return;
+  }
 
   // The processed payload has its own limit under its feedback type.
   const uint64_t processedLimit = sizeLimitFor(typeString);
@@ -211,19 +289,10 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
     return;
   }
 
-  {
-    SignpostInterval upload("upload");
-    enqueue(std::move(*request), attrs->size);
-  }
-
-  // The payload now lives in the upload file; the session file has served.
-  if (assembly_.userDefaults().boolForKey(FBFStrings::Defaults::LeaveFeedbackAfterUpload)) {
-    if (!vireon_renameForStateChange(fm, path, SessionFileState::uploaded, ec)) {
-      log().error("Error trying to move file to uploaded state for LeaveFeedbackAfterUpload: {}", ec.message());
-    }
-  } else if (!fm.removeItem(path, ec)) {
-    log().error("Error removing session file after flush");
-  }
+  SignpostInterval upload("upload");
+  // The payload now lives in the upload file; the session file goes once
+  // that is safe.
+  enqueue(std::move(*request), attrs->size, path);
 }
 
 void FeedbackFlusher::validateAndUploadCustomFeedback(const FeedbackFile& file) {
@@ -261,23 +330,24 @@ void FeedbackFlusher::validateAndUploadCustomFeedback(const FeedbackFile& file) 
     discardFeedback(file.fileURL, typeCode, FeedbackDeletionReason::noConsent);
     return;
   }
-  if (!uploadManager_) return;
+  // Without a usable endpoint the file stays where it is.
+  if (!uploadManager_ || !uploadManager_->canFormRequest(type)) return;
   if (assembly_.uploadListener()) {
     if (auto bytes = readWholeFile(fm, file.fileURL)) tee(*bytes, type);
   }
   auto request = uploadManager_->uploadCustomFeedback(file.fileURL, type);
   if (!request) return;
-  enqueue(std::move(*request), attrs->size);
-  if (!fm.removeItem(file.fileURL, ec)) log().error("Error removing custom feedback file after enqueuing it for upload.");
+  enqueue(std::move(*request), attrs->size, file.fileURL);
 }
 
 void FeedbackFlusher::tee(const std::string& payload, const std::string& format) {
   if (auto listener = assembly_.uploadListener()) listener->willUploadData(payload, format);
 }
 
-void FeedbackFlusher::enqueue(UploadRequest request, uint64_t fileSize) {
+void FeedbackFlusher::enqueue(UploadRequest request, uint64_t fileSize, const fs::path& source) {
   auto self = shared_from_this();
-  enqueuedFiles_.insert(request.fileURL);
+  queuedUploads_.insert(request.fileURL);
+  sourcesAwaitingSafety_[request.fileURL] = source;
   std::string type = request.typeString;
   auto size = static_cast<unsigned long>(request.uncompressedSize);
   auto compressed = static_cast<unsigned long>(request.compressedSize);
@@ -290,6 +360,32 @@ void FeedbackFlusher::enqueue(UploadRequest request, uint64_t fileSize) {
     }
     vireon_signpost_feedbackUpload(type.c_str(), static_cast<unsigned long>(fileSize), size, compressed);
   });
+  if (sourcesAwaitingSafety_.size() >= kSessionRemovalBatch) syncAndRetireSources();
+}
+
+void FeedbackFlusher::retireSource(const fs::path& source) {
+  auto& fm = assembly_.fileManager();
+  std::error_code ec;
+  auto name = SessionFilename::fromString(source.filename().string());
+  if (!name) {
+    if (!fm.removeItem(source, ec)) log().error("Error removing custom feedback file after enqueuing it for upload.");
+    return;
+  }
+  if (leaveFeedbackAfterUpload_) return;  // renamed to "uploaded" on its 200
+  if (!fm.removeItem(source, ec)) log().error("Error removing session file after flush");
+}
+
+void FeedbackFlusher::syncAndRetireSources() {
+  if (sourcesAwaitingSafety_.empty()) return;
+  auto& fm = assembly_.fileManager();
+  std::error_code ec;
+  auto dir = cacheDirNoCreate(fm);
+  // One sync for the batch: every upload file written so far is on disk
+  // before any of its sources goes. Where the file system cannot sync there
+  // is nothing better to wait for.
+  if (dir && !fm.syncFileSystem(*dir, ec)) log().debug("Cannot sync the cache file system: {}", ec.message());
+  for (const auto& [upload, source] : sourcesAwaitingSafety_) retireSource(source);
+  sourcesAwaitingSafety_.clear();
 }
 
 void FeedbackFlusher::discardFeedback(const fs::path& file, int typeCode, int32_t reason,
@@ -308,33 +404,62 @@ void FeedbackFlusher::discardFeedback(const fs::path& file, int typeCode, int32_
 void FeedbackFlusher::enumeratingFeedbackDidFinish() {
   if (walkFinished_) return;
   walkFinished_ = true;
+  walkWaiting_ = false;
   log().debug("flush complete, cleaning up");
   flushInterval_.reset();
+  syncAndRetireSources();
   if (usageStore_) usageStore_->flushCohortsFeedback();
-  if (bag_) pruneSessionFiles(kMaximumNumberOfFeedbackFiles);
   feedbackEnumerator_.reset();
+  pendingUploads_.clear();
   completeWhenUploadsSettle();
 }
 
 void FeedbackFlusher::pruneSessionFiles(int maximum) {
   auto& fm = assembly_.fileManager();
-  vireon_pruneSessionFiles(fm, maximum, [this, &fm](const fs::path& file) {
-    auto parsed = SessionFilename::fromString(file.filename().string());
-    std::string type(parsed ? queryParameterString(parsed->uploadFormat) : FBFStrings::VireonFeedbackType);
-    int code = knownFeedbackTypeFromName(type).value_or(0);
-    if (auto event = FeedbackDeletionEvent::make(file, code, FeedbackDeletionReason::pruned, assembly_.currentDate(), fm)) {
-      assembly_.didDeleteFeedbackFile(*event);
-    }
-  });
+  vireon_pruneSessionFiles(
+      fm, maximum,
+      [this, &fm](const fs::path& file) {
+        auto parsed = SessionFilename::fromString(file.filename().string());
+        std::string type(parsed ? queryParameterString(parsed->uploadFormat) : FBFStrings::VireonFeedbackType);
+        int code = knownFeedbackTypeFromName(type).value_or(0);
+        if (auto event =
+                FeedbackDeletionEvent::make(file, code, FeedbackDeletionReason::pruned, assembly_.currentDate(), fm)) {
+          assembly_.didDeleteFeedbackFile(*event);
+        }
+      },
+      [this](const fs::path& file) { return queuedUploads_.count(file) > 0; });
 }
 
-void FeedbackFlusher::uploadManagerDidUploadFile(const fs::path&, long) {
+void FeedbackFlusher::uploadManagerDidUploadFile(const fs::path& file, long status) {
+  if (status == 200) {
+    queuedUploads_.erase(file);
+    auto& fm = assembly_.fileManager();
+    if (auto node = sourcesAwaitingSafety_.extract(file); !node.empty()) retireSource(node.mapped());
+    // The session a delivered upload came from, kept for inspection.
+    auto name = SessionFilename::fromString(file.filename().string());
+    if (leaveFeedbackAfterUpload_ && name) {
+      name->uploadPending = false;
+      fs::path session = file.parent_path() / name->filenameString();
+      std::error_code ec;
+      if (fm.exists(session) && !vireon_renameForStateChange(fm, session, SessionFileState::uploaded, ec)) {
+        log().error("Error trying to move file to uploaded state for LeaveFeedbackAfterUpload: {}", ec.message());
+      }
+    }
+  }
+  if (walkWaiting_ && uploadManager_ && uploadManager_->uploadsInFlight() < kMaximumUploadsInFlight) {
+    walkWaiting_ = false;
+    flushNext();
+  }
   if (walkFinished_) completeWhenUploadsSettle();
 }
 
 void FeedbackFlusher::completeWhenUploadsSettle() {
   if (!enumerationCompletion_) return;
   if (uploadManager_ && uploadManager_->uploadsInFlight() > 0) return;
+  if (pruneWhenSettled_ && bag_) {
+    pruneWhenSettled_ = false;
+    pruneSessionFiles(kMaximumNumberOfFeedbackFiles);
+  }
   auto completion = std::move(enumerationCompletion_);
   enumerationCompletion_ = nullptr;
   completion();
@@ -352,6 +477,7 @@ void FeedbackFlusher::flushSessionEagerly(const fs::path& url, std::function<voi
       self->flushFeedbackFile(FeedbackFile(url, attrs));
     }
     self->walkFinished_ = true;
+    self->syncAndRetireSources();
     self->completeWhenUploadsSettle();
   });
 }

@@ -54,8 +54,9 @@ class UploadManagerProtocol {
  public:
   virtual ~UploadManagerProtocol() = default;
 
-  // Each preparation compresses its payload into the upload file and forms
-  // the request; no value on any failure (already logged).
+  // Each preparation forms the request and compresses its payload into the
+  // upload file, which appears under its name only once whole; no value on
+  // any failure (already logged), and then no upload file is left behind.
   // The session file at `sessionURL` names the upload file (its upload name,
   // in the shared cache directory).
   virtual std::optional<UploadRequest> uploadProtobufFeedback(const corevireon::CVClientSession& session,
@@ -64,6 +65,14 @@ class UploadManagerProtocol {
                                                           const fs::path& sessionURL) = 0;
   // Compresses `fileURL` into "<fileURL>.uploadPending" beside it.
   virtual std::optional<UploadRequest> uploadCustomFeedback(const fs::path& fileURL, const std::string& type) = 0;
+
+  // Whether an upload of `type` can be formed now: the bag names a usable
+  // endpoint for it. Files whose uploads cannot be formed are left as they
+  // are for a later flush; the reason is logged once per manager and type.
+  virtual bool canFormRequest(const std::string& type) {
+    (void)type;
+    return true;
+  }
 
   // Starts the upload. On HTTP 200 the upload file is deleted; otherwise it
   // stays for a retry. An offline-class network error cancels the flush.

@@ -21,26 +21,46 @@ constexpr const char* kNoWhitelistMaintenance = "whitelist maintenance unavailab
 
 // Forwards the daemon's calls to the client over the connection. Failures to
 // deliver are logged and otherwise ignored: the daemon keeps going.
+//
+// A subscriber that does not read must not make the daemon hold every
+// payload: once `kMaxPendingBytes` wait for it, further payloads are dropped
+// for this subscriber alone, and the next one it gets says how many it missed.
 class RemoteClientProxy final : public ClientConduit {
  public:
+  static constexpr size_t kMaxPendingBytes = size_t{16} << 20;
+
   explicit RemoteClientProxy(std::shared_ptr<ipc::FrameChannel> channel)
       : channel_(std::move(channel)) {}
 
   void willUploadData(const std::string& data, const std::string& format) override {
+    if (dropIfBehind()) return;
     ipc::DaemonMessage message;
     auto* body = message.mutable_willuploaddata();
     body->set_data(data);
     body->set_format(format);
+    body->set_missedbefore(takeMissed());
     send(message);
   }
 
   void willGenerateCohortFeebacks(const std::string& data) override {
+    if (dropIfBehind()) return;
     ipc::DaemonMessage message;
-    message.mutable_willgeneratecohortfeebacks()->set_data(data);
+    auto* body = message.mutable_willgeneratecohortfeebacks();
+    body->set_data(data);
+    body->set_missedbefore(takeMissed());
     send(message);
   }
 
  private:
+  bool dropIfBehind() {
+    if (channel_->pendingBytes() < kMaxPendingBytes) return false;
+    if (missed_++ == 0) connectionLog().warn("A subscriber is not reading; dropping payloads for it");
+    return true;
+  }
+  uint64_t takeMissed() { return std::exchange(missed_, 0); }
+
+  uint64_t missed_ = 0;
+
   void send(const ipc::DaemonMessage& message) {
     std::string bytes;
     if (!message.SerializeToString(&bytes)) {

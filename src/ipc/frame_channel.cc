@@ -148,6 +148,7 @@ void FrameChannel::send(std::string body, SendErrorHandler onError) {
   }
   Outgoing out{encodeFrameHeader(static_cast<uint32_t>(body.size())), std::move(onError)};
   out.bytes.append(body);
+  pendingBytes_ += out.bytes.size();
   asio::post(strand_, [self = shared_from_this(), out = std::move(out)]() mutable {
     self->enqueue(std::move(out));
   });
@@ -155,6 +156,7 @@ void FrameChannel::send(std::string body, SendErrorHandler onError) {
 
 void FrameChannel::enqueue(Outgoing out) {
   if (finished_ || closing_) {
+    pendingBytes_ -= out.bytes.size();
     if (out.onError) out.onError("connection invalidated");
     return;
   }
@@ -177,10 +179,12 @@ void FrameChannel::writeNext() {
         if (ec) {
           Outgoing failed = std::move(self->queue_.front());
           self->queue_.pop_front();
+          self->pendingBytes_ -= failed.bytes.size();
           if (failed.onError) failed.onError(ec.message());
           self->finish({CloseReason::ioError, ec.message()});
           return;
         }
+        self->pendingBytes_ -= self->queue_.front().bytes.size();
         self->queue_.pop_front();
         self->writeNext();
       }));

@@ -89,6 +89,10 @@ class FrameChannel : public std::enable_shared_from_this<FrameChannel> {
   // goes away.
   void close();
 
+  // Bytes handed to `send` that have not been written yet: how far a peer
+  // that does not read has fallen behind. Any thread.
+  size_t pendingBytes() const { return pendingBytes_.load(); }
+
   // False once close() was called or the connection ended.
   bool isOpen() const { return open_.load(); }
 
@@ -112,6 +116,7 @@ class FrameChannel : public std::enable_shared_from_this<FrameChannel> {
   const size_t maxIncoming_;
   const size_t maxOutgoing_;
   std::atomic<bool> open_{true};
+  std::atomic<size_t> pendingBytes_{0};
 
   // Strand only.
   FrameHandler onFrame_;

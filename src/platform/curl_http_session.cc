@@ -11,7 +11,7 @@
 
 #include <cerrno>
 #include <cstring>
-#include <map>
+#include <unordered_map>
 #include <mutex>
 #include <thread>
 #include <vector>
@@ -85,10 +85,15 @@ struct Transfer {
   CURL* easy = nullptr;
   curl_slist* headers = nullptr;
   HttpRequest request;
+  std::filesystem::path bodyPath;
+  // Opened when the transfer first reads its body, so that transfers waiting
+  // for a connection hold no descriptor.
   FileDescriptor body;
+  int64_t bodySize = 0;
   HttpCompletion completion;
   HttpResponse response;
   bool readFailed = false;
+  std::string readError;
   char errorBuffer[CURL_ERROR_SIZE] = {};
 
   ~Transfer() {
@@ -97,19 +102,44 @@ struct Transfer {
   }
 };
 
+// Opens the body without following links; only our own regular files.
+FileDescriptor openBody(const std::filesystem::path& path, std::string& why) {
+  FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd.valid()) {
+    why = std::string("cannot open the upload file: ") + strerror(errno);
+    return {};
+  }
+  struct stat st {};
+  if (fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
+    why = "the upload file is not a regular file owned by this user";
+    return {};
+  }
+  return fd;
+}
+
+bool ensureBodyOpen(Transfer& t) {
+  if (t.body.valid()) return true;
+  t.body = openBody(t.bodyPath, t.readError);
+  if (!t.body.valid()) t.readFailed = true;
+  return t.body.valid();
+}
+
 size_t readBody(char* buffer, size_t size, size_t nitems, void* userdata) {
   auto* t = static_cast<Transfer*>(userdata);
+  if (!ensureBodyOpen(*t)) return CURL_READFUNC_ABORT;
   while (true) {
     ssize_t n = ::read(t->body.get(), buffer, size * nitems);
     if (n >= 0) return static_cast<size_t>(n);
     if (errno == EINTR) continue;
     t->readFailed = true;
+    t->readError = strerror(errno);
     return CURL_READFUNC_ABORT;
   }
 }
 
 int seekBody(void* userdata, curl_off_t offset, int origin) {
   auto* t = static_cast<Transfer*>(userdata);
+  if (!ensureBodyOpen(*t)) return CURL_SEEKFUNC_FAIL;
   return ::lseek(t->body.get(), static_cast<off_t>(offset), origin) < 0 ? CURL_SEEKFUNC_FAIL : CURL_SEEKFUNC_OK;
 }
 
@@ -129,29 +159,18 @@ size_t collectHeader(char* buffer, size_t size, size_t nitems, void* userdata) {
   return size * nitems;
 }
 
-// Opens the body without following links; only our own regular files.
-FileDescriptor openBody(const std::filesystem::path& path, int64_t& size, std::string& why) {
-  FileDescriptor fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
-  if (!fd.valid()) {
-    why = std::string("cannot open the upload file: ") + strerror(errno);
-    return {};
-  }
-  struct stat st {};
-  if (fstat(fd.get(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
-    why = "the upload file is not a regular file owned by this user";
-    return {};
-  }
-  size = st.st_size;
-  return fd;
-}
-
 class CurlHttpSession final : public HttpClientSession, public std::enable_shared_from_this<CurlHttpSession> {
  public:
+  // Finished easy handles kept for reuse (they keep their TLS session cache
+  // and buffers); more than this are freed.
+  static constexpr size_t kSpareHandles = 32;
+
   explicit CurlHttpSession(HttpSessionConfiguration config) : config_(std::move(config)) {
     if (!config_.delegateQueue) throw std::invalid_argument("an HTTP session needs a delegate queue");
     globalInitOnce();
     multi_ = curl_multi_init();
     curl_multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, static_cast<long>(std::max(1, config_.maxConnectionsPerHost)));
+    curl_multi_setopt(multi_, CURLMOPT_PIPELINING, static_cast<long>(CURLPIPE_MULTIPLEX));
     thread_ = std::thread([this] { run(); });
   }
 
@@ -170,31 +189,31 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     }
     for (auto& [easy, t] : active_) curl_multi_remove_handle(multi_, easy);
     active_.clear();
+    spare_.clear();
     curl_multi_cleanup(multi_);
   }
 
   void uploadFile(HttpRequest request, std::filesystem::path body, HttpCompletion completion) override {
     {
       std::lock_guard lock(mutex_);
-      if (invalidating_) {
+      if (invalidating_ || cancelling_) {
         fail(std::move(completion), {HttpErrorDomain::url, HttpErrorCode::cancelled, "the session is invalidated"});
         return;
       }
     }
-    auto t = std::make_unique<Transfer>();
-    int64_t size = 0;
-    std::string why;
-    t->body = openBody(body, size, why);
-    if (!t->body.valid()) {
-      fail(std::move(completion), {HttpErrorDomain::url, HttpErrorCode::fileUnreadable, why});
+    // The size is known up front (the body goes out with a Content-Length);
+    // the file itself is opened only when the transfer starts sending.
+    struct stat st {};
+    if (::lstat(body.c_str(), &st) != 0 || !S_ISREG(st.st_mode) || st.st_uid != geteuid()) {
+      fail(std::move(completion), {HttpErrorDomain::url, HttpErrorCode::fileUnreadable,
+                                   "the upload file is not a regular file owned by this user"});
       return;
     }
+    auto t = std::make_unique<Transfer>();
+    t->bodyPath = std::move(body);
+    t->bodySize = st.st_size;
     t->request = std::move(request);
     t->completion = std::move(completion);
-    if (!configure(*t, size)) {
-      fail(std::move(t->completion), {HttpErrorDomain::other, HttpErrorCode::other, "cannot set up the transfer"});
-      return;
-    }
     {
       std::lock_guard lock(mutex_);
       incoming_.push_back(std::move(t));
@@ -212,6 +231,14 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     curl_multi_wakeup(multi_);
   }
 
+  void cancelAllTasks() override {
+    {
+      std::lock_guard lock(mutex_);
+      cancelling_ = true;
+    }
+    curl_multi_wakeup(multi_);
+  }
+
  private:
   void fail(HttpCompletion completion, HttpError error) {
     config_.delegateQueue->async([completion = std::move(completion), error = std::move(error)] {
@@ -219,8 +246,24 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     });
   }
 
-  bool configure(Transfer& t, int64_t size) {
-    t.easy = curl_easy_init();
+  // The session's thread only.
+  CURL* takeHandle() {
+    if (spare_.empty()) return curl_easy_init();
+    CURL* e = spare_.back().release();
+    spare_.pop_back();
+    curl_easy_reset(e);
+    return e;
+  }
+
+  void recycle(Transfer& t) {
+    if (!t.easy) return;
+    if (spare_.size() < kSpareHandles) spare_.emplace_back(t.easy);
+    else curl_easy_cleanup(t.easy);
+    t.easy = nullptr;
+  }
+
+  bool configure(Transfer& t) {
+    t.easy = takeHandle();
     if (!t.easy) return false;
     CURL* e = t.easy;
     curl_easy_setopt(e, CURLOPT_URL, t.request.url.c_str());
@@ -229,6 +272,10 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     curl_easy_setopt(e, CURLOPT_PRIVATE, &t);
     curl_easy_setopt(e, CURLOPT_ERRORBUFFER, t.errorBuffer);
     curl_easy_setopt(e, CURLOPT_FOLLOWLOCATION, 0L);
+    // HTTP/2 where the server offers it (as streams of one connection);
+    // transfers wait for that connection rather than opening more.
+    curl_easy_setopt(e, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
+    curl_easy_setopt(e, CURLOPT_PIPEWAIT, 1L);
 
     curl_easy_setopt(e, CURLOPT_READFUNCTION, readBody);
     curl_easy_setopt(e, CURLOPT_READDATA, &t);
@@ -236,10 +283,10 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     curl_easy_setopt(e, CURLOPT_SEEKDATA, &t);
     if (t.request.method == "PUT") {
       curl_easy_setopt(e, CURLOPT_UPLOAD, 1L);
-      curl_easy_setopt(e, CURLOPT_INFILESIZE_LARGE, static_cast<curl_off_t>(size));
+      curl_easy_setopt(e, CURLOPT_INFILESIZE_LARGE, static_cast<curl_off_t>(t.bodySize));
     } else {
       curl_easy_setopt(e, CURLOPT_POST, 1L);
-      curl_easy_setopt(e, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(size));
+      curl_easy_setopt(e, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(t.bodySize));
       if (t.request.method != "POST") curl_easy_setopt(e, CURLOPT_CUSTOMREQUEST, t.request.method.c_str());
     }
     curl_easy_setopt(e, CURLOPT_WRITEFUNCTION, discardBody);
@@ -275,12 +322,22 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
   void run() {
     while (true) {
       std::vector<std::unique_ptr<Transfer>> incoming;
+      bool cancel = false;
       {
         std::lock_guard lock(mutex_);
         if (stop_) return;
         incoming.swap(incoming_);
+        cancel = cancelling_;
       }
       for (auto& t : incoming) {
+        if (cancel) {
+          fail(std::move(t->completion), {HttpErrorDomain::url, HttpErrorCode::cancelled, "the upload was cancelled"});
+          continue;
+        }
+        if (!configure(*t)) {
+          fail(std::move(t->completion), {HttpErrorDomain::other, HttpErrorCode::other, "cannot set up the transfer"});
+          continue;
+        }
         CURL* easy = t->easy;
         if (curl_multi_add_handle(multi_, easy) != CURLM_OK) {
           fail(std::move(t->completion), {HttpErrorDomain::other, HttpErrorCode::other, "cannot start the transfer"});
@@ -288,6 +345,7 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
         }
         active_.emplace(easy, std::move(t));
       }
+      if (cancel) cancelActive();
       int running = 0;
       curl_multi_perform(multi_, &running);
       int queued = 0;
@@ -297,6 +355,16 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
       maybeInvalidate();
       curl_multi_poll(multi_, nullptr, 0, 1000, nullptr);
     }
+  }
+
+  // Abandons every running transfer; their files stay with their owners.
+  void cancelActive() {
+    for (auto& [easy, t] : active_) {
+      curl_multi_remove_handle(multi_, easy);
+      fail(std::move(t->completion), {HttpErrorDomain::url, HttpErrorCode::cancelled, "the upload was cancelled"});
+      recycle(*t);
+    }
+    active_.clear();
   }
 
   void finish(CURL* easy, CURLcode result) {
@@ -314,9 +382,12 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     } else {
       long osErrno = 0;
       curl_easy_getinfo(easy, CURLINFO_OS_ERRNO, &osErrno);
-      error = httpErrorFromCurl(t->readFailed ? CURLE_READ_ERROR : result, osErrno, t->errorBuffer);
+      std::string detail = t->readFailed ? t->readError : std::string(t->errorBuffer);
+      error = httpErrorFromCurl(t->readFailed ? CURLE_READ_ERROR : result, osErrno, detail);
       log().debug("Transfer to {} failed: {}", t->request.url, error->description);
     }
+    t->body.reset();
+    recycle(*t);
     config_.delegateQueue->async([completion = std::move(t->completion), response = std::move(response),
                                   error = std::move(error)]() mutable {
       if (completion) completion(std::move(response), std::move(error));
@@ -338,6 +409,10 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     });
   }
 
+  struct EasyCleanup {
+    void operator()(CURL* e) const { curl_easy_cleanup(e); }
+  };
+
   HttpSessionConfiguration config_;
   CURLM* multi_ = nullptr;
   std::thread thread_;
@@ -346,8 +421,10 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
   bool stop_ = false;                                // guarded by mutex_
   bool invalidating_ = false;                        // guarded by mutex_
   bool invalidated_ = false;                         // guarded by mutex_
+  bool cancelling_ = false;                          // guarded by mutex_
   std::shared_ptr<CurlHttpSession> keepAlive_;       // guarded by mutex_
-  std::map<CURL*, std::unique_ptr<Transfer>> active_;  // the session's thread only
+  std::unordered_map<CURL*, std::unique_ptr<Transfer>> active_;  // the session's thread only
+  std::vector<std::unique_ptr<CURL, EasyCleanup>> spare_;        // the session's thread only
 };
 
 }  // namespace

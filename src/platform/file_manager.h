@@ -114,6 +114,14 @@ class FileManager {
   // is where the class would be set.
   virtual bool setOwnerOnlyProtection(const fs::path& path, std::error_code& error) = 0;
 
+  // Makes everything written to the file system that holds `path` durable
+  // (syncfs). One call covers any number of files, so callers batch it.
+  virtual bool syncFileSystem(const fs::path& path, std::error_code& error) {
+    (void)path;
+    error = std::make_error_code(std::errc::function_not_supported);
+    return false;
+  }
+
   // Sets the modification date of the file or link itself (never its target).
   // Implementations that cannot do this report "function not supported".
   virtual bool setModificationDate(const fs::path& path, SystemTime date, std::error_code& error) {

@@ -172,6 +172,15 @@ class PosixFileManager final : public FileManager {
     return fd;
   }
 
+  bool syncFileSystem(const fs::path& path, std::error_code& error) override {
+    FileDescriptor fd(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+    if (!fd.valid() || syncfs(fd.get()) != 0) {
+      error = lastError();
+      return false;
+    }
+    return true;
+  }
+
   FileDescriptor createForWriting(const fs::path& path, std::error_code& error) override {
     FileDescriptor fd(open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0600));
     if (!fd.valid()) {

@@ -4,7 +4,9 @@
 // on the delegate queue given at creation. TLS peer verification is always on.
 // `finishTasksAndInvalidate` lets running tasks finish, then calls the
 // configuration's `onInvalidated` once (on the delegate queue) and refuses new
-// tasks. Thread-safety: `uploadFile` and `finishTasksAndInvalidate` may be
+// tasks. `cancelAllTasks` abandons every task, queued or running: each
+// completion is called with a `cancelled` error of the URL domain, so the
+// caller keeps its file for a later run. Thread-safety: every member may be
 // called from any thread.
 #pragma once
 
@@ -67,11 +69,14 @@ class HttpClientSession {
   virtual ~HttpClientSession() = default;
   virtual void uploadFile(HttpRequest request, std::filesystem::path body, HttpCompletion completion) = 0;
   virtual void finishTasksAndInvalidate() = 0;
+  virtual void cancelAllTasks() = 0;
 };
 
 struct HttpSessionConfiguration {
   std::shared_ptr<TaskQueue> delegateQueue;
   std::function<void()> onInvalidated;
+  // HTTP/1.1 connections to one host; over HTTP/2 the transfers share one
+  // connection as streams instead.
   int maxConnectionsPerHost = 1;
   // libcurl pinned-public-key string ("sha256//...;sha256//..." or a PEM/DER file).
   std::optional<std::string> pinnedPublicKeys;

@@ -14,6 +14,7 @@
 #include <unistd.h>
 
 #include <array>
+#include <cstring>
 #include <ostream>
 
 namespace fbf {
@@ -63,6 +64,42 @@ bool isOfflineError(const HttpError& e) {
       return false;
   }
 }
+
+// An upload file is written under a hidden name beside its final one and
+// renamed into place only once complete, so that an upload file that exists
+// always holds a whole payload, whatever moment the process dies at. A
+// writer that is not committed removes its partial file.
+class PartialUploadFile {
+ public:
+  PartialUploadFile(FileManager& fm, fs::path finalPath)
+      : fm_(fm), finalPath_(std::move(finalPath)),
+        partialPath_(finalPath_.parent_path() / ("." + finalPath_.filename().string() + ".partial")) {}
+  ~PartialUploadFile() {
+    if (!committed_) {
+      std::error_code ec;
+      fm_.removeItem(partialPath_, ec);
+    }
+  }
+  PartialUploadFile(const PartialUploadFile&) = delete;
+  PartialUploadFile& operator=(const PartialUploadFile&) = delete;
+
+  FileDescriptor create() {
+    std::error_code ec;
+    return fm_.createForWriting(partialPath_, ec);
+  }
+  bool commit() {
+    std::error_code ec;
+    committed_ = fm_.moveItem(partialPath_, finalPath_, ec);
+    return committed_;
+  }
+  const fs::path& finalPath() const { return finalPath_; }
+
+ private:
+  FileManager& fm_;
+  fs::path finalPath_;
+  fs::path partialPath_;
+  bool committed_ = false;
+};
 
 }  // namespace
 
@@ -120,6 +157,7 @@ UploadManager::UploadManager(FBFAssemblyProtocol& assembly, UploadBuildPredicate
       predicates_(std::move(predicates)),
       uploadSession_(assembly.makeUploadSession()),
       bag_(assembly.cachedBag()),
+      ageLimit_(FeedbackAgeLimit::fromBag(bag_)),
       fileManager_(assembly.fileManager()),
       core_(std::make_shared<Core>(assembly)) {
   if (!predicates_.isSeedBuild) predicates_.isSeedBuild = [] { return vireon_isSeedBuild(); };
@@ -191,127 +229,146 @@ std::optional<std::string> UploadManager::endpointForCustomType(const Configurat
 
 // ---- upload files ----
 
-std::optional<std::pair<FileDescriptor, fs::path>> UploadManager::makeFileForCompressedVireonFeedback(
-    const SessionFilename& session) {
+std::optional<fs::path> UploadManager::uploadFileForSession(const SessionFilename& session) const {
   auto dir = cacheDirNoCreate(fileManager_);
   if (!dir) return std::nullopt;
-  fs::path path = *dir / session.uploadFilenameString();
-  std::error_code ec;
-  FileDescriptor fd = fileManager_.createForWriting(path, ec);
-  if (!fd.valid()) return std::nullopt;
-  return std::make_pair(std::move(fd), std::move(path));
+  return *dir / session.uploadFilenameString();
 }
 
-std::optional<std::pair<FileDescriptor, fs::path>> UploadManager::makeFileForCompressedCustomFeedback(
-    const fs::path& url) {
+fs::path UploadManager::uploadFileForCustomFeedback(const fs::path& url) {
   fs::path path = url;
   path += std::string(FBFStrings::UploadPendingSuffix);
-  std::error_code ec;
-  FileDescriptor fd = fileManager_.createForWriting(path, ec);
-  if (!fd.valid()) return std::nullopt;
-  return std::make_pair(std::move(fd), std::move(path));
+  return path;
 }
 
-std::optional<fs::path> UploadManager::urlForFileHandle(int fd) {
-  std::array<char, 4096> buf{};
-  auto link = "/proc/self/fd/" + std::to_string(fd);
-  ssize_t n = readlink(link.c_str(), buf.data(), buf.size() - 1);
-  if (n <= 0 || buf[0] != '/') return std::nullopt;
-  return fs::path(std::string(buf.data(), static_cast<size_t>(n)));
+std::optional<std::string> UploadManager::endpointFor(const std::string& type) const {
+  if (!bag_) return std::nullopt;
+  return endpointForCustomType(*bag_, type);
 }
 
-void UploadManager::removeQuietly(const fs::path& file) {
-  std::error_code ec;
-  fileManager_.removeItem(file, ec);
-}
-
-// ---- preparations ----
-
-std::optional<UploadRequest> UploadManager::uploadProtobufFeedback(const corevireon::CVClientSession& session,
-                                                                   const fs::path& sessionURL) {
-  auto name = SessionFilename::fromString(sessionURL.filename().string());
-  if (name) name->uploadFormat = UploadFormat::pb;
-  auto file = name ? makeFileForCompressedVireonFeedback(*name) : std::nullopt;
-  if (!file) {
-    log().error("Error getting temp file.");
-    return std::nullopt;
-  }
-  auto& [fd, fileURL] = *file;
-  // Until the payload is compressed the upload file is an empty placeholder;
-  // it is removed when the preparation fails before that.
-  auto endpoint = bag_ ? bag_->feedbackURL() : std::nullopt;
+std::optional<HttpRequest> UploadManager::requestFor(const std::string& type) {
+  auto endpoint = endpointFor(type);
   if (!endpoint) {
     log().error("feedback uploader found no upload endpoint from defaults.");
-    removeQuietly(fileURL);
     return std::nullopt;
   }
-  std::string bytes;
-  if (!session.SerializeToString(&bytes)) {
-    log().error("Session didn't serialize properly to protobuf.");
-    removeQuietly(fileURL);
-    return std::nullopt;
-  }
-  auto fileStream = std::make_shared<FileOutputStream>(std::move(fd));
-  CompressedOutputStream stream(fileStream);
-  log().debug("Compressing feedback to {}", fileURL.string());
-  stream.open();
-  if (fileStream->streamStatus() == StreamStatus::error) {
-    log().error("error opening output stream");
-    removeQuietly(fileURL);
-    return std::nullopt;
-  }
-  stream.write(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
-  stream.close();
-
-  if (assembly_.userDefaults().boolForKey(FBFStrings::Defaults::LeaveFeedbackAfterUpload)) {
-    log().info("Respecting LeaveFeedbackAfterUpload and leaving compressed feedback file {}", fileURL.string());
-    std::error_code ec;
-    auto dir = cacheDirNoCreate(fileManager_);
-    bool copied = false;
-    if (dir) copied = fileManager_.copyItem(fileURL, *dir / (sessionURL.filename().string() + ".deflate"), ec);
-    if (!copied) log().error("Error copying compressed upload data for LeaveFeedbackAfterUpload {}", fileURL.string());
-  }
-
-  HttpRequest request;
   try {
-    request = feedbackUploadRequest(*endpoint, std::string(FBFStrings::VireonProtobufFeedbackType));
+    return feedbackUploadRequest(*endpoint, type);
   } catch (const VireonURLRequestBuilder::URLError&) {
     log().error("feedbackUploadRequest failed because of bad url.");
     return std::nullopt;
   }
-  setHeader(request, FBFStrings::HTTPHeaders::Digest, stream.dataDigestForStream());
-  log().debug("Protobuf vireon feedback upload to {}", request.url.empty() ? "unknown?" : request.url);
-  return UploadRequest{std::move(request), fileURL, stream.uncompressedBytesWritten(), stream.compressedBytesWritten(),
-                       std::string(FBFStrings::VireonProtobufFeedbackType)};
 }
 
-std::optional<UploadRequest> UploadManager::uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
-                                                               const fs::path& sessionURL) {
-  auto name = SessionFilename::fromString(sessionURL.filename().string());
-  if (name) name->uploadFormat = UploadFormat::json;
-  auto file = name ? makeFileForCompressedVireonFeedback(*name) : std::nullopt;
-  if (!file) {
-    log().error("Error getting temp file.");
-    return std::nullopt;
+bool UploadManager::canFormRequest(const std::string& type) {
+  auto endpoint = endpointFor(type);
+  bool usable = false;
+  if (endpoint) {
+    try {
+      feedbackUploadRequest(*endpoint, type);
+      usable = true;
+    } catch (const VireonURLRequestBuilder::URLError&) {
+    }
   }
-  auto& [fd, fileURL] = *file;
-  auto endpoint = bag_ ? bag_->feedbackURL() : std::nullopt;
-  if (!endpoint) {
-    log().error("feedback uploader found no upload endpoint from defaults.");
-    removeQuietly(fileURL);
+  if (!usable && unusableTypesLogged_.insert(type).second) {
+    log().error("No usable upload endpoint for {} in the bag; its files stay for a later flush.", type);
+  }
+  return usable;
+}
+
+// Compresses whatever `produce` writes into the upload file at `finalPath`.
+// No value when the file cannot be written whole (nothing is left behind).
+std::optional<UploadManager::Compressed> UploadManager::compressInto(
+    const fs::path& finalPath, const std::function<bool(CompressedOutputStream&)>& produce) {
+  PartialUploadFile file(fileManager_, finalPath);
+  FileDescriptor fd = file.create();
+  if (!fd.valid()) {
+    log().error("Error getting temp file.");
     return std::nullopt;
   }
   auto fileStream = std::make_shared<FileOutputStream>(std::move(fd));
   CompressedOutputStream stream(fileStream);
-  log().debug("Compressing feedback to {}", fileURL.string());
+  log().debug("Compressing feedback to {}", finalPath.string());
   stream.open();
   if (fileStream->streamStatus() == StreamStatus::error) {
     log().error("error opening output stream");
-    removeQuietly(fileURL);
     return std::nullopt;
   }
-  bool serialised = true;
-  {
+  bool produced = produce(stream);
+  stream.close();
+  if (!produced) return std::nullopt;
+  // The compressing stream does not look at its file's writes; a full disk
+  // shows here, and a truncated payload must never be sent.
+  if (fileStream->streamStatus() == StreamStatus::error || stream.streamStatus() == StreamStatus::error) {
+    log().error("Error writing the upload file {}", finalPath.string());
+    return std::nullopt;
+  }
+  if (!file.commit()) {
+    log().error("Error getting temp file.");
+    return std::nullopt;
+  }
+  return Compressed{stream.uncompressedBytesWritten(), stream.compressedBytesWritten(), stream.dataDigestForStream()};
+}
+
+UploadRequest UploadManager::finish(HttpRequest request, const fs::path& fileURL, const Compressed& compressed,
+                                    std::string typeString) {
+  setHeader(request, FBFStrings::HTTPHeaders::Digest, compressed.digest);
+  return UploadRequest{std::move(request), fileURL, compressed.uncompressedSize, compressed.compressedSize,
+                       std::move(typeString)};
+}
+
+// ---- preparations ----
+// Each forms the request first: a request that cannot be formed leaves no
+// compressed copy behind.
+
+std::optional<UploadRequest> UploadManager::uploadProtobufFeedback(const corevireon::CVClientSession& session,
+                                                                   const fs::path& sessionURL) {
+  const std::string type(FBFStrings::VireonProtobufFeedbackType);
+  auto name = SessionFilename::fromString(sessionURL.filename().string());
+  if (name) name->uploadFormat = UploadFormat::pb;
+  auto fileURL = name ? uploadFileForSession(*name) : std::nullopt;
+  if (!fileURL) {
+    log().error("Error getting temp file.");
+    return std::nullopt;
+  }
+  auto request = requestFor(type);
+  if (!request) return std::nullopt;
+  std::string bytes;
+  if (!session.SerializeToString(&bytes)) {
+    log().error("Session didn't serialize properly to protobuf.");
+    return std::nullopt;
+  }
+  auto compressed = compressInto(*fileURL, [&](CompressedOutputStream& stream) {
+    stream.write(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
+    return true;
+  });
+  if (!compressed) return std::nullopt;
+
+  if (assembly_.userDefaults().boolForKey(FBFStrings::Defaults::LeaveFeedbackAfterUpload)) {
+    log().info("Respecting LeaveFeedbackAfterUpload and leaving compressed feedback file {}", fileURL->string());
+    std::error_code ec;
+    auto dir = cacheDirNoCreate(fileManager_);
+    bool copied = false;
+    if (dir) copied = fileManager_.copyItem(*fileURL, *dir / (sessionURL.filename().string() + ".deflate"), ec);
+    if (!copied) log().error("Error copying compressed upload data for LeaveFeedbackAfterUpload {}", fileURL->string());
+  }
+  log().debug("Protobuf vireon feedback upload to {}", request->url.empty() ? "unknown?" : request->url);
+  return finish(std::move(*request), *fileURL, *compressed, type);
+}
+
+std::optional<UploadRequest> UploadManager::uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
+                                                               const fs::path& sessionURL) {
+  const std::string type(FBFStrings::VireonFeedbackType);
+  auto name = SessionFilename::fromString(sessionURL.filename().string());
+  if (name) name->uploadFormat = UploadFormat::json;
+  auto fileURL = name ? uploadFileForSession(*name) : std::nullopt;
+  if (!fileURL) {
+    log().error("Error getting temp file.");
+    return std::nullopt;
+  }
+  auto request = requestFor(type);
+  if (!request) return std::nullopt;
+  auto compressed = compressInto(*fileURL, [&](CompressedOutputStream& stream) {
     CompressedStreamBuf buffer(stream);
     std::ostream out(&buffer);
     try {
@@ -320,29 +377,17 @@ std::optional<UploadRequest> UploadManager::uploadJSONFeedback(const nlohmann::o
     } catch (const nlohmann::json::exception& e) {
       // Strings that are not UTF-8 cannot be written as JSON.
       log().error("Session didn't serialize properly to JSON: {}", e.what());
-      serialised = false;
+      return false;
     }
-  }
-  stream.close();
-  if (!serialised) {
-    removeQuietly(fileURL);
+    return true;
+  });
+  if (!compressed) return std::nullopt;
+  if (!fileManager_.exists(*fileURL)) {
+    log().error("Couldn't find file {} after compression.", fileURL->string());
     return std::nullopt;
   }
-  if (!fileManager_.exists(fileURL)) {
-    log().error("Couldn't find file {} after compression.", fileURL.string());
-    return std::nullopt;
-  }
-  HttpRequest request;
-  try {
-    request = feedbackUploadRequest(*endpoint, std::string(FBFStrings::VireonFeedbackType));
-  } catch (const VireonURLRequestBuilder::URLError&) {
-    log().error("feedbackUploadRequest failed because of bad url.");
-    return std::nullopt;
-  }
-  setHeader(request, FBFStrings::HTTPHeaders::Digest, stream.dataDigestForStream());
-  log().debug("JSON vireon feedback upload to {}", request.url.empty() ? "unknown?" : request.url);
-  return UploadRequest{std::move(request), fileURL, stream.uncompressedBytesWritten(), stream.compressedBytesWritten(),
-                       std::string(FBFStrings::VireonFeedbackType)};
+  log().debug("JSON vireon feedback upload to {}", request->url.empty() ? "unknown?" : request->url);
+  return finish(std::move(*request), *fileURL, *compressed, type);
 }
 
 std::optional<UploadRequest> UploadManager::uploadCustomFeedback(const fs::path& fileURL, const std::string& type) {
@@ -352,55 +397,33 @@ std::optional<UploadRequest> UploadManager::uploadCustomFeedback(const fs::path&
     log().error("Feedback endpoint or appropriate type not set, data can't be sent to server.");
     return std::nullopt;
   }
+  auto request = requestFor(type);
+  if (!request) return std::nullopt;
   log().debug("uploadFile: {}.", fileURL.string());
-  auto file = makeFileForCompressedCustomFeedback(fileURL);
-  if (!file) {
-    log().error("Error getting temp file.");
-    return std::nullopt;
-  }
-  auto& [fd, outURL] = *file;
   std::error_code ec;
   FileDescriptor input = fileManager_.openForReading(fileURL, ec);
   if (!input.valid()) {
     // Links and files that are not ours are never read.
     log().error("Couldn't open custom feedback file {}: {}", fileURL.string(), ec.message());
-    removeQuietly(outURL);
     return std::nullopt;
   }
-  auto fileStream = std::make_shared<FileOutputStream>(std::move(fd));
-  CompressedOutputStream stream(fileStream);
-  stream.open();
-  std::array<uint8_t, 8192> buffer{};
-  bool readFailed = false;
-  while (true) {
-    ssize_t n = ::read(input.get(), buffer.data(), buffer.size());
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) {
-      readFailed = true;
-      ec = std::error_code(errno, std::generic_category());
-      break;
+  const fs::path outURL = uploadFileForCustomFeedback(fileURL);
+  auto compressed = compressInto(outURL, [&](CompressedOutputStream& stream) {
+    std::array<uint8_t, 8192> buffer{};
+    while (true) {
+      ssize_t n = ::read(input.get(), buffer.data(), buffer.size());
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) {
+        log().error("Couldn't open custom feedback file {}: {}", fileURL.string(), std::strerror(errno));
+        return false;
+      }
+      if (n == 0) return true;
+      stream.write(buffer.data(), static_cast<size_t>(n));
     }
-    if (n == 0) break;
-    stream.write(buffer.data(), static_cast<size_t>(n));
-  }
-  input.reset();
-  stream.close();
-  if (readFailed) {
-    log().error("Couldn't open custom feedback file {}: {}", fileURL.string(), ec.message());
-    removeQuietly(outURL);
-    return std::nullopt;
-  }
-  HttpRequest request;
-  try {
-    request = feedbackUploadRequest(*endpoint, type);
-  } catch (const VireonURLRequestBuilder::URLError&) {
-    log().error("feedbackUploadRequest failed because of bad url.");
-    return std::nullopt;
-  }
-  setHeader(request, FBFStrings::HTTPHeaders::Digest, stream.dataDigestForStream());
-  log().debug("Custom upload to {}", request.url);
-  return UploadRequest{std::move(request), outURL, stream.uncompressedBytesWritten(), stream.compressedBytesWritten(),
-                       type};
+  });
+  if (!compressed) return std::nullopt;
+  log().debug("Custom upload to {}", request->url);
+  return finish(std::move(*request), outURL, *compressed, type);
 }
 
 // ---- sending ----
@@ -429,26 +452,11 @@ void UploadManager::enqueue(UploadRequest request, UploadCompletion completion) 
 
 size_t UploadManager::uploadsInFlight() const { return core_->inFlight; }
 
-bool UploadManager::fileWasCreatedInTheLast(int64_t maxAgeDays, SystemTime creation, SystemTime now) {
-  int64_t age = std::chrono::duration_cast<std::chrono::seconds>(now - creation).count();
-  int64_t limit;
-  if (__builtin_mul_overflow(maxAgeDays, FBFConstants::SecondsPerDay, &limit)) FBF_FATAL("age limit overflow");
-  return limit > age;
-}
-
-bool UploadManager::fileWasCreatedInTheLast(const fs::path& file, int64_t maxAgeDays) {
-  auto attributes = fileManager_.attributes(file);
-  if (!attributes) return false;
-  return fileWasCreatedInTheLast(maxAgeDays, attributes->creationDate, assembly_.currentDate());
-}
-
 void UploadManager::retryUpload(const fs::path& fileURL, const std::string& typeString) {
-  int64_t maxAge = FBFConstants::DefaultFeedbackMaxAgeInDays;
-  if (bag_) maxAge = bag_->feedbackMaxAgeInDays().value_or(maxAge);
-
-  if (fileWasCreatedInTheLast(fileURL, maxAge)) {
-    auto endpoint = bag_ ? bag_->feedbackURL() : std::nullopt;
-    if (typeString == "Crowdsourcing" && bag_) endpoint = endpointForCustomType(*bag_, typeString);
+  // A file whose creation date cannot be read counts as too old.
+  auto attributes = fileManager_.attributes(fileURL);
+  if (attributes && ageLimit_.allows(attributes->creationDate, assembly_.currentDate())) {
+    auto endpoint = endpointFor(typeString);
     if (!endpoint) {
       log().error("feedback uploader found no upload endpoint from defaults.");
       return;

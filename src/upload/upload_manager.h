@@ -12,11 +12,16 @@
 // is destroyed; completions that arrive after that still apply the outcome
 // rules but no longer call the delegate.
 //
+// Upload files are written under a hidden ".<name>.partial" name and renamed
+// into place once whole, so an upload file that exists always holds a whole
+// payload; a preparation that fails leaves nothing behind.
+//
 // Endpoints: session feedback and every custom type go to the bag's
 // "feedback_url", except "Crowdsourcing", which goes to "crowdsourcing_url"
 // when the bag has one (and to "feedback_url" otherwise).
 #pragma once
 
+#include "assembly/age_limit.h"
 #include "flushing/session_filename.h"
 #include "flushing/upload_manager_protocol.h"
 #include "upload/url_request_builder.h"
@@ -24,10 +29,13 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
 namespace fbf {
+
+class CompressedOutputStream;
 
 // The build facts that decide the "seed" and "internal" query items.
 struct UploadBuildPredicates {
@@ -62,13 +70,12 @@ class UploadManager final : public UploadManagerProtocol {
   void retryUpload(const fs::path& fileURL, const std::string& typeString) override;
   void setDelegate(UploadManagerDelegate* delegate) override;
 
-  // The session's upload file (its upload name, in the shared cache
-  // directory), created empty, 0600, open for writing.
-  std::optional<std::pair<FileDescriptor, fs::path>> makeFileForCompressedVireonFeedback(const SessionFilename& session);
-  // "<url>.uploadPending" beside `url`, created empty, 0600, open for writing.
-  std::optional<std::pair<FileDescriptor, fs::path>> makeFileForCompressedCustomFeedback(const fs::path& url);
-  // The path an open descriptor refers to.
-  static std::optional<fs::path> urlForFileHandle(int fd);
+  // Where the upload file of a session goes: its upload name, in the shared
+  // cache directory; no value without a cache directory.
+  std::optional<fs::path> uploadFileForSession(const SessionFilename& session) const;
+  // "<url>.uploadPending" beside `url`.
+  static fs::path uploadFileForCustomFeedback(const fs::path& url);
+  bool canFormRequest(const std::string& type) override;
 
   // The forced query items of a "VIRDebugParameters" value: pieces split at
   // "&", each split at "=" (empty parts dropped); only pieces of exactly two
@@ -76,10 +83,6 @@ class UploadManager final : public UploadManagerProtocol {
   static std::vector<QueryItem> debugQueryItems(std::string_view parameters);
   // The endpoint a custom feedback type is uploaded to (see above).
   static std::optional<std::string> endpointForCustomType(const ConfigurationBag& bag, const std::string& type);
-  // Whether a file created at `creation` is young enough at `now` for a limit
-  // of `maxAgeDays` days (strictly younger). Overflow stops the process.
-  static bool fileWasCreatedInTheLast(int64_t maxAgeDays, SystemTime creation, SystemTime now);
-
   // Makes UploadManagers with the default build predicates.
   static UploadManagerFactory factory();
 
@@ -87,14 +90,26 @@ class UploadManager final : public UploadManagerProtocol {
 
  private:
   struct Core;
-  bool fileWasCreatedInTheLast(const fs::path& file, int64_t maxAgeDays);
-  void removeQuietly(const fs::path& file);
+  struct Compressed {
+    int64_t uncompressedSize = 0;
+    int64_t compressedSize = 0;
+    std::string digest;
+  };
+  std::optional<std::string> endpointFor(const std::string& type) const;
+  // The request for `type`, or no value after logging why not.
+  std::optional<HttpRequest> requestFor(const std::string& type);
+  std::optional<Compressed> compressInto(const fs::path& finalPath,
+                                         const std::function<bool(CompressedOutputStream&)>& produce);
+  static UploadRequest finish(HttpRequest request, const fs::path& fileURL, const Compressed& compressed,
+                              std::string typeString);
 
   FBFAssemblyProtocol& assembly_;
   UploadBuildPredicates predicates_;
   std::shared_ptr<HttpClientSession> uploadSession_;
   std::optional<ConfigurationBag> bag_;
+  FeedbackAgeLimit ageLimit_;
   FileManager& fileManager_;
+  std::set<std::string> unusableTypesLogged_;
   std::shared_ptr<Core> core_;
 };
 

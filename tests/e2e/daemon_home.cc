@@ -86,9 +86,18 @@ void DaemonHome::configure(const std::string& url, const nlohmann::json& extra) 
   writeFile(cacheDir() / "fbf-last-flush", std::to_string(now.count()) + "\n");
 }
 
-void DaemonHome::startDaemon() {
-  daemon_ = std::make_unique<ChildProcess>(binDir() / "vireon-fbf", std::vector<std::string>{}, env_,
-                                           root() / "daemon.out", root() / "daemon.log");
+void DaemonHome::startDaemon(std::optional<int> descriptorLimit) {
+  const fs::path program = binDir() / "vireon-fbf";
+  if (descriptorLimit) {
+    daemon_ = std::make_unique<ChildProcess>(
+        "/bin/sh",
+        std::vector<std::string>{"-c", "ulimit -n " + std::to_string(*descriptorLimit) + " && exec \"$0\"",
+                                 program.string()},
+        env_, root() / "daemon.out", root() / "daemon.log");
+  } else {
+    daemon_ = std::make_unique<ChildProcess>(program, std::vector<std::string>{}, env_, root() / "daemon.out",
+                                             root() / "daemon.log");
+  }
   auto socket = dirs_.socketPath();
   waitUntil([&] { return fs::exists(socket) && daemonLog().find("setup") != std::string::npos; }, 10s);
 }

@@ -13,6 +13,7 @@ class RecordingSession final : public HttpClientSession {
   explicit RecordingSession(HttpSessionConfiguration c) : config(std::move(c)) {}
   void uploadFile(HttpRequest, std::filesystem::path, HttpCompletion) override {}
   void finishTasksAndInvalidate() override { config.onInvalidated(); }
+  void cancelAllTasks() override {}
   HttpSessionConfiguration config;
 };
 
@@ -65,7 +66,7 @@ TEST(UploadSessionTransactions, TwoMadeOneInvalidatedLeavesOneOpen) {
   env.manualQueue->drain();
   EXPECT_EQ(a.openTransactionCount(), 2u);
   EXPECT_EQ(env.transactions->openCount(), 2);
-  EXPECT_EQ(made[0]->config.maxConnectionsPerHost, 1);
+  EXPECT_EQ(made[0]->config.maxConnectionsPerHost, FBFAssembly::kUploadConnectionsPerHost);
   EXPECT_EQ(made[0]->config.pinnedPublicKeys, "sha256//abc");
 
   s1->finishTasksAndInvalidate();

@@ -30,6 +30,7 @@ class FakeHttpSession final : public HttpClientSession {
     tasks.push_back({std::move(request), std::move(body), std::move(completion)});
   }
   void finishTasksAndInvalidate() override { invalidated = true; }
+  void cancelAllTasks() override {}
 
   std::vector<Task> tasks;
   bool invalidated = false;
@@ -225,13 +226,17 @@ TEST_F(UploadManagerTest, AnUnparseableSessionNameGetsNoUploadFile) {
   EXPECT_TRUE(logs.contains("Error getting temp file."));
 }
 
-TEST_F(UploadManagerTest, ANonHttpEndpointKeepsTheCompressedFile) {
+TEST_F(UploadManagerTest, ANonHttpEndpointLeavesNoCompressedCopy) {
   env.writeBag({{"feedback_url", "ftp://feedback.example.net/upload"}});
   testing::LogCapture logs;
   auto m = makeManager();
+  EXPECT_FALSE(m->canFormRequest("FeedbackV2PB"));
   EXPECT_FALSE(m->uploadProtobufFeedback(sampleSession(), sessionURL()));
   EXPECT_TRUE(logs.contains("feedbackUploadRequest failed because of bad url."));
-  EXPECT_TRUE(fs::exists(uploadFile()));
+  EXPECT_FALSE(fs::exists(uploadFile()));
+  for (const auto& e : fs::directory_iterator(env.cacheDir())) {
+    EXPECT_FALSE(e.path().filename().string().ends_with(".partial")) << e.path();
+  }
 }
 
 TEST_F(UploadManagerTest, CustomFeedbackIsCompressedBesideItsSource) {
@@ -431,23 +436,27 @@ TEST_F(UploadRetryTest, AFileWithoutAttributesCountsAsTooOld) {
   EXPECT_TRUE(env.analytics->events().empty());
 }
 
-TEST(UploadAgeRule, IsStrictAndStopsOnOverflow) {
+TEST(UploadAgeRule, IsStrictAndSurvivesAbsurdBagValues) {
   SystemTime t0{};
-  EXPECT_TRUE(UploadManager::fileWasCreatedInTheLast(1, t0, t0 + 86399s));
-  EXPECT_FALSE(UploadManager::fileWasCreatedInTheLast(1, t0, t0 + 86400s));
-  EXPECT_TRUE(UploadManager::fileWasCreatedInTheLast(1, t0 + 10s, t0));  // from the future
-  EXPECT_FALSE(UploadManager::fileWasCreatedInTheLast(0, t0, t0));
-  GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_DEATH(UploadManager::fileWasCreatedInTheLast(INT64_MAX / 1000, t0, t0), "overflow");
-}
-
-TEST_F(UploadManagerTest, FileHandlesResolveToTheirPath) {
-  auto f = env.cacheDir() / "handle-test";
-  std::error_code ec;
-  auto fd = env.fileManager->createForWriting(f, ec);
-  ASSERT_TRUE(fd.valid());
-  EXPECT_EQ(UploadManager::urlForFileHandle(fd.get()), f);
-  EXPECT_EQ(UploadManager::urlForFileHandle(-1), std::nullopt);
+  struct Row {
+    const char* name;
+    int64_t days;
+    SystemTime creation, now;
+    bool allowed;
+  };
+  const Row rows[] = {
+      {"just young enough", 1, t0, t0 + 86399s, true},
+      {"exactly the limit", 1, t0, t0 + 86400s, false},
+      {"from the future", 1, t0 + 10s, t0, true},
+      // Below one day is not a limit anyone meant: the default 7 days.
+      {"zero means the default", 0, t0, t0 + 6 * 86400s, true},
+      {"negative means the default", -5, t0, t0 + 7 * 86400s, false},
+      // Too large to count in seconds: no limit rather than a crash.
+      {"overflowing means no limit", INT64_MAX / 1000, t0, t0 + 100000 * 86400s, true},
+  };
+  for (const auto& r : rows) {
+    EXPECT_EQ(FeedbackAgeLimit::fromDays(r.days).allows(r.creation, r.now), r.allowed) << r.name;
+  }
 }
 
 }  // namespace

@@ -127,6 +127,12 @@ class Command {
         // Scripts wait for this line before they start the work they watch.
         [&] { *env_.err << "fbfctl: listening for " << args[0] << std::endl; },
         [&](const ipc::DaemonMessage& message) {
+          uint64_t missed = message.has_willuploaddata() ? message.willuploaddata().missedbefore()
+                            : message.has_willgeneratecohortfeebacks()
+                                ? message.willgeneratecohortfeebacks().missedbefore()
+                                : 0;
+          // Payloads the daemon dropped for this subscriber while it lagged.
+          if (missed) *env_.out << nlohmann::ordered_json{{"missed", missed}}.dump() << std::endl;
           if (message.has_willuploaddata()) {
             *env_.out << describeUpload(message.willuploaddata().data(),
                                         message.willuploaddata().format())
@@ -265,6 +271,17 @@ class Command {
     out["uploadsListener"] = reply.uploadslistener();
     out["cohortsListener"] = reply.cohortslistener();
     out["cohorts"] = cohortsJson(reply);
+    auto losses = nlohmann::ordered_json::array();
+    for (const auto& l : reply.losseslast7days()) {
+      nlohmann::ordered_json item;
+      item["type"] = l.type();
+      item["reason"] = l.reason();
+      item["reasonCode"] = l.reasoncode();
+      item["files"] = l.files();
+      losses.push_back(std::move(item));
+    }
+    out["lossesLast7Days"] = std::move(losses);
+    out["poisonFiles"] = nlohmann::ordered_json(std::vector<std::string>(reply.poisonfiles().begin(), reply.poisonfiles().end()));
     return out;
   }
 
@@ -366,6 +383,16 @@ class Command {
     *env_.out << "uploads listener: " << (reply.uploadslistener() ? "yes" : "no")
               << "\ncohorts listener: " << (reply.cohortslistener() ? "yes" : "no") << "\n";
     printCohorts(reply);
+    *env_.out << "deletions in the last 7 days:";
+    if (reply.losseslast7days().empty()) *env_.out << " none";
+    *env_.out << "\n";
+    for (const auto& l : reply.losseslast7days()) {
+      *env_.out << "  " << l.type() << " " << l.reason() << ": " << l.files() << "\n";
+    }
+    *env_.out << "poison files (interrupted twice, kept as they are):";
+    if (reply.poisonfiles().empty()) *env_.out << " none";
+    *env_.out << "\n";
+    for (const auto& f : reply.poisonfiles()) *env_.out << "  " << f << "\n";
   }
 
   const Environment& env_;

@@ -1,0 +1,209 @@
+// The upload pipeline under faults, with the real programs: slow and stalled
+// receivers, few descriptors, kills in the middle of a flush, broken bags.
+// Each case guards against losing or double-sending feedback, or against a
+// daemon that stops serving.
+#include "e2e/daemon_home.h"
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <cstring>
+#include <random>
+#include <thread>
+
+namespace fbf::testing {
+namespace {
+
+using namespace std::chrono_literals;
+
+constexpr int kUploaded = 12;
+
+#if defined(__SANITIZE_ADDRESS__)
+constexpr int kScale = 4;  // the sanitizers make every file several times dearer
+#else
+constexpr int kScale = 1;
+#endif
+
+int losses(const std::vector<nlohmann::json>& events) {
+  int n = 0;
+  for (const auto& e : events) n += e.at("reason").get<int>() != kUploaded;
+  return n;
+}
+
+size_t delivered(const std::vector<nlohmann::json>& records) {
+  size_t n = 0;
+  for (const auto& r : records) n += r.value("status", 0) == 200;
+  return n;
+}
+
+std::string tail(const std::string& text, size_t n = 4000) {
+  return text.size() > n ? text.substr(text.size() - n) : text;
+}
+
+class PipelineFaults : public ::testing::Test {
+ protected:
+  void SetUp() override { ASSERT_TRUE(LoopbackCertificate::get().made); }
+
+  void startReceiver(std::vector<std::string> faults = {}, int port = 0) {
+    if (receiver) receiver->stop();
+    receiver = std::make_unique<Receiver>(home.root(), port, std::move(faults));
+    ASSERT_TRUE(receiver->running());
+  }
+
+  // Everything on disk was delivered: no session or custom file is left, and
+  // nothing was dropped on the way.
+  void expectAllDelivered(size_t expected) {
+    EXPECT_TRUE(home.sessionFiles().empty()) << home.sessionFiles().size() << " left, e.g. "
+                                             << home.sessionFiles().front();
+    EXPECT_TRUE(home.customFiles().empty()) << home.customFiles().size() << " custom files left";
+    EXPECT_EQ(losses(home.deletionEvents()), 0) << nlohmann::json(home.deletionEvents()).dump().substr(0, 2000);
+    EXPECT_GE(delivered(receiver->records()), expected);
+  }
+
+  DaemonHome home;
+  std::unique_ptr<Receiver> receiver;
+};
+
+TEST_F(PipelineFaults, SlowReceiverNothingInFlightIsPrunedOrMisreported) {
+  startReceiver({"--delay-ms", "20"});
+  home.configure(receiver->url());
+  ASSERT_EQ(home.generate(300, 40, 5).status, 0);
+  const size_t files = home.sessionFiles().size() + home.customFiles().size();
+  home.startDaemon();
+  ASSERT_EQ(home.fbfctl({"flush"}, 300s).status, 0) << tail(home.daemonLog());
+  // Custom files the generator made empty or too large are dropped by rule;
+  // every other file arrives, and nothing is called pruned.
+  for (const auto& e : home.deletionEvents()) EXPECT_NE(e.at("reason").get<int>(), 4) << e.dump();
+  EXPECT_EQ(home.daemonLog().find("Error deleting file after successful upload"), std::string::npos);
+  EXPECT_TRUE(home.sessionFiles().empty());
+  size_t dropped = static_cast<size_t>(losses(home.deletionEvents()));
+  EXPECT_EQ(delivered(receiver->records()) + dropped, files);
+}
+
+TEST_F(PipelineFaults, ThousandsOfSessionsUnderALowDescriptorLimitAllArrive) {
+  const int sessions = 4000 / kScale;
+  startReceiver({"--delay-ms", "2"});
+  home.configure(receiver->url());
+  ASSERT_EQ(home.generate(sessions, 0, 6).status, 0);
+  home.startDaemon(256);
+  auto r = home.fbfctl({"flush"}, 600s);
+  ASSERT_EQ(r.status, 0) << r.err << tail(home.daemonLog());
+  expectAllDelivered(static_cast<size_t>(sessions));
+  EXPECT_EQ(home.daemonLog().find("Too many open files"), std::string::npos) << tail(home.daemonLog());
+}
+
+TEST_F(PipelineFaults, KillNineMidFlushThenRestartDeliversEverySessionAtMostOnceMorePerKill) {
+  constexpr int kRounds = 4;
+  const int perRound = 150 / kScale;
+  startReceiver({"--delay-ms", "3"});
+  home.configure(receiver->url());
+  std::mt19937 random(20261123);
+  for (int round = 0; round < kRounds; ++round) {
+    ASSERT_EQ(home.generate(perRound, 0, 100 + round, "realistic").status, 0);
+    home.startDaemon();
+    auto flush = home.startFbfctl({"flush"}, home.root() / "flush.out");
+    std::this_thread::sleep_for(std::chrono::milliseconds(50 + random() % 700));
+    home.daemon()->signal(SIGKILL);
+    home.daemon()->waitFor(10s);
+    flush->waitFor(10s);
+  }
+  // A last run with nothing killed: recovery, then a whole flush.
+  home.startDaemon();
+  ASSERT_EQ(home.fbfctl({"flush"}, 300s).status, 0) << tail(home.daemonLog());
+  const size_t sessions = static_cast<size_t>(kRounds * perRound);
+  expectAllDelivered(sessions);
+  EXPECT_LE(delivered(receiver->records()), sessions + kRounds) << "more than one duplicate per kill";
+}
+
+TEST_F(PipelineFaults, SessionsWaitForAMissingEndpointAndGoOnceTheBagIsFixed) {
+  startReceiver();
+  home.configure(receiver->url());
+  home.writeBag("", {{"feedback_url", "not a url"}});
+  ASSERT_EQ(home.generate(5, 3, 7).status, 0);
+  const auto before = home.sessionFiles();
+  home.startDaemon();
+  ASSERT_EQ(home.fbfctl({"flush"}).status, 0);
+  EXPECT_EQ(home.sessionFiles(), before) << "claimed sessions without an endpoint";
+  for (const auto& name : home.customFiles()) EXPECT_FALSE(name.ends_with(".uploadPending")) << name;
+  EXPECT_TRUE(receiver->records().empty());
+
+  home.writeBag(receiver->url());
+  ASSERT_EQ(home.fbfctl({"flush"}).status, 0);
+  EXPECT_TRUE(home.sessionFiles().empty()) << tail(home.daemonLog());
+  EXPECT_GE(delivered(receiver->records()), before.size());
+}
+
+TEST_F(PipelineFaults, AnAbsurdAgeLimitKeepsEverythingAndTheDaemonAlive) {
+  startReceiver({"--status", "500"});
+  home.configure(receiver->url(), {{"feedback_max_age_in_days", 1'000'000'000'000'000LL}});
+  ASSERT_EQ(home.generate(4, 0, 8).status, 0);
+  home.startDaemon();
+  // Twice: the second flush retries the upload files the first one left.
+  ASSERT_EQ(home.fbfctl({"flush"}).status, 0) << tail(home.daemonLog());
+  ASSERT_EQ(home.fbfctl({"flush"}).status, 0) << tail(home.daemonLog());
+  EXPECT_FALSE(home.daemon()->waitFor(0ms)) << "the daemon died";
+  EXPECT_EQ(losses(home.deletionEvents()), 0);
+  EXPECT_EQ(home.sessionFiles().size(), 4u);
+  EXPECT_NE(home.daemonLog().find("too large to count in seconds"), std::string::npos);
+}
+
+TEST_F(PipelineFaults, SigtermDuringAStalledUploadExitsPromptlyAndKeepsTheFiles) {
+  startReceiver({"--delay-ms", "120000"});
+  home.configure(receiver->url());
+  ASSERT_EQ(home.generate(3, 0, 9).status, 0);
+  home.startDaemon();
+  auto flush = home.startFbfctl({"flush"}, home.root() / "flush.out");
+  // The receiver holds each request for minutes; give the uploads time to start.
+  std::this_thread::sleep_for(1500ms);
+  const auto start = std::chrono::steady_clock::now();
+  auto status = home.stopDaemon();
+  ASSERT_TRUE(status) << "no exit after SIGTERM";
+  EXPECT_EQ(*status, 0);
+  // Well inside the unit's TimeoutStopSec.
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 15s);
+  EXPECT_EQ(home.sessionFiles().size(), 3u) << "a stalled upload's files must stay for the next run";
+  EXPECT_EQ(losses(home.deletionEvents()), 0);
+}
+
+TEST_F(PipelineFaults, AcceptLoopBacksOffWhenDescriptorsRunOutAndServesAgainAfter) {
+  startReceiver();
+  home.configure(receiver->url());
+  home.startDaemon(40);
+  std::vector<int> clients;
+  for (int i = 0; i < 60; ++i) {
+    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::snprintf(addr.sun_path, sizeof addr.sun_path, "%s", home.environment().at("XDG_RUNTIME_DIR").c_str());
+    std::strncat(addr.sun_path, "/vireon-fbf.sock", sizeof addr.sun_path - std::strlen(addr.sun_path) - 1);
+    if (fd >= 0 && ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0) clients.push_back(fd);
+  }
+  ASSERT_TRUE(waitUntil([&] { return home.daemonLog().find("Cannot accept connections") != std::string::npos; }, 10s))
+      << tail(home.daemonLog());
+  // Spinning on accept would burn a core; backing off costs almost nothing.
+  auto cpuTicks = [&] {
+    std::ifstream stat("/proc/" + std::to_string(home.daemon()->pid()) + "/stat");
+    std::string field;
+    long ticks = 0;
+    for (int i = 1; i <= 15 && stat >> field; ++i) {
+      if (i >= 14) ticks += std::stol(field);
+    }
+    return ticks;
+  };
+  const long before = cpuTicks();
+  std::this_thread::sleep_for(2s);
+  EXPECT_LT(cpuTicks() - before, sysconf(_SC_CLK_TCK) / 2) << "the accept loop spins";
+  for (int fd : clients) ::close(fd);
+  auto r = home.fbfctl({"status"}, 20s);
+  EXPECT_EQ(r.status, 0) << r.err;
+  const std::string log = home.daemonLog();
+  const auto first = log.find("Cannot accept connections");
+  EXPECT_EQ(log.find("Cannot accept connections", first + 1), std::string::npos) << "logged more than once";
+}
+
+}  // namespace
+}  // namespace fbf::testing
