@@ -129,4 +129,24 @@ void setFeedbackTimestamp(Message& feedback, uint64_t timestamp) {
   }
 }
 
+void forEachMessage(Message& root, const std::function<void(Message&)>& visit) {
+  visit(root);
+  const auto* reflection = root.GetReflection();
+  std::vector<const FieldDescriptor*> fields;
+  reflection->ListFields(root, &fields);
+  for (const FieldDescriptor* field : fields) {
+    if (field->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) continue;
+    if (field->is_map() && field->message_type()->map_value()->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) {
+      continue;  // scalar maps hold nothing to walk
+    }
+    if (field->is_repeated()) {
+      for (int i = 0, n = reflection->FieldSize(root, field); i < n; ++i) {
+        forEachMessage(*reflection->MutableRepeatedMessage(&root, field, i), visit);
+      }
+    } else {
+      forEachMessage(*reflection->MutableMessage(&root, field), visit);
+    }
+  }
+}
+
 }  // namespace fbf
