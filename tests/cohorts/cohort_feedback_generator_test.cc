@@ -138,7 +138,7 @@ TEST_F(CohortEnvelopes, AWeekCountsDistinctLocalDaysInsideItsRange) {
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 4, 7));
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 8, 23, 59));  // Saturday, last day
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 9));          // next Sunday
-  setMarker(FlushFrequency::weekly, localTime(2030, 6, 5));
+  setMarker(FlushFrequency::weekly, localTime(2030, 6, 2));  // the end of the week before
   saveOrLogError(store->managedObjectContext());
   makeGenerator()->aggregateNext(FlushFrequency::weekly);
   auto envelopes = usageEnvelopes();
@@ -152,7 +152,7 @@ TEST_F(CohortEnvelopes, AMonthAlsoWritesLookbackUsageAndOnePropensityEnvelope) {
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 2, 10, 12));  // lookback only
   addWayfinSession(localTime(2030, 2, 10, 12), {{VIRWayfinSession::goToSite, 1}, {VIRWayfinSession::other, 3}});
   addWayfinSession(localTime(2030, 2, 3, 12), {{VIRWayfinSession::localTap, 9}});  // before the lookback
-  setMarker(FlushFrequency::monthly, localTime(2030, 3, 15));
+  setMarker(FlushFrequency::monthly, localTime(2030, 3, 1));
   saveOrLogError(store->managedObjectContext());
 
   makeGenerator()->aggregateNext(FlushFrequency::monthly);
