@@ -215,20 +215,23 @@ void FlushableSession::postProcessFeedback(UsageEventSink* storageContainer, Ses
   done.visitsReduced = countVisits(*list);
   done.visitsDropped = visitsBefore - done.visitsReduced;
 
-  if (auto missing = helper.missingResults(); missing && !missing->empty()) {
+  // Moved, not copied: the helper's kept items become the uploaded ones.
+  if (auto missing = helper.takeMissingResults(); !missing.empty()) {
     CVFeedbackPayload* payload = list->Add();
     payload->set_type(corevireon::CV_FEEDBACK_EVENT_TYPE_SESSION_MISSING_RESULTS);
     auto* feedback = payload->mutable_sessionmissingresults();
     feedback->set_timestamp(0);
-    for (auto& r : *missing) *feedback->add_results() = std::move(r);
+    feedback->mutable_results()->Reserve(static_cast<int>(missing.size()));
+    for (auto& r : missing) *feedback->add_results() = std::move(r);
     moveLastToFront(list);
   }
-  if (auto missing = helper.missingSuggestions(); missing && !missing->empty()) {
+  if (auto missing = helper.takeMissingSuggestions(); !missing.empty()) {
     CVFeedbackPayload* payload = list->Add();
     payload->set_type(corevireon::CV_FEEDBACK_EVENT_TYPE_SESSION_MISSING_SUGGESTIONS);
     auto* feedback = payload->mutable_sessionmissingsuggestions();
     feedback->set_timestamp(0);
-    for (auto& s : *missing) *feedback->add_suggestions() = std::move(s);
+    feedback->mutable_suggestions()->Reserve(static_cast<int>(missing.size()));
+    for (auto& s : missing) *feedback->add_suggestions() = std::move(s);
     moveLastToFront(list);
   }
 

@@ -207,4 +207,30 @@ std::optional<std::vector<CVSearchSuggestionForFeedback>> SessionProcessingHelpe
   return out;
 }
 
+std::vector<CVSearchResultForFeedback> SessionProcessingHelper::takeMissingResults() {
+  std::vector<CVSearchResultForFeedback> out;
+  for (auto it = identifiableMapping_.begin(); it != identifiableMapping_.end();) {
+    if (auto* r = std::get_if<CVSearchResultForFeedback>(&it->second)) {
+      out.push_back(std::move(*r));
+      it = identifiableMapping_.erase(it);
+    } else {
+      ++it;
+    }
+  }
+  return out;
+}
+
+std::vector<CVSearchSuggestionForFeedback> SessionProcessingHelper::takeMissingSuggestions() {
+  std::vector<CVSearchSuggestionForFeedback> out;
+  for (auto it = identifiableMapping_.begin(); it != identifiableMapping_.end();) {
+    if (auto* s = std::get_if<CVSearchSuggestionForFeedback>(&it->second)) {
+      out.push_back(std::move(*s));
+      it = identifiableMapping_.erase(it);
+    } else {
+      ++it;
+    }
+  }
+  return out;
+}
+
 }  // namespace fbf

@@ -82,6 +82,10 @@ class SessionProcessingHelper {
   // numbers; empty when there are none.
   std::optional<std::vector<corevireon::CVSearchResultForFeedback>> missingResults() const;
   std::optional<std::vector<corevireon::CVSearchSuggestionForFeedback>> missingSuggestions() const;
+  // The same lists, moved out of the helper (which then has none): for the
+  // one reader that consumes them, without copying every item again.
+  std::vector<corevireon::CVSearchResultForFeedback> takeMissingResults();
+  std::vector<corevireon::CVSearchSuggestionForFeedback> takeMissingSuggestions();
 
   int64_t nextMappedId() const { return nextMappedId_; }
   const std::set<std::string>& allIdSet() const { return allIdSet_; }
