@@ -16,11 +16,6 @@ FeedbackAgeLimit FeedbackAgeLimit::fromBag(const std::optional<ConfigurationBag>
 FeedbackAgeLimit FeedbackAgeLimit::fromDays(int64_t days) {
   auto& log = logging::get("FBFAssembly");
   FeedbackAgeLimit limit;
-  if (days < 1) {
-    log.warn("Ignoring feedback_max_age_in_days {}: below one day; using {}", days,
-             FBFConstants::DefaultFeedbackMaxAgeInDays);
-    days = FBFConstants::DefaultFeedbackMaxAgeInDays;
-  }
   int64_t seconds = 0;
   if (__builtin_mul_overflow(days, FBFConstants::SecondsPerDay, &seconds)) {
     log.warn("feedback_max_age_in_days {} is too large to count in seconds; files are kept whatever their age", days);

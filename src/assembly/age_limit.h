@@ -1,10 +1,9 @@
 // The age limit of feedback files, from the bag's "feedback_max_age_in_days".
 //
-// The bag comes from another program and may hold anything. A limit below
-// one day is not one anybody meant (it would drop every file unsent), so the
-// default is used instead; a limit so large that it overflows when counted
-// in seconds means "no limit". Both cases log a warning where the limit is
-// made, once per flush. Value type; no state beyond the limit.
+// The bag comes from another program and may hold anything. A limit so large
+// that it overflows when counted in seconds means "no limit", with a warning
+// where the limit is made (once per flush). A limit of 0 or less is taken at
+// its word: every file is too old. Value type; no state beyond the limit.
 #pragma once
 
 #include "assembly/configuration_bag.h"

@@ -7,6 +7,7 @@
 
 #include <fmt/format.h>
 
+#include <cstdlib>
 #include <ctime>
 
 namespace fbf {
@@ -45,11 +46,28 @@ std::unique_ptr<icu::Calendar> makeGregorian(icu::TimeZone* zone, const icu::Loc
 
 CohortCalendar::CohortCalendar(std::unique_ptr<Impl> impl) : impl_(std::move(impl)) {}
 
+std::string CohortCalendar::weekRuleLocale(const std::function<const char*(const char*)>& getenv) {
+  std::string value;
+  for (const char* name : {"LC_ALL", "LC_TIME", "LANG"}) {
+    const char* v = getenv(name);
+    if (v != nullptr && *v != '\0') {
+      value = v;
+      break;
+    }
+  }
+  // "de_DE.UTF-8@euro": ICU wants the language and territory only.
+  value = value.substr(0, value.find_first_of(".@"));
+  if (value.empty() || value == "C" || value == "POSIX") return "en_US_POSIX";
+  return value;
+}
+
 CohortCalendar CohortCalendar::current() {
-  // Detected anew (not ICU's cached default), so the zone is the one TZ
-  // names at the moment the calendar is made.
+  // Detected anew (not ICU's cached defaults), so the zone is the one TZ names
+  // and the week rule the one the time locale names at this moment. ICU's
+  // default locale would follow LANG (or LC_MESSAGES) and ignore LC_TIME.
   auto impl = std::make_unique<Impl>();
-  impl->calendar = makeGregorian(icu::TimeZone::detectHostTimeZone(), icu::Locale::getDefault());
+  impl->calendar = makeGregorian(icu::TimeZone::detectHostTimeZone(),
+                                 icu::Locale(weekRuleLocale([](const char* name) { return std::getenv(name); }).c_str()));
   return CohortCalendar(std::move(impl));
 }
 
@@ -124,11 +142,25 @@ std::optional<int64_t> CohortCalendar::wholeHours(SystemTime from, SystemTime to
 
 std::optional<int64_t> CohortCalendar::wholeDays(SystemTime from, SystemTime to) const {
   if (!impl_->calendar) return std::nullopt;
+  // The difference of the local dates, not of elapsed 24-hour spans: a day
+  // whose midnight was skipped starts at 01:00 and is still one day.
+  auto& cal = *impl_->calendar;
   UErrorCode status = U_ZERO_ERROR;
-  impl_->calendar->setTime(toUDate(from), status);
-  int32_t days = impl_->calendar->fieldDifference(toUDate(to), UCAL_DATE, status);
+  cal.setTime(toUDate(from), status);
+  const int32_t first = cal.get(UCAL_JULIAN_DAY, status);
+  cal.setTime(toUDate(to), status);
+  const int32_t last = cal.get(UCAL_JULIAN_DAY, status);
   if (U_FAILURE(status)) return std::nullopt;
-  return days;
+  return int64_t{last} - first;
+}
+
+std::optional<DateInterval> CohortCalendar::periodAfter(FlushFrequency frequency, SystemTime lastEnd) const {
+  auto range = containingCaptureRange(frequency, lastEnd);
+  if (!range) return std::nullopt;
+  // Where the zone or the week rule changed since the last period was cut,
+  // its end lies inside a period of this calendar: the rest of that period
+  // follows it, so no day is counted twice or skipped.
+  return DateInterval{lastEnd, range->end};
 }
 
 std::optional<SystemTime> CohortCalendar::addingDays(SystemTime date, int64_t days) const {

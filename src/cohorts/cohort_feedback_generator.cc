@@ -99,9 +99,23 @@ const std::vector<corevireon::CVClient>& CohortFeedbackGenerator::supportedCohor
 
 int64_t CohortFeedbackGenerator::cohortsLookbackInDays(const std::optional<ConfigurationBag>& bag) {
   if (bag) {
-    if (auto days = bag->cohortsLookbackInDays(); days && *days >= 1) return *days;
+    if (auto days = bag->cohortsLookbackInDays()) {
+      if (*days >= 1) return *days;
+      generatorLog().warn("Ignoring cohorts_lookback_in_days {}: it must be at least 1; using {} days.", *days,
+                          kDefaultCohortsLookbackInDays);
+    }
   }
   return kDefaultCohortsLookbackInDays;
+}
+
+std::optional<DateInterval> CohortFeedbackGenerator::pendingPeriod(FlushFrequency frequency, SystemTime marker) const {
+  // The first marker is the collection start: its whole period is the first
+  // one. Every later marker is the end of an aggregated period, where the
+  // next one starts even if the calendar has changed since.
+  if (std::chrono::abs(marker - collectionStart_) < std::chrono::milliseconds(1)) {
+    return collaborators_.calendar.containingCaptureRange(frequency, marker);
+  }
+  return collaborators_.calendar.periodAfter(frequency, marker);
 }
 
 uint64_t CohortFeedbackGenerator::bucketEngagementCount(uint64_t count, uint64_t bucketSize) {
@@ -139,7 +153,7 @@ void CohortFeedbackGenerator::aggregateNext(FlushFrequency frequency) {
     auto last = it->second;
     auto timestamp = last->timestamp();
     if (!timestamp) return;
-    auto range = collaborators_.calendar.containingCaptureRange(frequency, *timestamp);
+    auto range = pendingPeriod(frequency, *timestamp);
     if (!range) return;
     for (auto client : supportedCohortsClients()) {
       if (auto envelope = usageEnvelope(client, *range)) {

@@ -84,8 +84,13 @@ class CohortFeedbackGenerator final : public CohortFeedbackGeneratorProtocol {
   // it is the caller's).
   std::optional<corevireon::CVUsageEnvelope> usageEnvelope(corevireon::CVClient client, const DateInterval& range);
 
-  // The bag's "cohorts_lookback_in_days"; 56 without a bag, without the key
-  // or with a value below 1.
+  // The period `aggregateNext` aggregates when the frequency's marker is at
+  // `marker`: the capture range containing it while the marker is still the
+  // collection start, afterwards `periodAfter(marker)` (no overlap, no gap).
+  std::optional<DateInterval> pendingPeriod(FlushFrequency frequency, SystemTime marker) const;
+
+  // The bag's "cohorts_lookback_in_days"; 56 without a bag or without the
+  // key; a value below 1 is refused with a warning and 56 is used.
   int64_t cohortsLookbackInDays() const { return cohortsLookbackInDays(collaborators_.bag); }
   static int64_t cohortsLookbackInDays(const std::optional<ConfigurationBag>& bag);
   const CohortCalendar& calendar() const { return collaborators_.calendar; }

@@ -129,4 +129,26 @@ void setFeedbackTimestamp(Message& feedback, uint64_t timestamp) {
   }
 }
 
+void forEachMessage(Message& root, const std::function<void(Message&)>& visit) {
+  visit(root);
+  // Straight over the descriptor (no ListFields vector per message): this
+  // runs for every message of every session.
+  const auto* descriptor = root.GetDescriptor();
+  const auto* reflection = root.GetReflection();
+  for (int i = 0, n = descriptor->field_count(); i < n; ++i) {
+    const FieldDescriptor* field = descriptor->field(i);
+    if (field->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) continue;
+    if (field->is_map() && field->message_type()->map_value()->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) {
+      continue;  // scalar maps hold nothing to walk
+    }
+    if (field->is_repeated()) {
+      for (int j = 0, count = reflection->FieldSize(root, field); j < count; ++j) {
+        forEachMessage(*reflection->MutableRepeatedMessage(&root, field, j), visit);
+      }
+    } else if (reflection->HasField(root, field)) {
+      forEachMessage(*reflection->MutableMessage(&root, field), visit);
+    }
+  }
+}
+
 }  // namespace fbf

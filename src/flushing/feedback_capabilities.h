@@ -13,6 +13,7 @@
 #include "corevireon.pb.h"
 
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <string>
 #include <variant>
@@ -68,5 +69,12 @@ google::protobuf::Message* mutableCodableMessage(corevireon::CVFeedbackPayload& 
 // no such field (never the case for the feedback messages of a session).
 std::optional<uint64_t> feedbackTimestamp(const google::protobuf::Message& feedback);
 void setFeedbackTimestamp(google::protobuf::Message& feedback, uint64_t timestamp);
+
+// Calls `visit` on `root` and then on every message set anywhere inside it,
+// each parent before its children, found through the descriptors (so a
+// message kind added to the .proto is walked without code here). `visit` may
+// change the message it is given; the children walked are those present after
+// it returns.
+void forEachMessage(google::protobuf::Message& root, const std::function<void(google::protobuf::Message&)>& visit);
 
 }  // namespace fbf

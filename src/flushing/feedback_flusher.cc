@@ -6,6 +6,7 @@
 #include "corevireon.pb.h"
 #include "flushing/cache_layout.h"
 #include "flushing/flushable_session.h"
+#include "flushing/session_payload.h"
 #include "flushing/session_recovery.h"
 #include "platform/logging.h"
 
@@ -266,7 +267,7 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
     FlushableSession flushable(std::move(session));
     flushable.postProcessFeedback(usageStore_ ? usageStore_->usageEventSink() : nullptr);
     if (protobufFormat) {
-      if (assembly_.uploadListener()) tee(flushable.backingStore().SerializeAsString(), typeString);
+      if (assembly_.uploadListener()) tee(serializeSessionDeterministically(flushable.backingStore()), typeString);
       request = uploadManager_->uploadProtobufFeedback(flushable.backingStore(), path);
     } else {
       auto json = flushable.generateSessionJSON();

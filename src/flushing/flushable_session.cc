@@ -126,45 +126,112 @@ void FlushableSession::setResultsById(std::map<std::string, corevireon::CVSearch
   resultsById_ = std::move(resultsById);
 }
 
-void FlushableSession::postProcessFeedback(UsageEventSink* storageContainer) {
+namespace {
+
+// Clears the fields this build does not know (written by a newer search
+// daemon) from `message` and everything inside it; returns how many there were.
+uint64_t discardUnknownFields(google::protobuf::Message& message) {
+  uint64_t discarded = 0;
+  forEachMessage(message, [&discarded](google::protobuf::Message& m) {
+    const auto* reflection = m.GetReflection();
+    if (const int n = reflection->GetUnknownFields(m).field_count(); n > 0) {
+      discarded += static_cast<uint64_t>(n);
+      reflection->MutableUnknownFields(&m)->Clear();
+    }
+  });
+  return discarded;
+}
+
+const google::protobuf::FieldDescriptor* timestampFieldOf(const google::protobuf::Message& m) {
+  const auto* field = m.GetDescriptor()->FindFieldByNumber(1);
+  if (field == nullptr || field->name() != "timestamp" || field->is_repeated() ||
+      field->cpp_type() != google::protobuf::FieldDescriptor::CPPTYPE_UINT64) {
+    return nullptr;
+  }
+  return field;
+}
+
+// The first non-zero feedback timestamp in processing order, if any.
+std::optional<uint64_t> baseTimeOf(const google::protobuf::RepeatedPtrField<CVFeedbackPayload>& list) {
+  for (const auto& payload : list) {
+    const google::protobuf::Message* message = codableMessage(payload);
+    if (message == nullptr) continue;
+    if (auto t = feedbackTimestamp(*message); t && *t != 0) return *t;
+  }
+  return std::nullopt;
+}
+
+size_t countVisits(const google::protobuf::RepeatedPtrField<CVFeedbackPayload>& list) {
+  return static_cast<size_t>(
+      std::count_if(list.begin(), list.end(), [](const CVFeedbackPayload& p) { return p.has_cbaengagement(); }));
+}
+
+}  // namespace
+
+void FlushableSession::postProcessFeedback(UsageEventSink* storageContainer, SessionRewriteSummary* summary) {
+  SessionRewriteSummary local;
+  SessionRewriteSummary& done = summary ? *summary : local;
+  done = SessionRewriteSummary();
   if (storageContainer != nullptr) storageContainer->reportUsageEvents(backingStore_);
+  // Before anything else: what this build cannot read it cannot rewrite.
+  done.unknownFieldsDiscarded = discardUnknownFields(backingStore_);
   if (!backingStore_.has_feedbacks()) return;
 
   auto* list = backingStore_.mutable_feedbacks()->mutable_items();
   sortForProcessing(list->pointer_begin(), list->pointer_end());
 
-  uint64_t baseTime = 0;
-  if (!list->empty()) {
-    if (const auto* first = codableMessage(list->Get(0))) baseTime = feedbackTimestamp(*first).value_or(0);
-  }
+  // Device clock readings leave the device only as distances from the first
+  // one: a payload without a message, or a message without a time (0), does
+  // not set the base, and a time before the base is removed rather than
+  // uploaded as it stands. Nested feedback (the rankings inside a ranking)
+  // carries times of its own, treated alike.
+  const std::optional<uint64_t> baseTime = baseTimeOf(*list);
+  auto makeRelative = [&](google::protobuf::Message& m) {
+    const auto* field = timestampFieldOf(m);
+    if (field == nullptr) return;
+    const auto* reflection = m.GetReflection();
+    const uint64_t t = reflection->GetUInt64(m, field);
+    if (t == 0) return;
+    if (baseTime && t >= *baseTime) {
+      reflection->SetUInt64(&m, field, (t - *baseTime) / kNanosecondsPerMillisecond);
+    } else {
+      reflection->SetUInt64(&m, field, 0);
+      ++done.timestampsRemoved;
+    }
+  };
 
   SessionProcessingHelper helper;
   for (auto& payload : *list) {
     google::protobuf::Message* message = mutableCodableMessage(payload);
     if (message == nullptr) continue;
-    const uint64_t timestamp = feedbackTimestamp(*message).value_or(0);
-    if (timestamp >= baseTime) {
-      setFeedbackTimestamp(*message, (timestamp - baseTime) / kNanosecondsPerMillisecond);
-    }
+    forEachMessage(*message, makeRelative);
     helper.process(message);
   }
+  done.identifiersMapped = helper.identifiersMapped();
+  done.titlesCleared = helper.titlesCleared();
 
+  const size_t visitsBefore = countVisits(*list);
   CBAFilterController().filter(*list);
+  done.visitsReduced = countVisits(*list);
+  done.visitsDropped = visitsBefore - done.visitsReduced;
 
-  if (auto missing = helper.missingResults(); missing && !missing->empty()) {
+  // Moved, not copied: the helper's kept items become the uploaded ones.
+  if (auto missing = helper.takeMissingResults(); !missing.empty()) {
     CVFeedbackPayload* payload = list->Add();
     payload->set_type(corevireon::CV_FEEDBACK_EVENT_TYPE_SESSION_MISSING_RESULTS);
     auto* feedback = payload->mutable_sessionmissingresults();
     feedback->set_timestamp(0);
-    for (auto& r : *missing) *feedback->add_results() = std::move(r);
+    feedback->mutable_results()->Reserve(static_cast<int>(missing.size()));
+    for (auto& r : missing) *feedback->add_results() = std::move(r);
     moveLastToFront(list);
   }
-  if (auto missing = helper.missingSuggestions(); missing && !missing->empty()) {
+  if (auto missing = helper.takeMissingSuggestions(); !missing.empty()) {
     CVFeedbackPayload* payload = list->Add();
     payload->set_type(corevireon::CV_FEEDBACK_EVENT_TYPE_SESSION_MISSING_SUGGESTIONS);
     auto* feedback = payload->mutable_sessionmissingsuggestions();
     feedback->set_timestamp(0);
-    for (auto& s : *missing) *feedback->add_suggestions() = std::move(s);
+    feedback->mutable_suggestions()->Reserve(static_cast<int>(missing.size()));
+    for (auto& s : missing) *feedback->add_suggestions() = std::move(s);
     moveLastToFront(list);
   }
 

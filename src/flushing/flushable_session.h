@@ -2,14 +2,17 @@
 // bytes are ready to upload.
 //
 // `postProcessFeedback` rewrites the session in place for upload, in this
-// order: usage counting (through the optional sink), a stable sort of the
-// feedback by timestamp, timestamps made relative to the first feedback and
-// converted from nanoseconds to whole milliseconds, identifier mapping and the
-// privacy rewrites (SessionProcessingHelper), the engaged-visit filter
+// order: usage counting (through the optional sink), the removal of every
+// field this build does not know (anywhere in the session, so a newer search
+// daemon's additions never pass through unread), a stable sort of the
+// feedback by timestamp, timestamps (nested feedback's too) made relative to
+// the first feedback that has a time and converted from nanoseconds to whole
+// milliseconds, or removed when they lie before it, identifier mapping and
+// the privacy rewrites (SessionProcessingHelper), the engaged-visit filter
 // (CBAFilterController), the synthetic missing-suggestions and
 // missing-results feedback at the front, and the removal of the session's
 // start time when the session asks for it. A session without a feedback list
-// is left unchanged (usage counting apart).
+// loses its unknown fields and is otherwise left unchanged.
 //
 // The result is uploaded either as `backingStore()` (protobuf) or as
 // `generateSessionJSON()`. Owned by the flusher for the processing of one
@@ -35,6 +38,17 @@ class UsageEventSink {
  public:
   virtual ~UsageEventSink() = default;
   virtual void reportUsageEvents(const corevireon::CVClientSession& session) = 0;
+};
+
+// What one `postProcessFeedback` changed, for people reviewing an upload
+// (`fbfctl explain`).
+struct SessionRewriteSummary {
+  uint64_t identifiersMapped = 0;       // result and suggestion identifiers replaced
+  uint64_t titlesCleared = 0;           // result titles and engagement titles removed
+  uint64_t visitsReduced = 0;           // engaged-visit records kept as a match level only
+  uint64_t visitsDropped = 0;           // engaged-visit records that matched nothing
+  uint64_t unknownFieldsDiscarded = 0;  // fields this build does not know, anywhere in the session
+  uint64_t timestampsRemoved = 0;       // device times that could not be made relative
 };
 
 class FlushableSession {
@@ -81,8 +95,9 @@ class FlushableSession {
   void setResultsById(std::map<std::string, corevireon::CVSearchResultForFeedback> resultsById);
 
   // Rewrites the session for upload (see above). Call once. The sink, when
-  // given, sees the session as it was decoded.
-  void postProcessFeedback(UsageEventSink* storageContainer);
+  // given, sees the session as it was decoded; the summary, when given, is
+  // overwritten with what the rewrite changed.
+  void postProcessFeedback(UsageEventSink* storageContainer, SessionRewriteSummary* summary = nullptr);
 
   // The JSON upload form, keys in this order: "fb", "agent", "user_guid",
   // "country_code", "locale", "resource_versions", "base_time",

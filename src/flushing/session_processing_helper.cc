@@ -9,6 +9,7 @@ namespace fbf {
 
 using corevireon::CVSearchResultForFeedback;
 using corevireon::CVSearchSuggestionForFeedback;
+using google::protobuf::FieldDescriptor;
 
 namespace {
 
@@ -64,21 +65,90 @@ void SessionProcessingHelper::didExpand(const std::optional<CVIdentifiable>& ite
   identifiableMapping_.erase(*id);
 }
 
-void SessionProcessingHelper::processItems(const Items& items, bool expanded) {
-  for (const CVIdentifiable& item : items) {
-    item.setIdentifier(replacementForIdentifier(item.identifier(), item.rType()));
-    // The bundle codes are set before the bookkeeping so that the copy kept
-    // for the missing list carries them, as the uploaded item does.
-    if (auto* r = item.result(); r != nullptr && r->islocalapplicationresult() && r->type() != kLocalApplicationExemptType) {
+bool SessionProcessingHelper::keepsTitle(int32_t resultType) {
+  return std::find(kTitleKeepingResultTypes.begin(), kTitleKeepingResultTypes.end(), resultType) !=
+         kTitleKeepingResultTypes.end();
+}
+
+void SessionProcessingHelper::rewriteItem(const CVIdentifiable& item) {
+  auto identifier = item.identifier();
+  if (identifier && !identifier->empty()) ++identifiersMapped_;
+  item.setIdentifier(replacementForIdentifier(identifier, item.rType()));
+  // Rewritten before the bookkeeping so that the copy kept for the missing
+  // list is what the uploaded item is.
+  if (auto* r = item.result()) {
+    if (r->islocalapplicationresult() && r->type() != kLocalApplicationExemptType) {
       r->set_knownapplicationbundleidentifier(kLocalApplicationBundleCode);
       r->set_knownresultbundleid(kLocalApplicationBundleCode);
     }
+    if (r->has_title() && !keepsTitle(r->type())) {
+      r->clear_title();
+      ++titlesCleared_;
+    }
+    rewritten_.insert(r);
+  } else {
+    rewritten_.insert(item.suggestion());
+  }
+}
+
+void SessionProcessingHelper::processItems(const Items& items, bool expanded) {
+  for (const CVIdentifiable& item : items) {
+    rewriteItem(item);
     expanded ? didExpand(item) : didReference(item);
+  }
+}
+
+void SessionProcessingHelper::applyTitleRule(google::protobuf::Message& message) {
+  const auto* descriptor = message.GetDescriptor();
+  const FieldDescriptor* titleText = descriptor->FindFieldByName("titleText");
+  if (titleText == nullptr || titleText->cpp_type() != FieldDescriptor::CPPTYPE_STRING || titleText->is_repeated()) {
+    return;
+  }
+  const auto* reflection = message.GetReflection();
+  // The title the user saw stays only when the engaged result is of a type
+  // whose titles are not personal.
+  bool keeps = false;
+  for (int i = 0; i < descriptor->field_count(); ++i) {
+    const FieldDescriptor* f = descriptor->field(i);
+    if (f->is_repeated() || f->message_type() != CVSearchResultForFeedback::descriptor()) continue;
+    if (!reflection->HasField(message, f)) continue;
+    keeps = keepsTitle(static_cast<const CVSearchResultForFeedback&>(reflection->GetMessage(message, f)).type());
+    break;
+  }
+  if (keeps) return;
+  if (reflection->HasField(message, titleText)) {
+    reflection->ClearField(&message, titleText);
+    ++titlesCleared_;
+  }
+  const FieldDescriptor* matches = descriptor->FindFieldByName("matchesUnengagedSuggestion");
+  if (matches != nullptr && matches->cpp_type() == FieldDescriptor::CPPTYPE_BOOL && !matches->is_repeated()) {
+    reflection->SetBool(&message, matches, false);
   }
 }
 
 void SessionProcessingHelper::process(google::protobuf::Message* feedback) {
   if (feedback == nullptr) return;
+  const bool outermost = depth_++ == 0;
+  processKnownKind(feedback);
+  if (outermost) {
+    // Whatever the table above does not reach (a section header's results, a
+    // kind added to the .proto later) is still mapped and stripped, without
+    // bookkeeping: the table alone decides what counts as shown or delivered.
+    forEachMessage(*feedback, [this](google::protobuf::Message& m) {
+      if (auto* r = messageAs<CVSearchResultForFeedback>(m)) {
+        if (!rewritten_.count(r)) rewriteItem(CVIdentifiable(r));
+      } else if (auto* s = messageAs<CVSearchSuggestionForFeedback>(m)) {
+        if (!rewritten_.count(s)) rewriteItem(CVIdentifiable(s));
+      } else {
+        applyTitleRule(m);
+      }
+    });
+    rewritten_.clear();
+  }
+  --depth_;
+}
+
+void SessionProcessingHelper::processKnownKind(google::protobuf::Message* feedback) {
   Items items;
 
   if (auto* m = messageAs<corevireon::CVVisibleResultsFeedback>(*feedback)) {
@@ -106,13 +176,6 @@ void SessionProcessingHelper::process(google::protobuf::Message* feedback) {
   } else if (auto* m = messageAs<corevireon::CVRankingFeedback>(*feedback)) {
     for (auto& sectionRanking : *m->mutable_sections()) process(&sectionRanking);
   } else if (auto* m = messageAs<corevireon::CVResultEngagementFeedback>(*feedback)) {
-    const bool keepsTitle =
-        m->has_result() && std::find(kTitleKeepingResultTypes.begin(), kTitleKeepingResultTypes.end(),
-                                     m->result().type()) != kTitleKeepingResultTypes.end();
-    if (!keepsTitle) {
-      m->clear_titletext();
-      m->set_matchesunengagedsuggestion(false);
-    }
     if (m->has_result()) items.emplace_back(m->mutable_result());
     processItems(items, false);
   } else if (auto* m = messageAs<corevireon::CVResultGradingFeedback>(*feedback)) {
@@ -140,6 +203,32 @@ std::optional<std::vector<CVSearchSuggestionForFeedback>> SessionProcessingHelpe
   std::vector<CVSearchSuggestionForFeedback> out;
   for (const auto& [id, item] : identifiableMapping_) {
     if (auto* s = std::get_if<CVSearchSuggestionForFeedback>(&item)) out.push_back(*s);
+  }
+  return out;
+}
+
+std::vector<CVSearchResultForFeedback> SessionProcessingHelper::takeMissingResults() {
+  std::vector<CVSearchResultForFeedback> out;
+  for (auto it = identifiableMapping_.begin(); it != identifiableMapping_.end();) {
+    if (auto* r = std::get_if<CVSearchResultForFeedback>(&it->second)) {
+      out.push_back(std::move(*r));
+      it = identifiableMapping_.erase(it);
+    } else {
+      ++it;
+    }
+  }
+  return out;
+}
+
+std::vector<CVSearchSuggestionForFeedback> SessionProcessingHelper::takeMissingSuggestions() {
+  std::vector<CVSearchSuggestionForFeedback> out;
+  for (auto it = identifiableMapping_.begin(); it != identifiableMapping_.end();) {
+    if (auto* s = std::get_if<CVSearchSuggestionForFeedback>(&it->second)) {
+      out.push_back(std::move(*s));
+      it = identifiableMapping_.erase(it);
+    } else {
+      ++it;
+    }
   }
   return out;
 }

@@ -8,7 +8,8 @@
 // replacement means something only within its session. Not thread-safe; it
 // lives on the work queue for the processing of one session.
 //
-// Rules, per feedback message (the first matching kind decides):
+// Rules, per feedback message (the first matching kind decides which items
+// count as referenced or expanded):
 //   visible results .............. `results` ............................ referenced
 //   visible suggestions .......... `suggestions` ........................ expanded
 //   suggestion engagement ........ `suggestion` ......................... referenced
@@ -21,16 +22,23 @@
 //   result grading ............... `result` ............................. referenced
 //   late sections appended ....... every section's `results` ............ expanded
 //   section engagement ........... the section's `results` .............. referenced
-// Rewrites made on the way:
-//   * result engagement: unless the result's type is 9, 10, 11, 12, 13, 14,
-//     18 or 19, `titleText` is cleared and `matchesUnengagedSuggestion` is
-//     set to false;
+// Then every result and suggestion anywhere else inside the feedback message
+// (a section header's section, a kind this table does not know) is found
+// through the descriptors and rewritten the same way, without bookkeeping.
+// Rewrites of every result and suggestion:
+//   * the identifier is replaced (`replacementForIdentifier`);
+//   * a result's `title` is cleared unless its type is 9, 10, 11, 12, 13, 14,
+//     18 or 19 (the title rule);
+//   * a local-application result whose type is not 20 gets the bundle codes
+//     `knownApplicationBundleIdentifier` and `knownResultBundleId` set to 2.
+// Rewrites of feedback messages:
+//   * any message with a `titleText` (result engagement): unless its result
+//     is of one of the eight types above, `titleText` is cleared and
+//     `matchesUnengagedSuggestion` set to false;
 //   * section ranking with result rankings: the section's `results` are
 //     cleared once gathered;
 //   * section engagement whose trigger event is not 2 (expand): the section's
-//     `results` are cleared once gathered (they still count as referenced);
-//   * a local-application result whose type is not 20 gets the bundle codes
-//     `knownApplicationBundleIdentifier` and `knownResultBundleId` set to 2.
+//     `results` are cleared once gathered (they still count as referenced).
 #pragma once
 
 #include "corevireon.pb.h"
@@ -42,6 +50,7 @@
 #include <set>
 #include <string>
 #include <unordered_map>
+#include <unordered_set>
 #include <variant>
 #include <vector>
 
@@ -73,10 +82,22 @@ class SessionProcessingHelper {
   // numbers; empty when there are none.
   std::optional<std::vector<corevireon::CVSearchResultForFeedback>> missingResults() const;
   std::optional<std::vector<corevireon::CVSearchSuggestionForFeedback>> missingSuggestions() const;
+  // The same lists, moved out of the helper (which then has none): for the
+  // one reader that consumes them, without copying every item again.
+  std::vector<corevireon::CVSearchResultForFeedback> takeMissingResults();
+  std::vector<corevireon::CVSearchSuggestionForFeedback> takeMissingSuggestions();
 
   int64_t nextMappedId() const { return nextMappedId_; }
   const std::set<std::string>& allIdSet() const { return allIdSet_; }
   const std::set<std::string>& expandedIdSet() const { return expandedIdSet_; }
+
+  // What the rewrites did so far: identifiers replaced (absent and empty ones
+  // do not count) and titles cleared (result titles and engagement titles).
+  uint64_t identifiersMapped() const { return identifiersMapped_; }
+  uint64_t titlesCleared() const { return titlesCleared_; }
+
+  // Whether a result of this type keeps its title on upload.
+  static bool keepsTitle(int32_t resultType);
 
  private:
   // Orders decimal strings by value ("2" before "10").
@@ -89,13 +110,22 @@ class SessionProcessingHelper {
   // may be removed from its feedback later (cleared section results).
   using Item = std::variant<corevireon::CVSearchResultForFeedback, corevireon::CVSearchSuggestionForFeedback>;
 
+  void processKnownKind(google::protobuf::Message* feedback);
   void processItems(const std::vector<CVIdentifiable>& items, bool expanded);
+  void rewriteItem(const CVIdentifiable& item);
+  void applyTitleRule(google::protobuf::Message& message);
 
   int64_t nextMappedId_ = 1;
   std::unordered_map<std::string, std::string> idMapping_;
   std::map<std::string, Item, ByNumericValue> identifiableMapping_;
   std::set<std::string> expandedIdSet_;
   std::set<std::string> allIdSet_;
+  // Items already rewritten during the current outermost `process` call, so
+  // the descriptor walk does not map an identifier twice.
+  std::unordered_set<const google::protobuf::Message*> rewritten_;
+  int depth_ = 0;
+  uint64_t identifiersMapped_ = 0;
+  uint64_t titlesCleared_ = 0;
 };
 
 }  // namespace fbf

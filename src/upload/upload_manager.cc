@@ -3,6 +3,7 @@
 #include "assembly/cache_paths.h"
 #include "assembly/fbf_strings.h"
 #include "assembly/feedback_types.h"
+#include "flushing/session_payload.h"
 #include "platform/logging.h"
 #include "upload/compressed_output_stream.h"
 #include "util/build_info.h"
@@ -333,11 +334,8 @@ std::optional<UploadRequest> UploadManager::uploadProtobufFeedback(const corevir
   }
   auto request = requestFor(type);
   if (!request) return std::nullopt;
-  std::string bytes;
-  if (!session.SerializeToString(&bytes)) {
-    log().error("Session didn't serialize properly to protobuf.");
-    return std::nullopt;
-  }
+  // Deterministic: the upload is byte for byte what `fbfctl explain` shows.
+  const std::string bytes = serializeSessionDeterministically(session);
   auto compressed = compressInto(*fileURL, [&](CompressedOutputStream& stream) {
     stream.write(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
     return true;

@@ -31,12 +31,13 @@ class CohortEnvelopes : public StoreFixture {
     store = bringUpAndSettle();
     ASSERT_NE(store, nullptr);
   }
-  std::unique_ptr<CohortFeedbackGenerator> makeGenerator(std::optional<ConfigurationBag> bag = std::nullopt) {
+  std::unique_ptr<CohortFeedbackGenerator> makeGenerator(std::optional<ConfigurationBag> bag = std::nullopt,
+                                                         const char* locale = "en_US") {
     CohortFeedbackGenerator::Collaborators c;
     c.bag = std::move(bag);
     c.deviceContext = &env.assembly().deviceContext();
     c.today = localTime(2030, 12, 31);
-    c.calendar = CohortCalendar("America/New_York", "en_US");
+    c.calendar = CohortCalendar("America/New_York", locale);
     c.random = std::make_shared<SeededRandomSource>(7);
     c.persist = [this](const std::string& bytes) { persisted.push_back(decode(bytes)); };
     c.offer = [this](const std::string& bytes) { offered.push_back(bytes); };
@@ -131,6 +132,21 @@ TEST_F(CohortEnvelopes, AggregatingAdvancesAndSavesTheMarkerToThePeriodEnd) {
             std::to_string(wholeSeconds(localTime(2030, 6, 9))));
 }
 
+// A run with Monday weeks, then runs with Sunday weeks: the first Sunday
+// week after the change starts where the Monday week ended.
+TEST_F(CohortEnvelopes, AChangeOfWeekRuleBetweenRunsNeitherOverlapsNorSkips) {
+  setMarker(FlushFrequency::weekly, localTime(2030, 5, 29, 10));
+  makeGenerator(std::nullopt, "de_DE")->aggregateNext(FlushFrequency::weekly);
+  EXPECT_EQ(marker(FlushFrequency::weekly), localTime(2030, 6, 3)) << "a Monday week";
+  for (auto [end, days] : {std::pair{localTime(2030, 6, 9), 6}, std::pair{localTime(2030, 6, 16), 7}}) {
+    persisted.clear();
+    makeGenerator(std::nullopt, "en_US")->aggregateNext(FlushFrequency::weekly);
+    EXPECT_EQ(marker(FlushFrequency::weekly), end);
+    ASSERT_FALSE(usageEnvelopes().empty());
+    EXPECT_EQ(usageEnvelopes()[0].configuredlookbacktimeindays(), days);
+  }
+}
+
 TEST_F(CohortEnvelopes, AWeekCountsDistinctLocalDaysInsideItsRange) {
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 1, 23, 59));  // Saturday before
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 2));          // Sunday, first instant
@@ -138,7 +154,7 @@ TEST_F(CohortEnvelopes, AWeekCountsDistinctLocalDaysInsideItsRange) {
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 4, 7));
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 8, 23, 59));  // Saturday, last day
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 6, 9));          // next Sunday
-  setMarker(FlushFrequency::weekly, localTime(2030, 6, 5));
+  setMarker(FlushFrequency::weekly, localTime(2030, 6, 2));  // the end of the week before
   saveOrLogError(store->managedObjectContext());
   makeGenerator()->aggregateNext(FlushFrequency::weekly);
   auto envelopes = usageEnvelopes();
@@ -152,7 +168,7 @@ TEST_F(CohortEnvelopes, AMonthAlsoWritesLookbackUsageAndOnePropensityEnvelope) {
   addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, localTime(2030, 2, 10, 12));  // lookback only
   addWayfinSession(localTime(2030, 2, 10, 12), {{VIRWayfinSession::goToSite, 1}, {VIRWayfinSession::other, 3}});
   addWayfinSession(localTime(2030, 2, 3, 12), {{VIRWayfinSession::localTap, 9}});  // before the lookback
-  setMarker(FlushFrequency::monthly, localTime(2030, 3, 15));
+  setMarker(FlushFrequency::monthly, localTime(2030, 3, 1));
   saveOrLogError(store->managedObjectContext());
 
   makeGenerator()->aggregateNext(FlushFrequency::monthly);

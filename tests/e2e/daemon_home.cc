@@ -88,6 +88,11 @@ void DaemonHome::configure(const std::string& url, const nlohmann::json& extra) 
 
 void DaemonHome::startDaemon(std::optional<int> descriptorLimit) {
   const fs::path program = binDir() / "vireon-fbf";
+  // A killed daemon leaves its socket behind, and the log grows across runs:
+  // readiness is this run's socket and this run's "setup" line.
+  std::error_code ec;
+  fs::remove(dirs_.socketPath(), ec);
+  const size_t logStart = daemonLog().size();
   if (descriptorLimit) {
     daemon_ = std::make_unique<ChildProcess>(
         "/bin/sh",
@@ -99,7 +104,7 @@ void DaemonHome::startDaemon(std::optional<int> descriptorLimit) {
                                              root() / "daemon.log");
   }
   auto socket = dirs_.socketPath();
-  waitUntil([&] { return fs::exists(socket) && daemonLog().find("setup") != std::string::npos; }, 10s);
+  waitUntil([&] { return fs::exists(socket) && daemonLog().find("setup", logStart) != std::string::npos; }, 10s);
 }
 
 std::optional<int> DaemonHome::stopDaemon() {

@@ -1,4 +1,5 @@
 #include "flushing/flushable_session.h"
+#include "flushing/session_payload.h"
 #include "processing/processing_builders.h"
 
 #include <gtest/gtest.h>
@@ -57,10 +58,48 @@ TEST_F(SessionTimeline, PayloadWithoutMessageStaysInPlaceAndNothingCrossesIt) {
   EXPECT_EQ(queries, (std::vector<uint64_t>{2, 1, 0, 4, 3}));
 }
 
-TEST_F(SessionTimeline, FirstPayloadWithoutMessageMeansBaseTimeZero) {
-  FlushableSession session(sessionWith({messageless(9), clearInput(7 * kMs)}));
+// No device clock reading leaves as it stands: the base is the first time in
+// processing order, and what lies before it (across a payload without a
+// message, which nothing crosses when sorting) is removed.
+TEST_F(SessionTimeline, DeviceTimesLeaveOnlyRelativeToTheFirstTime) {
+  struct Row {
+    const char* name;
+    CVClientSession session;
+    std::vector<uint64_t> expected;
+    uint64_t removed;
+  };
+  const Row rows[] = {
+      {"a first payload without message sets no base", sessionWith({messageless(9), clearInput(7'000 * kMs),
+                                                                     clearInput(7'003 * kMs)}),
+       {0, 3}, 0},
+      {"a message without a time sets no base", sessionWith({clearInput(0), clearInput(9'000 * kMs),
+                                                              clearInput(9'010 * kMs)}),
+       {0, 0, 10}, 0},
+      {"a time before the base is removed", sessionWith({clearInput(50'000 * kMs), messageless(9),
+                                                          clearInput(20'000 * kMs), clearInput(60'000 * kMs)}),
+       {0, 0, 10'000}, 1},
+  };
+  for (const auto& row : rows) {
+    FlushableSession session(row.session);
+    SessionRewriteSummary summary;
+    session.postProcessFeedback(nullptr, &summary);
+    EXPECT_EQ(clearInputTimestamps(session.backingStore()), row.expected) << row.name;
+    EXPECT_EQ(summary.timestampsRemoved, row.removed) << row.name;
+  }
+}
+
+TEST_F(SessionTimeline, NestedRankingTimesAreRelativeToo) {
+  CVFeedbackPayload ranking;
+  auto* section = ranking.mutable_ranking()->add_sections();
+  ranking.mutable_ranking()->set_timestamp(2'000 * kMs);
+  section->set_timestamp(2'005 * kMs);
+  section->add_results()->set_timestamp(1'000 * kMs);  // before the base: removed
+  FlushableSession session(sessionWith({clearInput(2'000 * kMs), ranking}));
   session.postProcessFeedback(nullptr);
-  EXPECT_EQ(clearInputTimestamps(session.backingStore()), std::vector<uint64_t>{7});
+  const auto& processed = session.backingStore().feedbacks().items(1).ranking();
+  EXPECT_EQ(processed.timestamp(), 0u);
+  EXPECT_EQ(processed.sections(0).timestamp(), 5u);
+  EXPECT_EQ(processed.sections(0).results(0).timestamp(), 0u);
 }
 
 TEST_F(SessionTimeline, RemoveTimestampsClearsSessionStartButKeepsRelativeTimes) {
@@ -202,6 +241,48 @@ TEST_F(LazyMembers, ResultsByIdLaterResultWinsAndAnonymousSkipped) {
   FlushableSession session(sessionWith({visibleResults(1, {first, anonymous}), visibleResults(1, {second})}));
   ASSERT_EQ(session.resultsById().size(), 1u);
   EXPECT_EQ(session.resultsById().at("x").title(), "second");
+}
+
+// Fields written by a newer search daemon (here: numbers this build has no
+// name for, at the session, payload, feedback and result level) never reach
+// an upload, in either format; the protobuf form is the same bytes every
+// time, whatever order the map was filled in.
+TEST(SessionPayloads, CarryNoUnknownFieldAndAreReproducible) {
+  auto s = sessionWith({visibleResults(1, {result("r")}, 5 * kMs)});
+  (*s.mutable_resourceversions())["zeta"] = "1";
+  (*s.mutable_resourceversions())["alpha"] = "2";
+  (*s.mutable_resourceversions())["mid"] = "3";
+  auto unknown = [](google::protobuf::Message& m, int number) {
+    m.GetReflection()->MutableUnknownFields(&m)->AddLengthDelimited(number, "cnry-unknown-field");
+  };
+  auto* payload = s.mutable_feedbacks()->mutable_items(0);
+  unknown(s, 900);
+  unknown(*payload, 901);
+  unknown(*payload->mutable_visibleresults(), 902);
+  unknown(*payload->mutable_visibleresults()->mutable_results(0), 903);
+  const std::string file = s.SerializeAsString();
+  ASSERT_NE(file.find("cnry-unknown-field"), std::string::npos);
+
+  for (auto format : {SessionPayloadFormat::protobuf, SessionPayloadFormat::json}) {
+    SessionPayload first = makeSessionPayload(file, format, nullptr);
+    ASSERT_EQ(first.outcome, SessionPayload::Outcome::ok);
+    EXPECT_EQ(first.bytes.find("cnry-unknown-field"), std::string::npos);
+    EXPECT_EQ(first.summary.unknownFieldsDiscarded, 4u);
+    EXPECT_EQ(first.summary.identifiersMapped, 1u);
+    EXPECT_EQ(makeSessionPayload(file, format, nullptr).bytes, first.bytes);
+  }
+  // The same session with its map filled the other way round.
+  CVClientSession reordered;
+  ASSERT_TRUE(reordered.ParseFromString(file));
+  reordered.mutable_resourceversions()->clear();
+  for (const char* key : {"mid", "alpha", "zeta"}) (*reordered.mutable_resourceversions())[key] = s.resourceversions().at(key);
+  EXPECT_EQ(makeSessionPayload(reordered.SerializeAsString(), SessionPayloadFormat::protobuf, nullptr).bytes,
+            makeSessionPayload(file, SessionPayloadFormat::protobuf, nullptr).bytes);
+
+  EXPECT_EQ(makeSessionPayload("\xff\xff", SessionPayloadFormat::json, nullptr).outcome,
+            SessionPayload::Outcome::undecodable);
+  EXPECT_EQ(makeSessionPayload(sessionWith({}).SerializeAsString(), SessionPayloadFormat::json, nullptr).outcome,
+            SessionPayload::Outcome::noFeedback);
 }
 
 }  // namespace

@@ -3,6 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <functional>
+
 namespace fbf {
 namespace {
 
@@ -13,6 +15,54 @@ std::vector<std::string> identifiersOf(const google::protobuf::RepeatedPtrField<
   std::vector<std::string> out;
   for (const auto& r : rs) out.push_back(r.has_identifier() ? r.identifier() : "<absent>");
   return out;
+}
+
+// Results and suggestions outside the per-kind table are found through the
+// descriptors: mapped and stripped of their titles like the others, but they
+// do not count as shown or delivered.
+TEST(ItemsAnywhere, AreMappedAndStrippedWithoutBookkeeping) {
+  struct Row {
+    const char* name;
+    std::function<void(corevireon::CVFeedbackPayload&)> build;
+    std::function<const CVSearchResultForFeedback&(const corevireon::CVFeedbackPayload&)> item;
+  };
+  auto titled = [](int32_t type) {
+    auto r = result("secret-id", type);
+    r.set_title("secret title");
+    return r;
+  };
+  const Row rows[] = {
+      {"section header, plain type",
+       [&](auto& p) {
+         *p.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled(2);
+       },
+       [](const auto& p) -> const auto& { return p.visiblesectionheader().section().results().items(0); }},
+      {"missing results written by the search daemon",
+       [&](auto& p) { *p.mutable_sessionmissingresults()->add_results() = titled(5); },
+       [](const auto& p) -> const auto& { return p.sessionmissingresults().results(0); }},
+  };
+  for (const auto& row : rows) {
+    SessionProcessingHelper helper;
+    corevireon::CVFeedbackPayload payload;
+    row.build(payload);
+    helper.process(mutableCodableMessage(payload));
+    EXPECT_EQ(row.item(payload).identifier(), "1") << row.name;
+    EXPECT_FALSE(row.item(payload).has_title()) << row.name;
+    EXPECT_EQ(helper.identifiersMapped(), 1u) << row.name;
+    EXPECT_EQ(helper.titlesCleared(), 1u) << row.name;
+    EXPECT_TRUE(helper.missingResults()->empty()) << row.name;
+  }
+  // A title-keeping type keeps it wherever it appears; a suggestion is mapped.
+  SessionProcessingHelper helper;
+  corevireon::CVFeedbackPayload payload;
+  *payload.mutable_sessionmissingsuggestions()->add_suggestions() = suggestion("secret-s");
+  helper.process(mutableCodableMessage(payload));
+  EXPECT_EQ(payload.sessionmissingsuggestions().suggestions(0).identifier(), "1");
+  corevireon::CVFeedbackPayload header;
+  *header.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled(9);
+  helper.process(mutableCodableMessage(header));
+  EXPECT_EQ(header.visiblesectionheader().section().results().items(0).title(), "secret title");
+  EXPECT_EQ(header.visiblesectionheader().section().results().items(0).identifier(), "2");
 }
 
 // Replacement numbers are handed out per key (identifier + decimal type).
@@ -123,9 +173,10 @@ TEST_F(ReferencedAndExpanded, SuggestionEngagedButNeverShownIsAMissingSuggestion
 }
 
 TEST_F(ReferencedAndExpanded, FirstReferenceIsKept) {
-  auto r1 = result("r", 5);
+  // Type 9 keeps its title, so the copy kept tells the two references apart.
+  auto r1 = result("r", 9);
   r1.set_title("first");
-  auto r2 = result("r", 5);
+  auto r2 = result("r", 9);
   r2.set_title("second");
   corevireon::CVResultGradingFeedback graded;
   *graded.mutable_result() = r1;

@@ -1,5 +1,6 @@
 #include "fbfctl/fbfctl.h"
 
+#include "fbfctl/explain.h"
 #include "fbfctl/payload_json.h"
 #include "ipc/control_client.h"
 #include "platform/file_manager.h"
@@ -33,6 +34,9 @@ constexpr const char* kUsageText =
     "                                    (or until N payloads were printed)\n"
     "  status [--json]                   pending feedback per state and type, and the usage\n"
     "                                    cohorts (collection start, last aggregations, sentinels)\n"
+    "  explain [--raw] PATH              the payload the next flush would upload for one session or\n"
+    "                                    custom feedback file, with what the rewrite changed; --raw\n"
+    "                                    writes its bytes (no daemon needed; sends nothing)\n"
     "  defaults read DOMAIN [KEY]\n"
     "  defaults write DOMAIN KEY [-bool|-int|-string] VALUE\n"
     "  defaults delete DOMAIN [KEY]      read and change preferences (no daemon needed)\n";
@@ -419,6 +423,7 @@ int run(const std::vector<std::string>& args, const Environment& env) {
   if (name == "tee") return command.tee(rest);
   if (name == "status") return command.status(rest);
   if (name == "defaults") return command.defaults(rest);
+  if (name == "explain") return explain(rest, env);
   return command.usage("unknown command " + name);
 }
 
