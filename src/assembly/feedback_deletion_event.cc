@@ -9,12 +9,17 @@ std::optional<FeedbackDeletionEvent> FeedbackDeletionEvent::make(const fs::path&
                                                                  const FileManager& fm) {
   auto attrs = fm.attributes(file);
   if (!attrs) return std::nullopt;
+  return make(*attrs, feedbackType, reason, when);
+}
+
+std::optional<FeedbackDeletionEvent> FeedbackDeletionEvent::make(const FileAttributes& attrs, int32_t feedbackType,
+                                                                 int32_t reason, SystemTime when) {
   if (feedbackType == kKnownFeedbackTypeUnknown || feedbackType == kKnownFeedbackTypeLast) return std::nullopt;
   FeedbackDeletionEvent e;
   e.feedbackType = feedbackType;
   e.reason = reason;
-  e.size = attrs->size / 1024 + (attrs->size % 1024 != 0 ? 1 : 0);
-  e.age = static_cast<int64_t>(std::chrono::duration<double>(when - attrs->creationDate).count());
+  e.size = attrs.size / 1024 + (attrs.size % 1024 != 0 ? 1 : 0);
+  e.age = static_cast<int64_t>(std::chrono::duration<double>(when - attrs.creationDate).count());
   return e;
 }
 

@@ -37,6 +37,9 @@ struct FeedbackDeletionEvent {
   // (unknown) and 14 (end marker), whose losses are never reported.
   static std::optional<FeedbackDeletionEvent> make(const fs::path& file, int32_t feedbackType, int32_t reason,
                                                    SystemTime when, const FileManager& fm);
+  // The same from attributes read earlier (the file may be gone by now).
+  static std::optional<FeedbackDeletionEvent> make(const FileAttributes& attributes, int32_t feedbackType,
+                                                   int32_t reason, SystemTime when);
 
   // Exactly the keys "feedbackType", "reason", "size", "age".
   nlohmann::json toJSON() const;

@@ -349,6 +349,9 @@ void FeedbackFlusher::enqueue(UploadRequest request, uint64_t fileSize, const fs
   auto self = shared_from_this();
   queuedUploads_.insert(request.fileURL);
   sourcesAwaitingSafety_[request.fileURL] = source;
+  if (!leaveFeedbackAfterUpload_ || !SessionFilename::fromString(source.filename().string())) {
+    request.removeOnAcceptance.push_back(source);
+  }
   std::string type = request.typeString;
   auto size = static_cast<unsigned long>(request.uncompressedSize);
   auto compressed = static_cast<unsigned long>(request.compressedSize);
@@ -368,12 +371,14 @@ void FeedbackFlusher::retireSource(const fs::path& source) {
   auto& fm = assembly_.fileManager();
   std::error_code ec;
   auto name = SessionFilename::fromString(source.filename().string());
+  // Gone already when the upload's acceptance removed it.
+  auto failed = [&] { return !fm.removeItem(source, ec) && ec != std::errc::no_such_file_or_directory; };
   if (!name) {
-    if (!fm.removeItem(source, ec)) log().error("Error removing custom feedback file after enqueuing it for upload.");
+    if (failed()) log().error("Error removing custom feedback file after enqueuing it for upload.");
     return;
   }
   if (leaveFeedbackAfterUpload_) return;  // renamed to "uploaded" on its 200
-  if (!fm.removeItem(source, ec)) log().error("Error removing session file after flush");
+  if (failed()) log().error("Error removing session file after flush");
 }
 
 void FeedbackFlusher::syncAndRetireSources() {

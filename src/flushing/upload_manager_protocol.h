@@ -17,6 +17,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace corevireon {
 class CVClientSession;
@@ -33,10 +34,14 @@ struct UploadRequest {
   int64_t uncompressedSize = 0;
   int64_t compressedSize = 0;
   std::string typeString;
+  // Files that go with the upload file the moment the server accepts it
+  // (the claimed file it was made from), so that a crash right after the
+  // 200 cannot send the payload again.
+  std::vector<fs::path> removeOnAcceptance;
 
   // A request for a file compressed by an earlier run: both sizes are 0.
   static UploadRequest retryRequest(HttpRequest request, fs::path fileURL, std::string typeString) {
-    return UploadRequest{std::move(request), std::move(fileURL), 0, 0, std::move(typeString)};
+    return UploadRequest{std::move(request), std::move(fileURL), 0, 0, std::move(typeString), {}};
   }
 };
 

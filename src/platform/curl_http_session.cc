@@ -378,6 +378,7 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
       long status = 0;
       curl_easy_getinfo(easy, CURLINFO_RESPONSE_CODE, &status);
       t->response.statusCode = status;
+      if (t->request.onStatus) t->request.onStatus(status);
       response = std::move(t->response);
     } else {
       long osErrno = 0;

@@ -32,6 +32,10 @@ struct HttpRequest {
   std::chrono::seconds timeout{60};
   // Ignore any locally cached response (no cache is kept anyway).
   bool ignoreLocalCache = false;
+  // Optional: called on the session's own thread as soon as the HTTP status
+  // is known, before the completion is queued. For work that must not wait
+  // behind the delegate queue; it must be quick and thread-safe.
+  std::function<void(long status)> onStatus;
 
   std::optional<std::string> header(std::string_view name) const;
 };

@@ -117,7 +117,8 @@ struct UploadManager::Core {
     if (delegate) delegate->uploadManagerDidUploadFile(file, status);
   }
 
-  void taskDidComplete(const fs::path& fileURL, const std::string& typeString, std::optional<HttpResponse> response,
+  void taskDidComplete(const fs::path& fileURL, const std::optional<FileAttributes>& attributes,
+                       const std::string& typeString, std::optional<HttpResponse> response,
                        std::optional<HttpError> error, const UploadCompletion& completion) {
     if (inFlight > 0) --inFlight;
     long status = response ? response->statusCode : 0;
@@ -139,12 +140,16 @@ struct UploadManager::Core {
     if (response->statusCode == 200) {
       log().debug("{} upload completed successfully", typeString);
       auto& fm = assembly.fileManager();
-      if (auto event = FeedbackDeletionEvent::make(fileURL, feedbackTypeCode(typeString),
-                                                   FeedbackDeletionReason::uploaded, assembly.currentDate(), fm)) {
+      // The session's thread may have removed the file already (see enqueue).
+      if (auto event = attributes ? FeedbackDeletionEvent::make(*attributes, feedbackTypeCode(typeString),
+                                                                FeedbackDeletionReason::uploaded, assembly.currentDate())
+                                  : std::nullopt) {
         assembly.didDeleteFeedbackFile(*event);
       }
       std::error_code ec;
-      if (!fm.removeItem(fileURL, ec)) log().error("Error deleting file after successful upload");
+      if (!fm.removeItem(fileURL, ec) && ec != std::errc::no_such_file_or_directory) {
+        log().error("Error deleting file after successful upload");
+      }
     } else {
       log().error("{} upload failed with non-200 response code", typeString);
     }
@@ -315,7 +320,7 @@ UploadRequest UploadManager::finish(HttpRequest request, const fs::path& fileURL
                                     std::string typeString) {
   setHeader(request, FBFStrings::HTTPHeaders::Digest, compressed.digest);
   return UploadRequest{std::move(request), fileURL, compressed.uncompressedSize, compressed.compressedSize,
-                       std::move(typeString)};
+                       std::move(typeString), {}};
 }
 
 // ---- preparations ----
@@ -431,20 +436,35 @@ void UploadManager::enqueue(UploadRequest request, UploadCompletion completion) 
   auto core = core_;
   auto fileURL = request.fileURL;
   auto typeString = request.typeString;
+  // Read now, while the file surely exists: the success event needs them.
+  auto attributes = fileManager_.attributes(fileURL);
   ++core->inFlight;
   if (!uploadSession_) {
     HttpError error{HttpErrorDomain::other, HttpErrorCode::other, "no upload session is available"};
     log().error("{} upload failed: {}", typeString, error.description);
-    assembly_.workloop().async([core, fileURL, typeString, error, completion = std::move(completion)]() mutable {
-      core->taskDidComplete(fileURL, typeString, std::nullopt, error, completion);
-    });
+    assembly_.workloop().async(
+        [core, fileURL, attributes, typeString, error, completion = std::move(completion)]() mutable {
+          core->taskDidComplete(fileURL, attributes, typeString, std::nullopt, error, completion);
+        });
     return;
   }
+  // Once the server has accepted the payload, every moment its files stay is
+  // a moment in which a crash would send it again; the work queue may be busy
+  // with a large file, so they go from the session's own thread.
+  std::vector<fs::path> acceptedFiles = std::move(request.removeOnAcceptance);
+  acceptedFiles.push_back(fileURL);
+  request.request.onStatus = [&fm = fileManager_, acceptedFiles = std::move(acceptedFiles)](long status) {
+    if (status != 200) return;
+    for (const auto& file : acceptedFiles) {
+      std::error_code ec;
+      fm.removeItem(file, ec);
+    }
+  };
   uploadSession_->uploadFile(
       std::move(request.request), request.fileURL,
-      [core, fileURL, typeString, completion = std::move(completion)](std::optional<HttpResponse> response,
-                                                                      std::optional<HttpError> error) {
-        core->taskDidComplete(fileURL, typeString, std::move(response), std::move(error), completion);
+      [core, fileURL, attributes, typeString, completion = std::move(completion)](std::optional<HttpResponse> response,
+                                                                                  std::optional<HttpError> error) {
+        core->taskDidComplete(fileURL, attributes, typeString, std::move(response), std::move(error), completion);
       });
 }
 

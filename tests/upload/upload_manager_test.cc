@@ -83,7 +83,7 @@ class UploadManagerTest : public ::testing::Test {
   void sendAndAnswer(UploadManager& m, std::optional<HttpResponse> response, std::optional<HttpError> error,
                      const std::string& type = "FeedbackV2PB") {
     testing::writeFile(uploadFile(), "compressed");
-    m.enqueue(UploadRequest{HttpRequest{}, uploadFile(), 10, 10, type},
+    m.enqueue(UploadRequest{HttpRequest{}, uploadFile(), 10, 10, type, {}},
               [this](std::optional<HttpResponse> r, std::optional<HttpError> e) {
                 completions.emplace_back(std::move(r), std::move(e));
               });
@@ -364,7 +364,7 @@ TEST_F(UploadManagerTest, NoResponseAndNoErrorReportsStatusZero) {
 TEST_F(UploadManagerTest, CompletionsAfterTheManagerIsGoneStillApplyTheRules) {
   auto m = makeManager();
   testing::writeFile(uploadFile(), "compressed");
-  m->enqueue(UploadRequest{HttpRequest{}, uploadFile(), 1, 1, "FeedbackV2PB"}, nullptr);
+  m->enqueue(UploadRequest{HttpRequest{}, uploadFile(), 1, 1, "FeedbackV2PB", {}}, nullptr);
   auto pending = std::move(session().tasks.back().completion);
   m.reset();
   EXPECT_TRUE(session().invalidated);
