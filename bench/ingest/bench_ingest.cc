@@ -207,7 +207,7 @@ int main(int argc, char** argv) {
   for (const auto& e : fs::directory_iterator(root / "sessions")) {
     if (!e.path().filename().string().starts_with("session.")) continue;
     corevireon::CVClientSession session;
-    if (!session.mutable_feedbacks()->ParseFromString(slurp(e.path()))) continue;
+    if (!session.ParseFromString(slurp(e.path()))) continue;
     session.set_agent("Wayfin/17.0");
     session.set_countrycode("DE");
     session.set_locale("de_DE");
