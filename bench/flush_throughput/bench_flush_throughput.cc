@@ -10,8 +10,8 @@
 //     after 50 ms (echo_sleep); and fbf-ingest beside them. The certificate
 //     is a throw-away self-signed one, trusted through VIRUploadCAFile;
 //   * for each flush the daemon is started afresh, timed through one
-//     `fbfctl flush`, and stopped: its CPU time and peak resident size come
-//     from wait4(), its open descriptors are sampled from /proc while it runs;
+//     `fbfctl flush`, and stopped: its CPU time comes from wait4(), its peak
+//     resident size (VmHWM) and open descriptors from /proc;
 //   * the floor: the encoding procedure alone (serialise the session, raw
 //     DEFLATE level 5 through the 4096-byte staging buffer, SHA-512 fed once
 //     per pass) over the same payloads, in this process;
@@ -149,6 +149,17 @@ size_t openDescriptors(pid_t pid) {
   return n;
 }
 
+// The peak resident size of a running process (VmHWM), in MB. Not wait4's
+// ru_maxrss: after posix_spawn that also counts the spawning process, whose
+// memory the child shared until its exec.
+double peakRssMB(pid_t pid) {
+  std::istringstream in(slurp("/proc/" + std::to_string(pid) + "/status"));
+  for (std::string line; std::getline(in, line);) {
+    if (line.starts_with("VmHWM:")) return std::stod(line.substr(6)) / 1024.0;
+  }
+  return 0;
+}
+
 bool socketAccepts(const fs::path& socketPath) {
   int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (fd < 0) return false;
@@ -276,13 +287,13 @@ class Bench {
     sampler.join();
     if (status != 0) die("fbfctl flush failed: " + slurp(root_ / "run.err"));
     r.maxDescriptors = maxFds;
+    r.maxRssMB = peakRssMB(daemon);
 
     kill(daemon, SIGTERM);
     rusage usage{};
     int waitStatus = 0;
     wait4(daemon, &waitStatus, 0, &usage);
     r.cpu = cpuSeconds(usage);
-    r.maxRssMB = static_cast<double>(usage.ru_maxrss) / 1024.0;
     r.uploaded = count - std::min(count, sessionsLeft());
     return r;
   }
