@@ -7,7 +7,8 @@
 #include <asio.hpp>
 #include <asio/ssl.hpp>
 #include <google/protobuf/arena.h>
-#include <google/protobuf/util/json_util.h>
+#include <google/protobuf/descriptor.h>
+#include <google/protobuf/message.h>
 #include <openssl/evp.h>
 #include <strings.h>
 #include <zlib.h>
@@ -17,6 +18,8 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <charconv>
+#include <cmath>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -129,17 +132,182 @@ std::string percentDecode(std::string_view s) {
   return out;
 }
 
-// Compact JSON text of a message, spliced into the record line as it is:
-// parsing it back only to print it again was most of this receiver's work.
-std::optional<std::string> protobufToJSON(const google::protobuf::Message& m, std::string& error) {
-  std::string text;
-  google::protobuf::util::JsonPrintOptions options;
-  options.preserve_proto_field_names = true;
-  auto status = google::protobuf::util::MessageToJsonString(m, &text, options);
-  if (!status.ok()) {
-    error = status.ToString();
-    return std::nullopt;
+// Compact JSON of a message in the proto3 JSON mapping (field names as in
+// the .proto file, 64-bit integers and bytes as strings, enums by name,
+// fields that are unset or at their default left out), written straight
+// into the record line through reflection. The library's converter goes
+// through a generic object stream and formats every number twice over; for
+// sessions it was most of this receiver's work. The messages here use no
+// well-known types, which would need their own mapping.
+class JsonPrinter {
+ public:
+  explicit JsonPrinter(std::string& out) : out_(out) {}
+
+  void message(const google::protobuf::Message& m) {
+    const auto* reflection = m.GetReflection();
+    std::vector<const google::protobuf::FieldDescriptor*> fields;
+    reflection->ListFields(m, &fields);
+    out_ += '{';
+    bool first = true;
+    for (const auto* field : fields) {
+      if (!first) out_ += ',';
+      first = false;
+      string(field->name());
+      out_ += ':';
+      if (field->is_map()) {
+        map(m, field);
+      } else if (field->is_repeated()) {
+        out_ += '[';
+        int n = reflection->FieldSize(m, field);
+        for (int i = 0; i < n; ++i) {
+          if (i > 0) out_ += ',';
+          value(m, field, i);
+        }
+        out_ += ']';
+      } else {
+        value(m, field, -1);
+      }
+    }
+    out_ += '}';
   }
+
+ private:
+  void map(const google::protobuf::Message& m, const google::protobuf::FieldDescriptor* field) {
+    const auto* reflection = m.GetReflection();
+    const auto* keyField = field->message_type()->map_key();
+    const auto* valueField = field->message_type()->map_value();
+    out_ += '{';
+    int n = reflection->FieldSize(m, field);
+    for (int i = 0; i < n; ++i) {
+      if (i > 0) out_ += ',';
+      const auto& entry = reflection->GetRepeatedMessage(m, field, i);
+      std::string key;
+      std::string saved;
+      saved.swap(out_);
+      value(entry, keyField, -1);
+      key.swap(out_);
+      out_.swap(saved);
+      if (key.empty() || key.front() != '"') {
+        string(key);  // numbers and booleans are quoted as keys
+      } else {
+        out_ += key;
+      }
+      out_ += ':';
+      value(entry, valueField, -1);
+    }
+    out_ += '}';
+  }
+
+  void number(double v) {
+    if (std::isnan(v)) {
+      out_ += "\"NaN\"";
+    } else if (std::isinf(v)) {
+      out_ += v > 0 ? "\"Infinity\"" : "\"-Infinity\"";
+    } else {
+      char buf[32];
+      auto [end, ec] = std::to_chars(buf, buf + sizeof buf, v);
+      out_.append(buf, ec == std::errc() ? end : buf);
+    }
+  }
+
+  template <typename T>
+  void integer(T v, bool quoted) {
+    char buf[24];
+    auto [end, ec] = std::to_chars(buf, buf + sizeof buf, v);
+    if (quoted) out_ += '"';
+    out_.append(buf, end);
+    if (quoted) out_ += '"';
+  }
+
+  void value(const google::protobuf::Message& m, const google::protobuf::FieldDescriptor* f, int i) {
+    using FD = google::protobuf::FieldDescriptor;
+    const auto* r = m.GetReflection();
+    const bool rep = i >= 0;
+    switch (f->cpp_type()) {
+      case FD::CPPTYPE_INT32: integer(rep ? r->GetRepeatedInt32(m, f, i) : r->GetInt32(m, f), false); break;
+      case FD::CPPTYPE_UINT32: integer(rep ? r->GetRepeatedUInt32(m, f, i) : r->GetUInt32(m, f), false); break;
+      case FD::CPPTYPE_INT64: integer(rep ? r->GetRepeatedInt64(m, f, i) : r->GetInt64(m, f), true); break;
+      case FD::CPPTYPE_UINT64: integer(rep ? r->GetRepeatedUInt64(m, f, i) : r->GetUInt64(m, f), true); break;
+      case FD::CPPTYPE_DOUBLE: number(rep ? r->GetRepeatedDouble(m, f, i) : r->GetDouble(m, f)); break;
+      case FD::CPPTYPE_FLOAT: {
+        float v = rep ? r->GetRepeatedFloat(m, f, i) : r->GetFloat(m, f);
+        if (std::isfinite(v)) {
+          char buf[32];
+          auto [end, ec] = std::to_chars(buf, buf + sizeof buf, v);
+          out_.append(buf, ec == std::errc() ? end : buf);
+        } else {
+          number(v);
+        }
+        break;
+      }
+      case FD::CPPTYPE_BOOL: out_ += (rep ? r->GetRepeatedBool(m, f, i) : r->GetBool(m, f)) ? "true" : "false"; break;
+      case FD::CPPTYPE_ENUM: {
+        int v = rep ? r->GetRepeatedEnumValue(m, f, i) : r->GetEnumValue(m, f);
+        if (const auto* e = f->enum_type()->FindValueByNumber(v)) {
+          string(e->name());
+        } else {
+          integer(v, false);
+        }
+        break;
+      }
+      case FD::CPPTYPE_STRING: {
+        std::string scratch;
+        const std::string& v = rep ? r->GetRepeatedStringReference(m, f, i, &scratch) : r->GetStringReference(m, f, &scratch);
+        if (f->type() == FD::TYPE_BYTES) {
+          base64(v);
+        } else {
+          string(v);
+        }
+        break;
+      }
+      case FD::CPPTYPE_MESSAGE: message(rep ? r->GetRepeatedMessage(m, f, i) : r->GetMessage(m, f)); break;
+    }
+  }
+
+  void base64(const std::string& v) {
+    std::string encoded(4 * ((v.size() + 2) / 3), '\0');
+    int n = EVP_EncodeBlock(reinterpret_cast<unsigned char*>(encoded.data()),
+                            reinterpret_cast<const unsigned char*>(v.data()), static_cast<int>(v.size()));
+    encoded.resize(static_cast<size_t>(std::max(n, 0)));
+    out_ += '"';
+    out_ += encoded;
+    out_ += '"';
+  }
+
+  void string(std::string_view v) {
+    static constexpr char kHex[] = "0123456789abcdef";
+    out_ += '"';
+    // Runs of characters that need no escape are copied whole.
+    size_t start = 0;
+    for (size_t k = 0; k < v.size(); ++k) {
+      auto u = static_cast<unsigned char>(v[k]);
+      if (u >= 0x20 && u != '"' && u != '\\') continue;
+      out_.append(v.data() + start, k - start);
+      start = k + 1;
+      switch (u) {
+        case '"': out_ += "\\\""; break;
+        case '\\': out_ += "\\\\"; break;
+        case '\n': out_ += "\\n"; break;
+        case '\r': out_ += "\\r"; break;
+        case '\t': out_ += "\\t"; break;
+        case '\b': out_ += "\\b"; break;
+        case '\f': out_ += "\\f"; break;
+        default:
+          out_ += "\\u00";
+          out_ += kHex[u >> 4];
+          out_ += kHex[u & 0xf];
+      }
+    }
+    out_.append(v.data() + start, v.size() - start);
+    out_ += '"';
+  }
+
+  std::string& out_;
+};
+
+std::optional<std::string> protobufToJSON(const google::protobuf::Message& m, std::string&) {
+  std::string text;
+  JsonPrinter(text).message(m);
   return text;
 }
 
