@@ -157,7 +157,7 @@ void UsageProcessor::process(const corevireon::CVClientSession& session) {
     if (UsageProcessor::session(searches, !engagements.empty(), client)) {
       int64_t fingerprint = sessionFingerprint(session);
       if (alreadyCounted(fingerprint)) {
-        logging::get("UsageProcessor").info("The usage of this session was counted before; not counted again");
+        logging::get("UsageProcessor").debug("The usage of this session was counted before; not counted again");
       } else {
         stageSessionSentinel(session, client);
         stageSessionPropensity(session, client, engagements);
