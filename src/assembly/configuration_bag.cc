@@ -25,6 +25,17 @@ std::optional<ConfigurationBag> ConfigurationBag::fromFile(const fs::path& path,
   return ConfigurationBag(std::move(*parsed));
 }
 
+std::optional<ConfigurationBag> ConfigurationBagCache::read(const fs::path& path, const FileManager& fileManager) {
+  auto stamp = FileStamp::of(path);
+  std::lock_guard lock(mutex_);
+  if (valid_ && path == path_ && stamp == stamp_) return bag_;
+  bag_ = stamp.exists ? ConfigurationBag::fromFile(path, fileManager) : std::nullopt;
+  path_ = path;
+  stamp_ = stamp;
+  valid_ = true;
+  return bag_;
+}
+
 std::optional<std::string> ConfigurationBag::string(std::string_view key) const {
   auto it = values_.find(key);
   if (it == values_.end() || !it->is_string()) return std::nullopt;

@@ -25,8 +25,8 @@ FBFAssembly::~FBFAssembly() = default;
 
 std::optional<ConfigurationBag> FBFAssembly::cachedBag() {
   auto url = cachedBagURL(fileManager());
-  if (!url || !fileManager().exists(*url)) return std::nullopt;
-  return ConfigurationBag::fromFile(*url, fileManager());
+  if (!url) return std::nullopt;
+  return bagCache_.read(*url, fileManager());
 }
 
 InstalledAppControllerProtocol* FBFAssembly::installedAppController() {

@@ -93,6 +93,7 @@ class FBFAssembly final : public FBFAssemblyProtocol {
   FBFAssemblyDependencies deps_;
   std::shared_ptr<TaskQueue> workloop_;
   std::shared_ptr<UserDefaults> userDefaults_;
+  ConfigurationBagCache bagCache_;
   std::unique_ptr<InstalledAppControllerProtocol> installedAppController_;
   std::shared_ptr<ClientConduit> uploadListener_;
   std::shared_ptr<ClientConduit> cohortsListener_;

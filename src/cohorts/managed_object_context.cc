@@ -43,7 +43,12 @@ void ManagedObjectContext::assertOnQueue() const {
 
 bool ManagedObjectContext::hasChanges() const {
   assertOnQueue();
-  return !staged_.empty();
+  return !staged_.empty() || !stagedStatements_.empty();
+}
+
+void ManagedObjectContext::stageStatement(std::string sql, std::vector<SqlValue> values) {
+  assertOnQueue();
+  stagedStatements_.emplace_back(std::move(sql), std::move(values));
 }
 
 std::shared_ptr<ManagedObject> ManagedObjectContext::insertNewObject(std::string_view entityName) {
@@ -71,7 +76,7 @@ void ManagedObjectContext::didChange(const std::shared_ptr<ManagedObject>& objec
 
 std::optional<std::string> ManagedObjectContext::save() {
   assertOnQueue();
-  if (staged_.empty()) return std::nullopt;
+  if (staged_.empty() && stagedStatements_.empty()) return std::nullopt;
   auto& db = *database_;
   std::string error;
   if (!db.exec("BEGIN IMMEDIATE", &error)) return error;
@@ -118,6 +123,15 @@ std::optional<std::string> ManagedObjectContext::save() {
       if (stmt->step() != SqliteStatement::Step::done) return fail(stmt->errorDescription());
     }
   }
+  for (const auto& [sql, values] : stagedStatements_) {
+    auto* stmt = db.cached(sql, &error);
+    if (!stmt) return fail(error);
+    stmt->bindAll(values);
+    bool failed = stmt->step() == SqliteStatement::Step::error;
+    std::string why = failed ? stmt->errorDescription() : std::string();
+    stmt->reset();
+    if (failed) return fail(why);
+  }
   if (!db.exec("COMMIT", &error)) return fail(error);
 
   for (const auto& object : staged_) {
@@ -126,6 +140,7 @@ std::optional<std::string> ManagedObjectContext::save() {
   }
   staged_.clear();
   stagedSet_.clear();
+  stagedStatements_.clear();
   return std::nullopt;
 }
 
@@ -138,6 +153,7 @@ void ManagedObjectContext::reset() {
   }
   staged_.clear();
   stagedSet_.clear();
+  stagedStatements_.clear();
   for (auto it = rows_.begin(); it != rows_.end();) {
     it = it->second.expired() ? rows_.erase(it) : std::next(it);
   }

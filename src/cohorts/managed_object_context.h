@@ -50,6 +50,11 @@ class ManagedObjectContext : public std::enable_shared_from_this<ManagedObjectCo
   using DidResetHandler = std::function<void(const std::set<const ManagedObject*>& dropped)>;
   void setDidResetHandler(DidResetHandler handler) { didReset_ = std::move(handler); }
 
+  // A statement outside the model, run inside the transaction of the next
+  // save after the staged records (so it is written with them or not at
+  // all); dropped by a reset like a staged record.
+  void stageStatement(std::string sql, std::vector<SqlValue> values);
+
   // A new staged record of the entity; null when the model has no such entity.
   std::shared_ptr<ManagedObject> insertNewObject(std::string_view entityName);
 
@@ -78,6 +83,7 @@ class ManagedObjectContext : public std::enable_shared_from_this<ManagedObjectCo
   // Staged records: new ones (rowid 0) and changed saved ones.
   std::vector<std::shared_ptr<ManagedObject>> staged_;
   std::set<const ManagedObject*> stagedSet_;
+  std::vector<std::pair<std::string, std::vector<SqlValue>>> stagedStatements_;
   // Materialised rows by entity and rowid; weak, so the cache does not grow
   // with what fetches return.
   std::map<std::pair<std::string_view, int64_t>, std::weak_ptr<ManagedObject>> rows_;

@@ -17,8 +17,8 @@ spdlog::logger& containerLog() { return logging::get("ObjectGraphStorageContaine
 spdlog::logger& queryLog() { return logging::get("ObjectGraphQueryProcessor"); }
 
 // Purged in this order; categories are not purged here.
-constexpr std::string_view kPurgedEntities[] = {"VIRUsageEvent", "VIRFlushEvent", "VIRWayfinSession",
-                                                "VIRScoutlumeSession", "VIRImagesSession"};
+constexpr std::string_view kPurgedEntities[] = {"VIRUsageEvent",       "VIRFlushEvent",    "VIRWayfinSession",
+                                                "VIRScoutlumeSession", "VIRImagesSession", "VIRCountedSession"};
 
 SqlValue dateValue(SystemTime t) { return secondsSinceEpoch(t); }
 

@@ -42,6 +42,13 @@ CREATE INDEX VIRScoutlumeSession_timestamp ON VIRScoutlumeSession (timestamp);
 CREATE INDEX VIRWayfinSession_timestamp ON VIRWayfinSession (timestamp);
 CREATE INDEX VIRImagesSession_timestamp ON VIRImagesSession (timestamp);
 )sql",
+    // 2 -> 3: the sessions whose usage has been counted, by fingerprint, so
+    // that a session processed again after a crash is not counted twice.
+    // "timestamp" is the session's start, for the purge.
+    R"sql(
+CREATE TABLE VIRCountedSession (fingerprint INTEGER PRIMARY KEY, timestamp REAL);
+CREATE INDEX VIRCountedSession_timestamp ON VIRCountedSession (timestamp);
+)sql",
 };
 static_assert(std::size(kMigrations) == kCohortsSchemaVersion);
 
@@ -210,6 +217,10 @@ bool SqliteDatabase::load(std::string& error) {
     return false;
   }
   wal->reset();
+  // With the write-ahead log, NORMAL keeps the store consistent through a
+  // crash or power loss and drops the fsync of every commit (one per
+  // session): a power loss may only forget the last few commits.
+  if (!exec("PRAGMA synchronous=NORMAL", &error)) return false;
   if (*version < kCohortsSchemaVersion) return migrate(*version, error);
   return true;
 }

@@ -27,7 +27,7 @@ struct sqlite3_stmt;
 namespace fbf {
 
 // The schema version this program writes (stored in PRAGMA user_version).
-inline constexpr int kCohortsSchemaVersion = 2;
+inline constexpr int kCohortsSchemaVersion = 3;
 
 // "<message> (<result code name>)", e.g. "database is locked (SQLITE_BUSY)".
 std::string describeSqliteResult(int resultCode, sqlite3* db);

@@ -1,6 +1,7 @@
 #include "cohorts/usage_processor.h"
 
 #include "flushing/feedback_capabilities.h"
+#include "platform/logging.h"
 
 #include <algorithm>
 #include <map>
@@ -82,7 +83,44 @@ size_t imagesCounter(const EngagementReporter& e, const std::map<std::string, co
   return C::image;
 }
 
+// FNV-1a, 64 bits.
+class Fingerprint {
+ public:
+  void add(const void* data, size_t size) {
+    const auto* p = static_cast<const unsigned char*>(data);
+    for (size_t i = 0; i < size; ++i) hash_ = (hash_ ^ p[i]) * 0x100000001b3ULL;
+  }
+  template <typename T>
+  void addValue(T value) {
+    add(&value, sizeof value);
+  }
+  void addString(const std::string& s) {
+    addValue(s.size());
+    add(s.data(), s.size());
+  }
+  int64_t value() const { return static_cast<int64_t>(hash_); }
+
+ private:
+  uint64_t hash_ = 0xcbf29ce484222325ULL;
+};
+
 }  // namespace
+
+int64_t UsageProcessor::sessionFingerprint(const corevireon::CVClientSession& session) {
+  Fingerprint f;
+  f.addString(session.agent());
+  f.addString(session.userguidstring());
+  f.addValue(session.sessionstart());
+  f.addValue(session.feedbacks().items_size());
+  for (const auto& p : session.feedbacks().items()) {
+    f.addValue(p.queryid());
+    f.addValue(p.type());
+    f.addValue(static_cast<int>(p.codable_case()));
+    const google::protobuf::Message* message = codableMessage(p);
+    f.addValue(message != nullptr ? feedbackTimestamp(*message).value_or(0) : 0);
+  }
+  return f.value();
+}
 
 bool UsageProcessor::session(bool withSearches, bool engagements, CVClient countsAsUsageFor) {
   if (!engagements) return false;
@@ -117,11 +155,33 @@ void UsageProcessor::process(const corevireon::CVClientSession& session) {
       }
     }
     if (UsageProcessor::session(searches, !engagements.empty(), client)) {
-      stageSessionSentinel(session, client);
-      stageSessionPropensity(session, client, engagements);
+      int64_t fingerprint = sessionFingerprint(session);
+      if (alreadyCounted(fingerprint)) {
+        logging::get("UsageProcessor").debug("The usage of this session was counted before; not counted again");
+      } else {
+        stageSessionSentinel(session, client);
+        stageSessionPropensity(session, client, engagements);
+        // Saved in the same transaction as the records just staged.
+        context.stageStatement("INSERT OR IGNORE INTO VIRCountedSession (fingerprint, timestamp) VALUES (?, ?)",
+                               {SqlValue{fingerprint}, SqlValue{session.sessionstart()}});
+      }
     }
   }
   saveOrLogError(context);
+}
+
+bool UsageProcessor::alreadyCounted(int64_t fingerprint) {
+  std::string error;
+  auto* stmt = persistentStore_.managedObjectContext().database().cached(
+      "SELECT 1 FROM VIRCountedSession WHERE fingerprint = ?", &error);
+  if (!stmt) {
+    logging::get("UsageProcessor").error("Cannot look up counted sessions: {}", error);
+    return false;
+  }
+  stmt->bindAll({SqlValue{fingerprint}});
+  bool found = stmt->step() == SqliteStatement::Step::row;
+  stmt->reset();
+  return found;
 }
 
 void UsageProcessor::stageSessionSentinel(const corevireon::CVClientSession& session, CVClient client) {

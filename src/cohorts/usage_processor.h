@@ -59,6 +59,12 @@
 // 107 calendar, 108 files, 109 photos, 110 third-party in-app content,
 // 111 bookmarks, 112 history, 113 open tabs, 114 third-party search engine.
 //
+// A session is counted once: its fingerprint (agent, user, start, and the
+// query, type, kind and time of each feedback item: what tells one session
+// file from another) is saved with its records, and a session whose
+// fingerprint is already in the store (processed again after a crash that
+// came before its file was deleted) is not counted again.
+//
 // A counter that would pass 32767 stops the process (a session cannot hold
 // that many engagements of one kind unless its file is corrupt).
 //
@@ -109,8 +115,10 @@ class UsageProcessor final : public UsageProcessorProtocol {
 
   // The usage rule on flags.
   static bool session(bool withSearches, bool engagements, corevireon::CVClient countsAsUsageFor);
+  static int64_t sessionFingerprint(const corevireon::CVClientSession& session);
 
  private:
+  bool alreadyCounted(int64_t fingerprint);
   void process(const corevireon::CVClientSession& session);
   void stageSessionSentinel(const corevireon::CVClientSession& session, corevireon::CVClient client);
   void stageSessionPropensity(const corevireon::CVClientSession& session, corevireon::CVClient client,

@@ -4,6 +4,7 @@
 #include <uriparser/Uri.h>
 
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 namespace fbf {
@@ -49,11 +50,33 @@ bool endsWith(std::string_view s, std::string_view suffix) {
   return s.size() >= suffix.size() && s.substr(s.size() - suffix.size()) == suffix;
 }
 
+// Answers of the public suffix list by name, per thread. A flush asks about
+// the same few hosts over and over (every shown and visited address of every
+// session), and each lookup walks the list; the answers never change, so the
+// cache only has to stay small: it starts over when full.
+class SuffixListCache {
+ public:
+  template <typename Lookup>
+  std::optional<std::string> get(std::string_view name, Lookup&& lookup) {
+    key_.assign(name);
+    if (auto it = entries_.find(key_); it != entries_.end()) return it->second;
+    if (entries_.size() >= kCapacity) entries_.clear();
+    const char* answer = lookup(key_.c_str());
+    auto value = answer != nullptr ? std::optional<std::string>(answer) : std::nullopt;
+    entries_.emplace(key_, value);
+    return value;
+  }
+
+ private:
+  static constexpr size_t kCapacity = 4096;
+  std::string key_;
+  std::unordered_map<std::string, std::optional<std::string>> entries_;
+};
+
 // The public suffix of a registrable domain, e.g. "co.uk" for "example.co.uk".
 std::optional<std::string> publicSuffixOf(const std::string& domain) {
-  const char* suffix = psl_unregistrable_domain(publicSuffixList(), domain.c_str());
-  if (suffix == nullptr) return std::nullopt;
-  return std::string(suffix);
+  thread_local SuffixListCache cache;
+  return cache.get(domain, [](const char* name) { return psl_unregistrable_domain(publicSuffixList(), name); });
 }
 
 }  // namespace
@@ -91,10 +114,8 @@ std::optional<MatchURLComponents> parseURLComponents(std::string_view text) {
 
 std::optional<std::string> registrableDomain(std::string_view host) {
   if (host.empty()) return std::nullopt;
-  std::string h(host);
-  const char* domain = psl_registrable_domain(publicSuffixList(), h.c_str());
-  if (domain == nullptr) return std::nullopt;
-  return std::string(domain);
+  thread_local SuffixListCache cache;
+  return cache.get(host, [](const char* name) { return psl_registrable_domain(publicSuffixList(), name); });
 }
 
 std::optional<std::string> embeddedAMPURL(const MatchURLComponents& components) {

@@ -26,7 +26,8 @@
 //     without its public suffix ("www.example.co.uk" and "example.com" both
 //     give "example"); a host without a registrable domain gives the host
 //     itself; an address without a host gives none.
-// Stateless; callable from any thread.
+// Stateless apart from a small per-thread cache of public suffix list
+// answers by host; callable from any thread.
 #pragma once
 
 #include "corevireon.pb.h"

@@ -3,6 +3,7 @@
 #include "platform/logging.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <mutex>
@@ -23,20 +24,38 @@ class JsonLinesAnalyticsSink final : public AnalyticsSink {
     logging::get("analytics").debug("{}", text.substr(0, text.size() - 1));
 
     std::lock_guard lock(mutex_);
+    if (!ensureOpen()) return;
+    // One write per line keeps lines whole with O_APPEND.
+    if (write(fd_.get(), text.data(), text.size()) != static_cast<ssize_t>(text.size())) {
+      logging::get("analytics").error("Short write to analytics file {}", file_.string());
+    }
+  }
+
+ private:
+  // The file stays open between events; it is opened again (created if need
+  // be) when the path no longer leads to it, because it was removed or
+  // rotated away. One stat(2) per event instead of an open and a close.
+  bool ensureOpen() {
+    struct stat byPath {};
+    if (fd_.valid() && ::lstat(file_.c_str(), &byPath) == 0 && byPath.st_dev == device_ && byPath.st_ino == inode_) {
+      return true;
+    }
+    fd_ = FileDescriptor();
     std::error_code ec;
     if (!fm_.createOrFixDirectory(file_.parent_path(), ec)) {
       logging::get("analytics").error("Cannot create analytics directory {}: {}", file_.parent_path().string(), ec.message());
-      return;
+      return false;
     }
     FileDescriptor fd(open(file_.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_NOFOLLOW | O_CLOEXEC, 0600));
-    if (!fd.valid()) {
+    struct stat opened {};
+    if (!fd.valid() || fstat(fd.get(), &opened) != 0) {
       logging::get("analytics").error("Cannot open analytics file {}", file_.string());
-      return;
+      return false;
     }
-    // One write per line keeps lines whole with O_APPEND.
-    if (write(fd.get(), text.data(), text.size()) != static_cast<ssize_t>(text.size())) {
-      logging::get("analytics").error("Short write to analytics file {}", file_.string());
-    }
+    fd_ = std::move(fd);
+    device_ = opened.st_dev;
+    inode_ = opened.st_ino;
+    return true;
   }
 
  private:
@@ -44,6 +63,9 @@ class JsonLinesAnalyticsSink final : public AnalyticsSink {
   FileManager& fm_;
   const Clock& clock_;
   std::mutex mutex_;
+  FileDescriptor fd_;
+  dev_t device_ = 0;
+  ino_t inode_ = 0;
 };
 
 }  // namespace

@@ -25,6 +25,8 @@ class AnalyticsSink {
 
 // Appends one JSON line per event ({"time","event","payload"}) to `file`
 // (created owner-only, parent directories too) and logs it at debug level.
+// The file is kept open between events and opened again when its path no
+// longer leads to it (removed or rotated).
 std::unique_ptr<AnalyticsSink> makeJsonLinesAnalyticsSink(fs::path file, FileManager& fileManager, const Clock& clock);
 
 }  // namespace fbf

@@ -1,15 +1,18 @@
 #include "platform/user_defaults.h"
 
+#include "platform/file_stamp.h"
 #include "platform/logging.h"
 
 #include <charconv>
+#include <map>
+#include <mutex>
 
 namespace fbf {
 
 std::optional<PropertyList> UserDefaults::objectForKey(std::string_view key) const {
-  auto dict = dictionaryRepresentation();
-  auto it = dict.find(key);
-  if (it == dict.end()) return std::nullopt;
+  auto dict = snapshot();
+  auto it = dict->find(key);
+  if (it == dict->end()) return std::nullopt;
   return *it;
 }
 
@@ -64,18 +67,37 @@ std::optional<std::vector<std::string>> UserDefaults::stringArrayForKey(std::str
 
 namespace {
 
-class PlistUserDefaults final : public UserDefaults {
+// The last parse of one domain's file, shared by every UserDefaults object of
+// the domain.
+class DomainCache {
  public:
-  PlistUserDefaults(std::string domain, fs::path file, FileManager& fm)
-      : domain_(std::move(domain)), file_(std::move(file)), fm_(fm) {}
+  DomainCache(fs::path file, FileManager& fm) : file_(std::move(file)), fm_(fm) {}
 
-  const std::string& domain() const override { return domain_; }
+  const fs::path& file() const { return file_; }
+  FileManager& fileManager() const { return fm_; }
 
-  PropertyList dictionaryRepresentation() const override {
+  std::shared_ptr<const PropertyList> values() {
+    auto stamp = FileStamp::of(file_);
+    std::lock_guard lock(mutex_);
+    if (values_ && stamp == stamp_) return values_;
+    values_ = std::make_shared<const PropertyList>(stamp.exists ? read() : PropertyList::object());
+    stamp_ = stamp;
+    return values_;
+  }
+
+  // After this process wrote the file: the next read parses it again even if
+  // the write left the stamp unchanged.
+  void invalidate() {
+    std::lock_guard lock(mutex_);
+    values_.reset();
+  }
+
+ private:
+  PropertyList read() const {
     std::error_code ec;
-    if (!fm_.exists(file_)) return PropertyList::object();
     auto bytes = fm_.readFile(file_, ec);
     if (!bytes) {
+      if (ec == std::errc::no_such_file_or_directory) return PropertyList::object();
       logging::get("UserDefaults").error("Cannot read preferences file {}: {}", file_.string(), ec.message());
       return PropertyList::object();
     }
@@ -89,8 +111,25 @@ class PlistUserDefaults final : public UserDefaults {
       logging::get("UserDefaults").error("Ignoring preferences file {}: top level is not a dictionary", file_.string());
       return PropertyList::object();
     }
-    return *parsed;
+    return std::move(*parsed);
   }
+
+  fs::path file_;
+  FileManager& fm_;
+  std::mutex mutex_;
+  FileStamp stamp_;
+  std::shared_ptr<const PropertyList> values_;
+};
+
+class PlistUserDefaults final : public UserDefaults {
+ public:
+  PlistUserDefaults(std::string domain, std::shared_ptr<DomainCache> cache)
+      : domain_(std::move(domain)), cache_(std::move(cache)) {}
+
+  const std::string& domain() const override { return domain_; }
+
+  PropertyList dictionaryRepresentation() const override { return *cache_->values(); }
+  std::shared_ptr<const PropertyList> snapshot() const override { return cache_->values(); }
 
   bool setObject(std::string_view key, const PropertyList& value) override {
     auto dict = dictionaryRepresentation();
@@ -106,37 +145,48 @@ class PlistUserDefaults final : public UserDefaults {
 
   bool removeDomain() override {
     std::error_code ec;
-    if (!fm_.exists(file_)) return true;
-    return fm_.removeItem(file_, ec);
+    auto& fm = cache_->fileManager();
+    if (!fm.exists(cache_->file())) return true;
+    bool removed = fm.removeItem(cache_->file(), ec);
+    cache_->invalidate();
+    return removed;
   }
 
  private:
   bool write(const PropertyList& dict) {
     std::error_code ec;
-    if (!fm_.createOrFixDirectory(file_.parent_path(), ec) ||
-        !fm_.writeFileAtomically(file_, serializePropertyList(dict, PropertyListFormat::xml), ec)) {
-      logging::get("UserDefaults").error("Cannot write preferences file {}: {}", file_.string(), ec.message());
+    auto& fm = cache_->fileManager();
+    const auto& file = cache_->file();
+    bool ok = fm.createOrFixDirectory(file.parent_path(), ec) &&
+              fm.writeFileAtomically(file, serializePropertyList(dict, PropertyListFormat::xml), ec);
+    cache_->invalidate();
+    if (!ok) {
+      logging::get("UserDefaults").error("Cannot write preferences file {}: {}", file.string(), ec.message());
       return false;
     }
     return true;
   }
 
   std::string domain_;
-  fs::path file_;
-  FileManager& fm_;
+  std::shared_ptr<DomainCache> cache_;
 };
 
 class PlistPreferencesStore final : public PreferencesStore {
  public:
   PlistPreferencesStore(fs::path dir, FileManager& fm) : dir_(std::move(dir)), fm_(fm) {}
   std::shared_ptr<UserDefaults> defaultsForDomain(const std::string& domain) override {
-    return std::make_shared<PlistUserDefaults>(domain, fileForDomain(domain), fm_);
+    std::lock_guard lock(mutex_);
+    auto& cache = caches_[domain];
+    if (!cache) cache = std::make_shared<DomainCache>(fileForDomain(domain), fm_);
+    return std::make_shared<PlistUserDefaults>(domain, cache);
   }
   fs::path fileForDomain(const std::string& domain) const override { return dir_ / (domain + ".plist"); }
 
  private:
   fs::path dir_;
   FileManager& fm_;
+  std::mutex mutex_;
+  std::map<std::string, std::shared_ptr<DomainCache>> caches_;
 };
 
 }  // namespace

@@ -1,8 +1,12 @@
 // The user-defaults store: one property-list file per preferences domain.
 //
-// Values are read from disk on every call, never cached, so a change made by
-// `fbfctl defaults write` (or by hand) takes effect at the next read. A missing
-// file means no values; a malformed one means no values plus one error line.
+// Every read sees the file as it is now, so a change made by `fbfctl defaults
+// write` (or by hand) takes effect at the next read. The file is parsed again
+// only when it has changed: each read costs one stat(2), compared against the
+// identity (device, inode), size and change times of the file last parsed
+// (lstat: a preferences file is never read through a symbolic link).
+// A missing file means no values; a malformed one means no values plus one
+// error line each time it changes.
 // Writes go through a temporary file and a rename, owner-only.
 // Thread-safety: callable from any thread; concurrent writers of the same
 // domain race as whole-file replacements (last writer wins).
@@ -26,6 +30,10 @@ class UserDefaults {
 
   // The whole domain as a dictionary (empty when missing or malformed).
   virtual PropertyList dictionaryRepresentation() const = 0;
+  // The same, shared rather than copied: what the typed getters read.
+  virtual std::shared_ptr<const PropertyList> snapshot() const {
+    return std::make_shared<const PropertyList>(dictionaryRepresentation());
+  }
   virtual bool setObject(std::string_view key, const PropertyList& value) = 0;
   virtual bool removeObject(std::string_view key) = 0;
   // Removes every key of the domain.

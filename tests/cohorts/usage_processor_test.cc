@@ -226,6 +226,22 @@ TEST_F(UsageCounting, EveryEngagementOfASessionIsCountedOnce) {
   EXPECT_EQ(counters(kWayfin), "goToSite=2 vireonTap=1 other=1");
 }
 
+TEST_F(UsageCounting, ASessionProcessedAgainIsCountedOnceAndADifferentOneStillCounts) {
+  auto s = makeSession("wayfin", start);
+  addSearch(s);
+  addDidGoToSite(s);
+  // The same file read again after a crash, then another session of the
+  // same surface and start.
+  processor->reportUsageEvents(s);
+  processor->reportUsageEvents(s);
+  auto other = s;
+  addDidGoToSite(other);
+  processor->reportUsageEvents(other);
+  EXPECT_EQ(raw().count("VIRUsageEvent"), 2);
+  EXPECT_EQ(raw().count("VIRWayfinSession"), 2);
+  EXPECT_EQ(raw().count("VIRCountedSession"), 2);
+}
+
 TEST(UsageCounterOverflow, PassingTheSigned16BitMaximumStopsTheProcess) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(

@@ -117,7 +117,7 @@ TEST_F(StoreBringUp, TheFileHasTheDocumentedTablesAndIsOwnerOnly) {
   auto store = bringUpAndSettle();
   ASSERT_NE(store, nullptr);
   RawDatabase raw(databasePath());
-  EXPECT_EQ(raw.scalar("PRAGMA user_version"), "2");
+  EXPECT_EQ(raw.scalar("PRAGMA user_version"), "3");
   EXPECT_EQ(raw.scalar("PRAGMA journal_mode"), "wal");
   EXPECT_EQ(raw.scalar("SELECT group_concat(name) FROM (SELECT name FROM pragma_table_info('VIRUsageEvent'))"),
             "rowid,timestamp,usageCategory");
@@ -227,8 +227,9 @@ PRAGMA user_version = 1;
     EXPECT_EQ(store->lastAggregations()[FlushFrequency::daily]->rowid(), 1);
   });
   RawDatabase raw(databasePath());
-  EXPECT_EQ(raw.scalar("PRAGMA user_version"), "2");
+  EXPECT_EQ(raw.scalar("PRAGMA user_version"), "3");
   EXPECT_EQ(raw.count("VIRImagesSession"), 0);
+  EXPECT_EQ(raw.count("VIRCountedSession"), 0);
   EXPECT_EQ(raw.scalar("SELECT appLaunch FROM VIRScoutlumeSession"), "3");
 }
 

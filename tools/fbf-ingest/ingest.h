@@ -42,8 +42,17 @@ struct ReceivedRequest {
   std::string body;
 };
 
-// The record line of one request (without "status").
-nlohmann::ordered_json describeRequest(const ReceivedRequest& request);
+// What is recorded of one request: the fields up to "type" in `head`, the
+// decoded body as JSON text (or "null") and why it could not be decoded.
+struct RequestDescription {
+  nlohmann::ordered_json head;
+  std::string decoded;
+  std::string decodeError;
+  // The whole record line, newline included, with this "status".
+  std::string line(const nlohmann::ordered_json& status) const;
+};
+
+RequestDescription describeRequest(const ReceivedRequest& request);
 
 // Raw DEFLATE; no value when the data is not one complete stream.
 std::optional<std::string> inflateRaw(const std::string& compressed);
