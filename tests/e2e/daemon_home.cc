@@ -86,9 +86,15 @@ void DaemonHome::configure(const std::string& url, const nlohmann::json& extra) 
   writeFile(cacheDir() / "fbf-last-flush", std::to_string(now.count()) + "\n");
 }
 
-void DaemonHome::startDaemon() {
-  daemon_ = std::make_unique<ChildProcess>(binDir() / "vireon-fbf", std::vector<std::string>{}, env_,
-                                           root() / "daemon.out", root() / "daemon.log");
+void DaemonHome::startDaemon(const std::vector<std::string>& wrapper) {
+  fs::path program = binDir() / "vireon-fbf";
+  std::vector<std::string> args;
+  if (!wrapper.empty()) {
+    args.assign(wrapper.begin() + 1, wrapper.end());
+    args.push_back(program.string());
+    program = wrapper.front();
+  }
+  daemon_ = std::make_unique<ChildProcess>(program, args, env_, root() / "daemon.out", root() / "daemon.log");
   auto socket = dirs_.socketPath();
   waitUntil([&] { return fs::exists(socket) && daemonLog().find("setup") != std::string::npos; }, 10s);
 }

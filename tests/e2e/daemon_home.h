@@ -57,8 +57,9 @@ class DaemonHome {
   void configure(const std::string& url, const nlohmann::json& extra = nlohmann::json::object());
   void writeBag(const std::string& url, const nlohmann::json& extra = nlohmann::json::object());
 
-  // Starts the daemon and waits until it serves its socket.
-  void startDaemon();
+  // Starts the daemon and waits until it serves its socket. A `wrapper`
+  // command, when given, runs the daemon (appended as its last argument).
+  void startDaemon(const std::vector<std::string>& wrapper = {});
   // SIGTERM; the exit status, if it ended in time.
   std::optional<int> stopDaemon();
   ChildProcess* daemon() { return daemon_.get(); }
