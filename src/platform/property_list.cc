@@ -4,6 +4,8 @@
 
 #include <cstdlib>
 #include <memory>
+#include <stdexcept>
+#include <string_view>
 
 namespace fbf {
 namespace {
@@ -15,6 +17,53 @@ struct PlistFree {
   void operator()(plist_t p) const { plist_free(p); }
 };
 using PlistPtr = std::unique_ptr<void, PlistFree>;
+
+// Strict UTF-8: no overlong forms, surrogates or code points past U+10FFFF.
+// The binary format's ASCII strings can carry any byte, and such text could
+// be neither written back nor shown as JSON.
+bool isValidUtf8(std::string_view s) {
+  size_t i = 0;
+  while (i < s.size()) {
+    auto c = static_cast<unsigned char>(s[i]);
+    if (c < 0x80) {
+      ++i;
+      continue;
+    }
+    size_t extra;
+    uint32_t cp;
+    if (c >= 0xC2 && c <= 0xDF) {
+      extra = 1, cp = c & 0x1F;
+    } else if (c >= 0xE0 && c <= 0xEF) {
+      extra = 2, cp = c & 0x0F;
+    } else if (c >= 0xF0 && c <= 0xF4) {
+      extra = 3, cp = c & 0x07;
+    } else {
+      return false;
+    }
+    if (i + extra >= s.size()) return false;  // cut short
+    for (size_t k = 1; k <= extra; ++k) {
+      auto d = static_cast<unsigned char>(s[i + k]);
+      if ((d & 0xC0) != 0x80) return false;
+      cp = (cp << 6) | (d & 0x3F);
+    }
+    if ((extra == 2 && (cp < 0x800 || (cp >= 0xD800 && cp <= 0xDFFF))) || (extra == 3 && (cp < 0x10000 || cp > 0x10FFFF)))
+      return false;
+    i += extra + 1;
+  }
+  return true;
+}
+
+std::string checkedText(std::string text) {
+  if (!isValidUtf8(text)) throw std::runtime_error("property list holds a string that is not UTF-8");
+  return text;
+}
+
+// Takes a string the library allocated.
+std::string checkedText(char* s) {
+  std::string out = s ? s : "";
+  std::free(s);
+  return checkedText(std::move(out));
+}
 
 PropertyList toJson(plist_t node, int depth) {
   if (depth > 64) throw std::runtime_error("property list nested too deeply");
@@ -36,16 +85,19 @@ PropertyList toJson(plist_t node, int depth) {
       plist_get_real_val(node, &d);
       return d;
     }
-    case PLIST_STRING:
+    case PLIST_STRING: {
+      // Not plist_get_string_val: it asserts (aborting the process) when a
+      // binary list's string holds a NUL byte.
+      uint64_t length = 0;
+      const char* s = plist_get_string_ptr(node, &length);
+      std::string out = s ? std::string(s, static_cast<size_t>(length)) : std::string();
+      if (out.find('\0') != std::string::npos) throw std::runtime_error("property list holds a string with a NUL byte");
+      return checkedText(std::move(out));
+    }
     case PLIST_KEY: {
       char* s = nullptr;
-      if (plist_get_node_type(node) == PLIST_STRING)
-        plist_get_string_val(node, &s);
-      else
-        plist_get_key_val(node, &s);
-      std::string out = s ? s : "";
-      std::free(s);
-      return out;
+      plist_get_key_val(node, &s);
+      return checkedText(s);
     }
     case PLIST_DATA: {
       char* d = nullptr;
@@ -75,6 +127,7 @@ PropertyList toJson(plist_t node, int depth) {
       auto obj = PropertyList::object();
       plist_dict_iter it = nullptr;
       plist_dict_new_iter(node, &it);
+      std::unique_ptr<void, decltype(&std::free)> iterGuard(it, &std::free);
       while (true) {
         char* key = nullptr;
         plist_t val = nullptr;
@@ -83,10 +136,9 @@ PropertyList toJson(plist_t node, int depth) {
           std::free(key);
           break;
         }
-        obj[key ? key : ""] = toJson(val, depth + 1);
-        std::free(key);
+        std::string name = checkedText(key);  // frees the key
+        obj[name] = toJson(val, depth + 1);
       }
-      std::free(it);
       return obj;
     }
     default:
