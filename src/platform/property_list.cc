@@ -53,6 +53,47 @@ bool isValidUtf8(std::string_view s) {
   return true;
 }
 
+// libplist asserts (aborting the process) when it is asked for a string or
+// key whose UTF-16 form in a binary list holds a NUL character, and a key
+// cannot be read any other way. So such lists are refused before they are
+// parsed: each object of the offset table that is a UTF-16 string is
+// checked. Anything malformed here is left to the library to reject.
+bool binaryListHasNulCharacter(std::string_view b) {
+  if (b.size() < 8 + 32 || b.substr(0, 8) != "bplist00") return false;
+  auto be = [&](size_t at, size_t width, uint64_t& out) {
+    if (width == 0 || width > 8 || at > b.size() || b.size() - at < width) return false;
+    out = 0;
+    for (size_t k = 0; k < width; ++k) out = (out << 8) | static_cast<unsigned char>(b[at + k]);
+    return true;
+  };
+  const size_t trailer = b.size() - 32;
+  const size_t offsetSize = static_cast<unsigned char>(b[trailer + 6]);
+  uint64_t objects = 0, table = 0;
+  if (!be(trailer + 8, 8, objects) || !be(trailer + 24, 8, table)) return false;
+  if (offsetSize == 0 || offsetSize > 8 || table > trailer || objects > (trailer - table) / offsetSize) return false;
+  for (uint64_t i = 0; i < objects; ++i) {
+    uint64_t at = 0;
+    if (!be(static_cast<size_t>(table + i * offsetSize), offsetSize, at) || at >= trailer) continue;
+    const auto marker = static_cast<unsigned char>(b[at]);
+    if ((marker >> 4) != 0x6) continue;
+    uint64_t units = marker & 0x0F;
+    size_t start = static_cast<size_t>(at) + 1;
+    if (units == 0x0F) {
+      // The length follows as an integer object: marker 0x1N, 2^N bytes.
+      if (start >= trailer) continue;
+      const auto intMarker = static_cast<unsigned char>(b[start]);
+      if ((intMarker >> 4) != 0x1 || (intMarker & 0x0F) > 3) continue;
+      const size_t width = size_t{1} << (intMarker & 0x0F);
+      if (!be(start + 1, width, units)) continue;
+      start += 1 + width;
+    }
+    for (uint64_t u = 0; u < units && start + 2 * u + 1 < trailer; ++u) {
+      if (b[start + 2 * u] == 0 && b[start + 2 * u + 1] == 0) return true;
+    }
+  }
+  return false;
+}
+
 std::string checkedText(std::string text) {
   if (!isValidUtf8(text)) throw std::runtime_error("property list holds a string that is not UTF-8");
   return text;
@@ -182,6 +223,10 @@ plist_t fromJson(const PropertyList& v) {
 std::optional<PropertyList> parsePropertyList(std::string_view bytes, std::string* error) {
   if (bytes.empty() || bytes.size() > UINT32_MAX) {
     if (error) *error = bytes.empty() ? "empty file" : "file too large";
+    return std::nullopt;
+  }
+  if (binaryListHasNulCharacter(bytes)) {
+    if (error) *error = "property list holds a string with a NUL character";
     return std::nullopt;
   }
   plist_t root = nullptr;

@@ -12,7 +12,10 @@
 #include <fmt/format.h>
 
 #include <chrono>
+#include <unistd.h>
+
 #include <cstdint>
+#include <cstdlib>
 #include <memory>
 #include <string>
 
@@ -60,7 +63,16 @@ Fixture& fixture() {
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   fbf::logging::setLevel(spdlog::level::off);
+  // Every input rewrites files, and SQLite syncs each commit: on a disk that
+  // costs seconds per input; memory-backed files cost nothing, and
+  // durability is not what is tested here.
+  if (::access("/dev/shm", W_OK) == 0) ::setenv("TMPDIR", "/dev/shm", 1);
   fixture();
+  // The fixture is never destroyed (inputs run until exit); its home is.
+  std::atexit([] {
+    std::error_code ec;
+    fs::remove_all(fixture().env.temp.path(), ec);
+  });
   return 0;
 }
 

@@ -11,7 +11,10 @@
 #include "upload/upload_manager.h"
 #include "upload/upload_test_util.h"
 
+#include <unistd.h>
+
 #include <cstdint>
+#include <cstdlib>
 #include <memory>
 #include <string>
 
@@ -43,7 +46,16 @@ Fixture& fixture() {
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   fbf::logging::setLevel(spdlog::level::off);
+  // Every input rewrites files, and SQLite syncs each commit: on a disk that
+  // costs seconds per input; memory-backed files cost nothing, and
+  // durability is not what is tested here.
+  if (::access("/dev/shm", W_OK) == 0) ::setenv("TMPDIR", "/dev/shm", 1);
   fixture();
+  // The fixture is never destroyed (inputs run until exit); its home is.
+  std::atexit([] {
+    std::error_code ec;
+    fs::remove_all(fixture().env.temp.path(), ec);
+  });
   return 0;
 }
 

@@ -21,6 +21,7 @@
 #include <sys/socket.h>
 
 #include <cstdint>
+#include <cstdlib>
 #include <map>
 #include <memory>
 #include <string>
@@ -122,6 +123,11 @@ bool readAll(int fd, std::string& out) {
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   fbf::logging::setLevel(spdlog::level::off);
   fixture();
+  // The fixture is never destroyed (inputs run until exit); its home is.
+  std::atexit([] {
+    std::error_code ec;
+    fs::remove_all(fixture().env.temp.path(), ec);
+  });
   return 0;
 }
 
