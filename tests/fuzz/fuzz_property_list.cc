@@ -12,9 +12,18 @@
 
 namespace {
 
+// The XML writer prints -0.0 as 0.0; the sign of a zero means nothing here.
+fbf::PropertyList withoutNegativeZero(fbf::PropertyList value) {
+  if (value.is_number_float() && value.get<double>() == 0.0) return 0.0;
+  if (value.is_structured()) {
+    for (auto& element : value) element = withoutNegativeZero(element);
+  }
+  return value;
+}
+
 std::string canonical(const fbf::PropertyList& value) {
   // NaN is not equal to itself; its text is.
-  return value.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+  return withoutNegativeZero(value).dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
 }
 
 }  // namespace
