@@ -4,7 +4,12 @@ ASAN_BUILD ?= build/asan
 JOBS       ?= $(shell nproc)
 CMAKE_GEN  := -G Ninja
 
-.PHONY: all deps build test test-release test-asan demo bench clean format
+FUZZ_BUILD   ?= build/fuzz
+FUZZ_SECONDS ?= 60
+# Seconds per harness of the smoke run that `make test` includes.
+FUZZ_SMOKE_SECONDS ?= 5
+
+.PHONY: all deps build test test-release test-asan test-fuzz-smoke test-unit demo bench fuzz fuzz-build clean format
 
 all: build
 
@@ -28,7 +33,25 @@ test-asan: deps $(ASAN_BUILD)/build.ninja
 	ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 \
 	  ctest --test-dir $(ASAN_BUILD) --output-on-failure -j $(JOBS)
 
-test: test-release test-asan
+test: test-release test-asan test-fuzz-smoke test-unit
+
+# The libFuzzer harnesses (tests/fuzz) in their own clang tree.
+$(FUZZ_BUILD)/build.ninja: | deps
+	CC=clang CXX=clang++ cmake -S . -B $(FUZZ_BUILD) $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=RelWithDebInfo -DFBF_FUZZ=ON
+
+fuzz-build: deps $(FUZZ_BUILD)/build.ninja
+	cmake --build $(FUZZ_BUILD) -j $(JOBS) --target fuzz_all
+
+# Every harness for FUZZ_SECONDS, one after the other.
+fuzz: fuzz-build
+	./scripts/fuzz.sh $(FUZZ_BUILD) $(FUZZ_SECONDS)
+
+test-fuzz-smoke: fuzz-build
+	./scripts/fuzz.sh $(FUZZ_BUILD) $(FUZZ_SMOKE_SECONDS)
+
+# The service unit: verified, and its exposure score within bounds.
+test-unit: deps
+	./scripts/check-unit.sh $(BUILD)/bin/vireon-fbf
 
 demo: build
 	./scripts/demo.sh $(BUILD)

@@ -12,6 +12,7 @@ PACKAGES=(
   systemtap-sdt-dev libsystemd-dev libglib2.0-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   faketime openssl curl python3
+  clang libclang-rt-14-dev systemd libseccomp-dev
 )
 
 missing=()

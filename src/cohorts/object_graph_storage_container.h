@@ -95,7 +95,7 @@ class ObjectGraphStorageContainer final : public DataStorageContainerProtocol {
   void loadLastAggregations();
   void loadLastAggregation(FlushFrequency frequency);
 
-  FileManager& fileManager_;
+  [[maybe_unused]] FileManager& fileManager_;
   std::shared_ptr<TaskQueue> queue_;
   std::shared_ptr<SqliteDatabase> maybePersistentContainer_;
   std::shared_ptr<ManagedObjectContext> maybeManagedObjectContext_;

@@ -191,6 +191,10 @@ std::optional<int> SqliteDatabase::userVersion(std::string& error) {
 bool SqliteDatabase::load(std::string& error) {
   auto version = userVersion(error);
   if (!version) return false;
+  if (*version < 0) {
+    error = fmt::format("the store has an invalid schema version ({})", *version);
+    return false;
+  }
   if (*version > kCohortsSchemaVersion) {
     error = fmt::format("the store was written by a newer schema version ({}, this program knows {})", *version,
                         kCohortsSchemaVersion);

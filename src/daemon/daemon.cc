@@ -19,6 +19,9 @@
 
 #include <asio.hpp>
 
+#include <sys/prctl.h>
+#include <sys/stat.h>
+
 #include <cstring>
 #include <iostream>
 
@@ -232,6 +235,12 @@ int daemonMain(int argc, char** argv) {
       return 0;
     }
   }
+  // Confine ourselves even when started by hand, outside the service unit:
+  // everything written is owner-only, and a crash never dumps the user's
+  // sessions into a core file (this also keeps other processes of the same
+  // user from attaching with ptrace or reading our memory through /proc).
+  ::umask(0077);
+  ::prctl(PR_SET_DUMPABLE, 0, 0, 0, 0);
   logging::init();
   vireon_signpost_launchBegin();
   assemblyLog().info("main");

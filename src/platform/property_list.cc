@@ -4,6 +4,8 @@
 
 #include <cstdlib>
 #include <memory>
+#include <stdexcept>
+#include <string_view>
 
 namespace fbf {
 namespace {
@@ -15,6 +17,94 @@ struct PlistFree {
   void operator()(plist_t p) const { plist_free(p); }
 };
 using PlistPtr = std::unique_ptr<void, PlistFree>;
+
+// Strict UTF-8: no overlong forms, surrogates or code points past U+10FFFF.
+// The binary format's ASCII strings can carry any byte, and such text could
+// be neither written back nor shown as JSON.
+bool isValidUtf8(std::string_view s) {
+  size_t i = 0;
+  while (i < s.size()) {
+    auto c = static_cast<unsigned char>(s[i]);
+    if (c < 0x80) {
+      ++i;
+      continue;
+    }
+    size_t extra;
+    uint32_t cp;
+    if (c >= 0xC2 && c <= 0xDF) {
+      extra = 1, cp = c & 0x1F;
+    } else if (c >= 0xE0 && c <= 0xEF) {
+      extra = 2, cp = c & 0x0F;
+    } else if (c >= 0xF0 && c <= 0xF4) {
+      extra = 3, cp = c & 0x07;
+    } else {
+      return false;
+    }
+    if (i + extra >= s.size()) return false;  // cut short
+    for (size_t k = 1; k <= extra; ++k) {
+      auto d = static_cast<unsigned char>(s[i + k]);
+      if ((d & 0xC0) != 0x80) return false;
+      cp = (cp << 6) | (d & 0x3F);
+    }
+    if ((extra == 2 && (cp < 0x800 || (cp >= 0xD800 && cp <= 0xDFFF))) || (extra == 3 && (cp < 0x10000 || cp > 0x10FFFF)))
+      return false;
+    i += extra + 1;
+  }
+  return true;
+}
+
+// libplist asserts (aborting the process) when it is asked for a string or
+// key whose UTF-16 form in a binary list holds a NUL character, and a key
+// cannot be read any other way. So such lists are refused before they are
+// parsed: each object of the offset table that is a UTF-16 string is
+// checked. Anything malformed here is left to the library to reject.
+bool binaryListHasNulCharacter(std::string_view b) {
+  if (b.size() < 8 + 32 || b.substr(0, 8) != "bplist00") return false;
+  auto be = [&](size_t at, size_t width, uint64_t& out) {
+    if (width == 0 || width > 8 || at > b.size() || b.size() - at < width) return false;
+    out = 0;
+    for (size_t k = 0; k < width; ++k) out = (out << 8) | static_cast<unsigned char>(b[at + k]);
+    return true;
+  };
+  const size_t trailer = b.size() - 32;
+  const size_t offsetSize = static_cast<unsigned char>(b[trailer + 6]);
+  uint64_t objects = 0, table = 0;
+  if (!be(trailer + 8, 8, objects) || !be(trailer + 24, 8, table)) return false;
+  if (offsetSize == 0 || offsetSize > 8 || table > trailer || objects > (trailer - table) / offsetSize) return false;
+  for (uint64_t i = 0; i < objects; ++i) {
+    uint64_t at = 0;
+    if (!be(static_cast<size_t>(table + i * offsetSize), offsetSize, at) || at >= trailer) continue;
+    const auto marker = static_cast<unsigned char>(b[at]);
+    if ((marker >> 4) != 0x6) continue;
+    uint64_t units = marker & 0x0F;
+    size_t start = static_cast<size_t>(at) + 1;
+    if (units == 0x0F) {
+      // The length follows as an integer object: marker 0x1N, 2^N bytes.
+      if (start >= trailer) continue;
+      const auto intMarker = static_cast<unsigned char>(b[start]);
+      if ((intMarker >> 4) != 0x1 || (intMarker & 0x0F) > 3) continue;
+      const size_t width = size_t{1} << (intMarker & 0x0F);
+      if (!be(start + 1, width, units)) continue;
+      start += 1 + width;
+    }
+    for (uint64_t u = 0; u < units && start + 2 * u + 1 < trailer; ++u) {
+      if (b[start + 2 * u] == 0 && b[start + 2 * u + 1] == 0) return true;
+    }
+  }
+  return false;
+}
+
+std::string checkedText(std::string text) {
+  if (!isValidUtf8(text)) throw std::runtime_error("property list holds a string that is not UTF-8");
+  return text;
+}
+
+// Takes a string the library allocated.
+std::string checkedText(char* s) {
+  std::string out = s ? s : "";
+  std::free(s);
+  return checkedText(std::move(out));
+}
 
 PropertyList toJson(plist_t node, int depth) {
   if (depth > 64) throw std::runtime_error("property list nested too deeply");
@@ -36,16 +126,19 @@ PropertyList toJson(plist_t node, int depth) {
       plist_get_real_val(node, &d);
       return d;
     }
-    case PLIST_STRING:
+    case PLIST_STRING: {
+      // Not plist_get_string_val: it asserts (aborting the process) when a
+      // binary list's string holds a NUL byte.
+      uint64_t length = 0;
+      const char* s = plist_get_string_ptr(node, &length);
+      std::string out = s ? std::string(s, static_cast<size_t>(length)) : std::string();
+      if (out.find('\0') != std::string::npos) throw std::runtime_error("property list holds a string with a NUL byte");
+      return checkedText(std::move(out));
+    }
     case PLIST_KEY: {
       char* s = nullptr;
-      if (plist_get_node_type(node) == PLIST_STRING)
-        plist_get_string_val(node, &s);
-      else
-        plist_get_key_val(node, &s);
-      std::string out = s ? s : "";
-      std::free(s);
-      return out;
+      plist_get_key_val(node, &s);
+      return checkedText(s);
     }
     case PLIST_DATA: {
       char* d = nullptr;
@@ -75,6 +168,7 @@ PropertyList toJson(plist_t node, int depth) {
       auto obj = PropertyList::object();
       plist_dict_iter it = nullptr;
       plist_dict_new_iter(node, &it);
+      std::unique_ptr<void, decltype(&std::free)> iterGuard(it, &std::free);
       while (true) {
         char* key = nullptr;
         plist_t val = nullptr;
@@ -83,10 +177,9 @@ PropertyList toJson(plist_t node, int depth) {
           std::free(key);
           break;
         }
-        obj[key ? key : ""] = toJson(val, depth + 1);
-        std::free(key);
+        std::string name = checkedText(key);  // frees the key
+        obj[name] = toJson(val, depth + 1);
       }
-      std::free(it);
       return obj;
     }
     default:
@@ -130,6 +223,10 @@ plist_t fromJson(const PropertyList& v) {
 std::optional<PropertyList> parsePropertyList(std::string_view bytes, std::string* error) {
   if (bytes.empty() || bytes.size() > UINT32_MAX) {
     if (error) *error = bytes.empty() ? "empty file" : "file too large";
+    return std::nullopt;
+  }
+  if (binaryListHasNulCharacter(bytes)) {
+    if (error) *error = "property list holds a string with a NUL character";
     return std::nullopt;
   }
   plist_t root = nullptr;

@@ -152,12 +152,17 @@ TEST_F(UnusableStoreFile, ACorruptFileYieldsNoStoreAndIsLeftAlone) {
   expectNoStoreAndFileUnchanged(garbage);
 }
 
-TEST_F(UnusableStoreFile, AFileOfANewerSchemaVersionYieldsNoStoreAndIsLeftAlone) {
-  {
-    RawDatabase raw(databasePath());
-    ASSERT_TRUE(raw.exec("CREATE TABLE VIRFutureThing (x); PRAGMA user_version = 9;"));
+TEST_F(UnusableStoreFile, AFileOfANewerOrImpossibleSchemaVersionYieldsNoStoreAndIsLeftAlone) {
+  // -1325400064: a damaged header the cohorts fuzzer wrote; it used to index
+  // the migrations out of bounds.
+  for (const char* version : {"9", "-1325400064"}) {
+    fs::remove(databasePath());
+    {
+      RawDatabase raw(databasePath());
+      ASSERT_TRUE(raw.exec(std::string("CREATE TABLE VIRFutureThing (x); PRAGMA user_version = ") + version + ";"));
+    }
+    expectNoStoreAndFileUnchanged(readFile(databasePath()));
   }
-  expectNoStoreAndFileUnchanged(readFile(databasePath()));
 }
 
 TEST_F(UnusableStoreFile, AFileLockedByAnotherProcessYieldsNoStoreAndIsLeftAlone) {

@@ -86,23 +86,24 @@ void DaemonHome::configure(const std::string& url, const nlohmann::json& extra) 
   writeFile(cacheDir() / "fbf-last-flush", std::to_string(now.count()) + "\n");
 }
 
-void DaemonHome::startDaemon(std::optional<int> descriptorLimit) {
-  const fs::path program = binDir() / "vireon-fbf";
+std::vector<std::string> DaemonHome::descriptorLimit(int limit) {
+  return {"/bin/sh", "-c", "ulimit -n " + std::to_string(limit) + " && exec \"$0\""};
+}
+
+void DaemonHome::startDaemon(const std::vector<std::string>& wrapper) {
+  fs::path program = binDir() / "vireon-fbf";
   // A killed daemon leaves its socket behind, and the log grows across runs:
   // readiness is this run's socket and this run's "setup" line.
   std::error_code ec;
   fs::remove(dirs_.socketPath(), ec);
   const size_t logStart = daemonLog().size();
-  if (descriptorLimit) {
-    daemon_ = std::make_unique<ChildProcess>(
-        "/bin/sh",
-        std::vector<std::string>{"-c", "ulimit -n " + std::to_string(*descriptorLimit) + " && exec \"$0\"",
-                                 program.string()},
-        env_, root() / "daemon.out", root() / "daemon.log");
-  } else {
-    daemon_ = std::make_unique<ChildProcess>(program, std::vector<std::string>{}, env_, root() / "daemon.out",
-                                             root() / "daemon.log");
+  std::vector<std::string> args;
+  if (!wrapper.empty()) {
+    args.assign(wrapper.begin() + 1, wrapper.end());
+    args.push_back(program.string());
+    program = wrapper.front();
   }
+  daemon_ = std::make_unique<ChildProcess>(program, args, env_, root() / "daemon.out", root() / "daemon.log");
   auto socket = dirs_.socketPath();
   waitUntil([&] { return fs::exists(socket) && daemonLog().find("setup", logStart) != std::string::npos; }, 10s);
 }

@@ -57,9 +57,11 @@ class DaemonHome {
   void configure(const std::string& url, const nlohmann::json& extra = nlohmann::json::object());
   void writeBag(const std::string& url, const nlohmann::json& extra = nlohmann::json::object());
 
-  // Starts the daemon and waits until it serves its socket; with
-  // `descriptorLimit`, under that RLIMIT_NOFILE (as `ulimit -n` would).
-  void startDaemon(std::optional<int> descriptorLimit = std::nullopt);
+  // Starts the daemon and waits until it serves its socket. A `wrapper`
+  // command, when given, runs the daemon (appended as its last argument).
+  void startDaemon(const std::vector<std::string>& wrapper = {});
+  // A wrapper that runs the daemon under RLIMIT_NOFILE `limit` (`ulimit -n`).
+  static std::vector<std::string> descriptorLimit(int limit);
   // SIGTERM; the exit status, if it ended in time.
   std::optional<int> stopDaemon();
   ChildProcess* daemon() { return daemon_.get(); }

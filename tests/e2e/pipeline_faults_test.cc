@@ -89,7 +89,7 @@ TEST_F(PipelineFaults, ThousandsOfSessionsUnderALowDescriptorLimitAllArrive) {
   startReceiver({"--delay-ms", "2"});
   home.configure(receiver->url());
   ASSERT_EQ(home.generate(sessions, 0, 6).status, 0);
-  home.startDaemon(256);
+  home.startDaemon(DaemonHome::descriptorLimit(256));
   auto r = home.fbfctl({"flush"}, 600s);
   ASSERT_EQ(r.status, 0) << r.err << tail(home.daemonLog());
   expectAllDelivered(static_cast<size_t>(sessions));
@@ -175,7 +175,7 @@ TEST_F(PipelineFaults, SigtermDuringAStalledUploadExitsPromptlyAndKeepsTheFiles)
 TEST_F(PipelineFaults, AcceptLoopBacksOffWhenDescriptorsRunOutAndServesAgainAfter) {
   startReceiver();
   home.configure(receiver->url());
-  home.startDaemon(40);
+  home.startDaemon(DaemonHome::descriptorLimit(40));
   std::vector<int> clients;
   for (int i = 0; i < 60; ++i) {
     int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);

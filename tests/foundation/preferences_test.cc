@@ -121,5 +121,35 @@ TEST_F(BagFiles, SymlinkedBagIsNotFollowed) {
   EXPECT_FALSE(env.assembly().cachedBag());
 }
 
+
+// Inputs the property-list fuzzer found. A binary list's strings and keys
+// may hold any character: a UTF-16 NUL aborted the process inside libplist,
+// and other bytes in an ASCII string made text that could be neither written
+// back nor shown as JSON. Either way the file is refused, with the reason.
+TEST(PropertyListFindings, BinaryStringsThatAreNotTextAreRefused) {
+  // {"kk": "abc"} as a binary list: the key object at 11-13 (marker 0x52),
+  // the string object at 14-17 (marker 0x53).
+  const std::string valid = std::string("bplist00\xd1\x01\x02\x52kk\x53" "abc\x08\x0b\x0e", 21) +
+                            std::string("\0\0\0\0\0\0\x01\x01\0\0\0\0\0\0\0\x03\0\0\0\0\0\0\0\0\0\0\0\0\0\0\0\x12", 32);
+  ASSERT_EQ(parsePropertyList(valid), (PropertyList{{"kk", "abc"}}));
+  const struct {
+    size_t at, length;
+    std::string_view object;
+    std::string_view reason;
+  } cases[] = {
+      {14, 4, std::string_view("\x61\0\0\0", 4), "NUL"},  // a string of one UTF-16 character, U+0000
+      {11, 3, std::string_view("\x61\0\0", 3), "NUL"},     // the same as the key
+      {14, 4, "\x53" "a\xff" "c", "UTF-8"},
+      {14, 4, "\x53\xc0\xaf" "c", "UTF-8"},  // an overlong "/"
+  };
+  for (const auto& c : cases) {
+    std::string bytes = valid;
+    bytes.replace(c.at, c.length, c.object);
+    std::string error;
+    EXPECT_FALSE(parsePropertyList(bytes, &error)) << c.reason;
+    EXPECT_NE(error.find(c.reason), std::string::npos) << error;
+  }
+}
+
 }  // namespace
 }  // namespace fbf
