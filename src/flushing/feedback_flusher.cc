@@ -91,6 +91,11 @@ void FeedbackFlusher::stopEnumeratingFeedback() {
   auto self = shared_from_this();
   assembly_.workloop().async([self] {
     if (self->feedbackEnumerator_) self->feedbackEnumerator_->finish();
+    // A walk waiting for room ends now rather than at the next completion.
+    if (self->walkWaiting_) {
+      self->walkWaiting_ = false;
+      self->enumeratingFeedbackDidFinish();
+    }
   });
 }
 

@@ -241,6 +241,14 @@ std::optional<fs::path> UploadManager::uploadFileForSession(const SessionFilenam
   return *dir / session.uploadFilenameString();
 }
 
+std::optional<fs::path> UploadManager::uploadFileForSessionAt(const fs::path& sessionURL, UploadFormat format) const {
+  auto name = SessionFilename::fromString(sessionURL.filename().string());
+  if (name) name->uploadFormat = format;
+  auto fileURL = name ? uploadFileForSession(*name) : std::nullopt;
+  if (!fileURL) log().error("Error getting temp file.");
+  return fileURL;
+}
+
 fs::path UploadManager::uploadFileForCustomFeedback(const fs::path& url) {
   fs::path path = url;
   path += std::string(FBFStrings::UploadPendingSuffix);
@@ -330,13 +338,8 @@ UploadRequest UploadManager::finish(HttpRequest request, const fs::path& fileURL
 std::optional<UploadRequest> UploadManager::uploadProtobufFeedback(const corevireon::CVClientSession& session,
                                                                    const fs::path& sessionURL) {
   const std::string type(FBFStrings::VireonProtobufFeedbackType);
-  auto name = SessionFilename::fromString(sessionURL.filename().string());
-  if (name) name->uploadFormat = UploadFormat::pb;
-  auto fileURL = name ? uploadFileForSession(*name) : std::nullopt;
-  if (!fileURL) {
-    log().error("Error getting temp file.");
-    return std::nullopt;
-  }
+  auto fileURL = uploadFileForSessionAt(sessionURL, UploadFormat::pb);
+  if (!fileURL) return std::nullopt;
   auto request = requestFor(type);
   if (!request) return std::nullopt;
   // Deterministic: the upload is byte for byte what `fbfctl explain` shows.
@@ -362,13 +365,8 @@ std::optional<UploadRequest> UploadManager::uploadProtobufFeedback(const corevir
 std::optional<UploadRequest> UploadManager::uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
                                                                const fs::path& sessionURL) {
   const std::string type(FBFStrings::VireonFeedbackType);
-  auto name = SessionFilename::fromString(sessionURL.filename().string());
-  if (name) name->uploadFormat = UploadFormat::json;
-  auto fileURL = name ? uploadFileForSession(*name) : std::nullopt;
-  if (!fileURL) {
-    log().error("Error getting temp file.");
-    return std::nullopt;
-  }
+  auto fileURL = uploadFileForSessionAt(sessionURL, UploadFormat::json);
+  if (!fileURL) return std::nullopt;
   auto request = requestFor(type);
   if (!request) return std::nullopt;
   auto compressed = compressInto(*fileURL, [&](CompressedOutputStream& stream) {

@@ -96,6 +96,9 @@ class UploadManager final : public UploadManagerProtocol {
     std::string digest;
   };
   std::optional<std::string> endpointFor(const std::string& type) const;
+  // The upload file of the session file at `sessionURL` in `format`; logs
+  // when there is none.
+  std::optional<fs::path> uploadFileForSessionAt(const fs::path& sessionURL, UploadFormat format) const;
   // The request for `type`, or no value after logging why not.
   std::optional<HttpRequest> requestFor(const std::string& type);
   std::optional<Compressed> compressInto(const fs::path& finalPath,

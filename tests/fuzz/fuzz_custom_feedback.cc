@@ -24,6 +24,7 @@ class NoNetwork final : public fbf::HttpClientSession {
  public:
   void uploadFile(fbf::HttpRequest, std::filesystem::path, fbf::HttpCompletion) override {}
   void finishTasksAndInvalidate() override {}
+  void cancelAllTasks() override {}
 };
 
 struct Fixture {
