@@ -340,7 +340,7 @@ std::optional<std::string> inflateRaw(const std::string& compressed) {
     if (produced == scratchSize) {
       size_t size = std::max<size_t>({scratchSize * 2, compressed.size() * 4, 256 * 1024});
       auto grown = std::make_unique_for_overwrite<char[]>(size);
-      std::memcpy(grown.get(), scratch.get(), produced);
+      if (produced > 0) std::memcpy(grown.get(), scratch.get(), produced);
       scratch = std::move(grown);
       scratchSize = size;
     }
