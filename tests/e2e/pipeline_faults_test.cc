@@ -173,6 +173,11 @@ TEST_F(PipelineFaults, SigtermDuringAStalledUploadExitsPromptlyAndKeepsTheFiles)
 }
 
 TEST_F(PipelineFaults, AcceptLoopBacksOffWhenDescriptorsRunOutAndServesAgainAfter) {
+#if defined(__SANITIZE_ADDRESS__)
+  // The sanitizers' own runtime needs descriptors to check and report (it
+  // reads /proc/self/maps), so with none left it reports errors of its own.
+  GTEST_SKIP() << "descriptor exhaustion is checked in the release build";
+#endif
   startReceiver();
   home.configure(receiver->url());
   home.startDaemon(DaemonHome::descriptorLimit(40));
@@ -202,7 +207,7 @@ TEST_F(PipelineFaults, AcceptLoopBacksOffWhenDescriptorsRunOutAndServesAgainAfte
   EXPECT_LT(cpuTicks() - before, sysconf(_SC_CLK_TCK) / 2) << "the accept loop spins";
   for (int fd : clients) ::close(fd);
   auto r = home.fbfctl({"status"}, 20s);
-  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_EQ(r.status, 0) << r.err << tail(home.daemonLog());
   const std::string log = home.daemonLog();
   const auto first = log.find("Cannot accept connections");
   EXPECT_EQ(log.find("Cannot accept connections", first + 1), std::string::npos) << "logged more than once";
