@@ -20,6 +20,7 @@
 //
 // Nothing is asserted; the figures are printed.
 #include "upload/compressed_output_stream.h"
+#include "support/bench_support.h"
 
 #include "corevireon.pb.h"
 #include "platform/property_list.h"
@@ -53,6 +54,8 @@
 extern char** environ;
 
 namespace {
+
+using fbf::bench::NullStream;
 
 namespace fs = std::filesystem;
 using namespace std::chrono_literals;
@@ -174,19 +177,6 @@ bool socketAccepts(const fs::path& socketPath) {
 // The encoding procedure alone, for one payload: serialise the session, and
 // write it in one piece through the compressing, digesting stream (raw
 // DEFLATE level 5, 4096-byte staging buffer, SHA-512 fed once per pass).
-class NullStream final : public fbf::OutputStream {
- public:
-  void open() override {}
-  long write(const uint8_t*, size_t n) override {
-    bytes += n;
-    return static_cast<long>(n);
-  }
-  void close() override {}
-  fbf::StreamStatus streamStatus() const override { return fbf::StreamStatus::open; }
-  std::optional<std::error_code> streamError() const override { return std::nullopt; }
-  size_t bytes = 0;
-};
-
 size_t encode(const corevireon::CVClientSession& session) {
   std::string bytes = session.SerializeAsString();
   auto sink = std::make_shared<NullStream>();

@@ -7,6 +7,7 @@
 //
 // Run on demand; nothing here is asserted.
 #include "platform/curl_http_session.h"
+#include "support/bench_support.h"
 #include "platform/task_queue.h"
 #include "upload/compressed_output_stream.h"
 
@@ -36,33 +37,8 @@ using Clock = std::chrono::steady_clock;
 
 namespace {
 
-// Session-like text: repeated structure with varying identifiers and some
-// noise, compressing roughly as uploaded sessions do.
-std::string sampleData(size_t n) {
-  std::mt19937 rng(42);
-  std::string out;
-  out.reserve(n + 256);
-  while (out.size() < n) {
-    out += "{\"queryId\":" + std::to_string(rng() % 100000) + ",\"type\":" + std::to_string(rng() % 40) +
-           ",\"identifier\":\"" + std::to_string(rng()) + "-" + std::to_string(rng()) +
-           "\",\"rank\":" + std::to_string(rng() % 10) + ",\"section\":\"web\"},";
-  }
-  out.resize(n);
-  return out;
-}
-
-class NullStream final : public fbf::OutputStream {
- public:
-  void open() override {}
-  long write(const uint8_t*, size_t n) override {
-    bytes += n;
-    return static_cast<long>(n);
-  }
-  void close() override {}
-  fbf::StreamStatus streamStatus() const override { return fbf::StreamStatus::open; }
-  std::optional<std::error_code> streamError() const override { return std::nullopt; }
-  size_t bytes = 0;
-};
+using fbf::bench::NullStream;
+using fbf::bench::sampleData;
 
 double seconds(Clock::duration d) { return std::chrono::duration<double>(d).count(); }
 

@@ -275,6 +275,9 @@ std::optional<HttpRequest> UploadManager::requestFor(const std::string& type) {
 }
 
 bool UploadManager::canFormRequest(const std::string& type) {
+  // The bag is fixed for the manager's life, so the answer is too: one check
+  // per type, not one per file.
+  if (auto known = usableTypes_.find(type); known != usableTypes_.end()) return known->second;
   auto endpoint = endpointFor(type);
   bool usable = false;
   if (endpoint) {
@@ -284,9 +287,8 @@ bool UploadManager::canFormRequest(const std::string& type) {
     } catch (const VireonURLRequestBuilder::URLError&) {
     }
   }
-  if (!usable && unusableTypesLogged_.insert(type).second) {
-    log().error("No usable upload endpoint for {} in the bag; its files stay for a later flush.", type);
-  }
+  if (!usable) log().error("No usable upload endpoint for {} in the bag; its files stay for a later flush.", type);
+  usableTypes_.emplace(type, usable);
   return usable;
 }
 

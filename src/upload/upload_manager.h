@@ -29,7 +29,7 @@
 #include <functional>
 #include <memory>
 #include <optional>
-#include <set>
+#include <map>
 #include <string>
 #include <vector>
 
@@ -112,7 +112,7 @@ class UploadManager final : public UploadManagerProtocol {
   std::optional<ConfigurationBag> bag_;
   FeedbackAgeLimit ageLimit_;
   FileManager& fileManager_;
-  std::set<std::string> unusableTypesLogged_;
+  std::map<std::string, bool> usableTypes_;  // canFormRequest, by type
   std::shared_ptr<Core> core_;
 };
 

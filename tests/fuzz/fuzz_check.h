@@ -5,6 +5,8 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <system_error>
+#include <vector>
 
 namespace fs = std::filesystem;
 
@@ -17,3 +19,22 @@ namespace fs = std::filesystem;
       std::abort();                                                                \
     }                                                                              \
   } while (0)
+
+namespace fbf::fuzz {
+
+// libFuzzer never tears a harness's fixture down: its throw-away home is
+// removed when the process exits instead.
+inline void removeAtExit(const std::filesystem::path& dir) {
+  static std::vector<std::filesystem::path> dirs;
+  if (dirs.empty()) {
+    std::atexit([] {
+      for (const auto& d : dirs) {
+        std::error_code ec;
+        std::filesystem::remove_all(d, ec);
+      }
+    });
+  }
+  dirs.push_back(dir);
+}
+
+}  // namespace fbf::fuzz

@@ -68,11 +68,7 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
   // durability is not what is tested here.
   if (::access("/dev/shm", W_OK) == 0) ::setenv("TMPDIR", "/dev/shm", 1);
   fixture();
-  // The fixture is never destroyed (inputs run until exit); its home is.
-  std::atexit([] {
-    std::error_code ec;
-    fs::remove_all(fixture().env.temp.path(), ec);
-  });
+  fbf::fuzz::removeAtExit(fixture().env.temp.path());
   return 0;
 }
 

@@ -123,11 +123,7 @@ bool readAll(int fd, std::string& out) {
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   fbf::logging::setLevel(spdlog::level::off);
   fixture();
-  // The fixture is never destroyed (inputs run until exit); its home is.
-  std::atexit([] {
-    std::error_code ec;
-    fs::remove_all(fixture().env.temp.path(), ec);
-  });
+  fbf::fuzz::removeAtExit(fixture().env.temp.path());
   return 0;
 }
 
