@@ -9,7 +9,7 @@ FUZZ_SECONDS ?= 60
 # Seconds per harness of the smoke run that `make test` includes.
 FUZZ_SMOKE_SECONDS ?= 5
 
-.PHONY: all deps build test test-release test-asan test-fuzz-smoke test-unit demo bench fuzz fuzz-build clean format
+.PHONY: all deps build test test-release test-asan test-fuzz-smoke test-unit demo bench fuzz fuzz-build mutate clean format
 
 all: build
 
@@ -52,6 +52,13 @@ test-fuzz-smoke: fuzz-build
 # The service unit: verified, and its exposure score within bounds.
 test-unit: deps
 	./scripts/check-unit.sh $(BUILD)/bin/vireon-fbf
+
+# Plants MUTANTS small faults in src/ (from SEED) and counts how many the
+# release tests catch; see scripts/mutate.py.
+MUTANTS ?= 40
+SEED    ?= 16
+mutate: build
+	./scripts/mutate.py --build $(BUILD) --seed $(SEED) --mutants $(MUTANTS)
 
 demo: build
 	./scripts/demo.sh $(BUILD)
