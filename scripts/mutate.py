@@ -6,17 +6,19 @@
 Each mutant is one small semantic change in one line of a .cc file under
 src/: a flipped comparison or equality, a swapped boolean or logical
 operator, an integer constant off by one, or a deleted call statement.
-Sites are found outside comments and string literals, shuffled with a
-fixed seed, and tried in that order; a mutant that does not compile is
-skipped and does not count, so the same seed over the same src/ always
-evaluates the same mutants. After each mutant the tree is rebuilt
+Sites are found outside comments and string literals and tried in an
+order drawn from a fixed seed and each site's own text (file, line text,
+operator, position in the line), not its line number: the same seed
+evaluates the same mutants, and an edit elsewhere in src/ does not
+reshuffle them. A mutant that does not compile is skipped and does not
+count. After each mutant the tree is rebuilt
 incrementally and the tests run (quick groups first; a failure anywhere,
 or a run past the time limit, kills the mutant). The file is restored
 whatever happens. The report goes to stdout and BUILD/mutation.txt.
 """
 import argparse
+import hashlib
 import os
-import random
 import re
 import subprocess
 import sys
@@ -90,10 +92,23 @@ def sites_in(path):
         for name, pattern, replace in OPERATORS:
             for m in pattern.finditer(code):
                 mutated = line[: m.start()] + replace(m) + line[m.end():]
-                found.append((path, number, name, line, mutated))
+                found.append((path, number, name, line, mutated, m.start()))
         if CALL_STATEMENT.match(code) and not NOT_A_CALL.match(code) and code.count("(") == code.count(")"):
-            found.append((path, number, "delete call", line, re.match(r"^\s*", line).group(0) + ";"))
+            found.append((path, number, "delete call", line, re.match(r"^\s*", line).group(0) + ";", 0))
     return found
+
+
+def order(sites, seed):
+    """Sites in the order of a hash of the seed and each site's own text;
+    repeats of one line in a file are told apart by their count."""
+    seen = {}
+    keyed = []
+    for site in sites:
+        path, _, name, line, _, column = site
+        text = f"{seed}|{os.path.relpath(path, ROOT)}|{line.strip()}|{name}|{column}"
+        seen[text] = seen.get(text, 0) + 1
+        keyed.append((hashlib.sha256(f"{text}|{seen[text]}".encode()).hexdigest(), site))
+    return [site for _, site in sorted(keyed, key=lambda k: k[0])]
 
 
 def all_sites():
@@ -149,8 +164,7 @@ def main():
         report.write(line + "\n")
         report.flush()
 
-    sites = all_sites()
-    random.Random(args.seed).shuffle(sites)
+    sites = order(all_sites(), args.seed)
     say(f"{len(sites)} sites in src/, seed {args.seed}, {args.mutants} mutants")
 
     if not build(args):
@@ -164,7 +178,7 @@ def main():
 
     killed = evaluated = skipped = 0
     survivors = []
-    for path, number, name, original_line, mutated_line in sites:
+    for path, number, name, original_line, mutated_line, _ in sites:
         if evaluated == args.mutants:
             break
         original = open(path, encoding="utf-8").read()

@@ -271,9 +271,14 @@ bool CohortFeedbackGenerator::propensity(SystemTime from, SystemTime to, std::st
     if (!field || field->cpp_type() != google::protobuf::FieldDescriptor::CPPTYPE_STRING) continue;
     reflection->SetString(&message, field, formatShare(static_cast<float>(sum) / total));
   }
-  uint64_t bucketed = bucketEngagementCount(static_cast<uint64_t>(total), kEngagementBucketSize);
-  if (bucketed > static_cast<uint64_t>(std::numeric_limits<int32_t>::max())) {
-    FBF_FATAL("total engagements do not fit a 32-bit integer");
+  // Only a damaged store holds counts this large: skip the report rather than
+  // convert out of range or stop the daemon over it.
+  constexpr auto kMaximum = static_cast<uint64_t>(std::numeric_limits<int32_t>::max());
+  const uint64_t bucketed = total < 4.0e9f ? bucketEngagementCount(static_cast<uint64_t>(total), kEngagementBucketSize)
+                                           : kMaximum + 1;
+  if (bucketed > kMaximum) {
+    generatorLog().error("Total engagements of {} do not fit a 32-bit integer; no usage propensity", entityName);
+    return false;
   }
   if (const auto* field = descriptor->FindFieldByName("totalEngagements")) {
     reflection->SetInt32(&message, field, static_cast<int32_t>(bucketed));

@@ -107,8 +107,8 @@ void ManagedObject::setRelated(size_t relationship, const std::shared_ptr<Manage
 }
 
 std::optional<SystemTime> ManagedObject::dateAttribute(size_t attribute) const {
-  if (const auto* d = std::get_if<double>(&values_.at(attribute))) return timeFromSeconds(*d);
-  if (const auto* i = std::get_if<int64_t>(&values_.at(attribute))) return timeFromSeconds(static_cast<double>(*i));
+  if (const auto* d = std::get_if<double>(&values_.at(attribute))) return timeFromStoredSeconds(*d);
+  if (const auto* i = std::get_if<int64_t>(&values_.at(attribute))) return timeFromStoredSeconds(static_cast<double>(*i));
   return std::nullopt;
 }
 
@@ -116,7 +116,10 @@ void ManagedObject::setDateAttribute(size_t attribute, SystemTime date) { setVal
 
 int64_t ManagedObject::integerAttribute(size_t attribute) const {
   if (const auto* i = std::get_if<int64_t>(&values_.at(attribute))) return *i;
-  if (const auto* d = std::get_if<double>(&values_.at(attribute))) return static_cast<int64_t>(*d);
+  // A damaged store can hold any real; converting one beyond int64 is undefined.
+  if (const auto* d = std::get_if<double>(&values_.at(attribute))) {
+    return *d > -9.2e18 && *d < 9.2e18 ? static_cast<int64_t>(*d) : 0;
+  }
   return 0;
 }
 

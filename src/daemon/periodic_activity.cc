@@ -188,12 +188,13 @@ std::optional<SystemTime> PeriodicActivityScheduler::lastRun() const {
   if (!assembly_.fileManager().exists(lastRunFile_)) return std::nullopt;
   auto text = assembly_.fileManager().readFile(lastRunFile_, ec);
   if (!text) return std::nullopt;
+  std::optional<SystemTime> when;
   try {
-    return timeFromSeconds(std::stod(*text));
+    when = timeFromStoredSeconds(std::stod(*text));
   } catch (const std::exception&) {
-    log().error("Ignoring unreadable last-run file {}", lastRunFile_.string());
-    return std::nullopt;
   }
+  if (!when) log().error("Ignoring unreadable last-run file {}", lastRunFile_.string());
+  return when;
 }
 
 void PeriodicActivityScheduler::recordRun(SystemTime when) {

@@ -6,6 +6,7 @@
 #pragma once
 
 #include <chrono>
+#include <optional>
 
 namespace fbf {
 
@@ -17,6 +18,14 @@ inline double secondsSinceEpoch(SystemTime t) {
 }
 inline SystemTime timeFromSeconds(double s) {
   return SystemTime(std::chrono::duration_cast<SystemTime::duration>(std::chrono::duration<double>(s)));
+}
+// A date read back from a file or store that others can write: nothing for a
+// value that is not a number or lies beyond what a SystemTime holds (about
+// 292 years either side of 1970), whose conversion would be undefined.
+inline std::optional<SystemTime> timeFromStoredSeconds(double s) {
+  constexpr double kLimit = 9.0e9;
+  if (!(s > -kLimit && s < kLimit)) return std::nullopt;
+  return timeFromSeconds(s);
 }
 
 class Clock {

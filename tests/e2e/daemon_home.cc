@@ -92,11 +92,10 @@ std::vector<std::string> DaemonHome::descriptorLimit(int limit) {
 
 void DaemonHome::startDaemon(const std::vector<std::string>& wrapper) {
   fs::path program = binDir() / "vireon-fbf";
-  // A killed daemon leaves its socket behind, and the log grows across runs:
-  // readiness is this run's socket and this run's "setup" line.
+  // A killed daemon leaves its socket behind: readiness is this run's socket
+  // (and the "setup" line of this run's log, which starts empty).
   std::error_code ec;
   fs::remove(dirs_.socketPath(), ec);
-  const size_t logStart = daemonLog().size();
   std::vector<std::string> args;
   if (!wrapper.empty()) {
     args.assign(wrapper.begin() + 1, wrapper.end());
@@ -105,7 +104,7 @@ void DaemonHome::startDaemon(const std::vector<std::string>& wrapper) {
   }
   daemon_ = std::make_unique<ChildProcess>(program, args, env_, root() / "daemon.out", root() / "daemon.log");
   auto socket = dirs_.socketPath();
-  waitUntil([&] { return fs::exists(socket) && daemonLog().find("setup", logStart) != std::string::npos; }, 10s);
+  waitUntil([&] { return fs::exists(socket) && daemonLog().find("setup") != std::string::npos; }, 10s);
 }
 
 std::optional<int> DaemonHome::stopDaemon() {
@@ -160,6 +159,47 @@ std::vector<std::string> DaemonHome::customFiles() const {
     if (e.is_regular_file()) out.push_back(e.path().lexically_relative(customDir()).string());
   }
   return out;
+}
+
+std::map<int, int> lossesByReason(const std::vector<nlohmann::json>& events) {
+  std::map<int, int> out;
+  for (const auto& e : events) {
+    if (e.at("reason").get<int>() != kUploaded) ++out[e.at("reason").get<int>()];
+  }
+  return out;
+}
+
+int lossCount(const std::vector<nlohmann::json>& events) {
+  int n = 0;
+  for (const auto& [reason, count] : lossesByReason(events)) n += count;
+  return n;
+}
+
+size_t delivered(const std::vector<nlohmann::json>& records) {
+  size_t n = 0;
+  for (const auto& r : records) n += r.value("status", 0) == 200;
+  return n;
+}
+
+std::string tail(const std::string& text, size_t n) { return text.size() > n ? text.substr(text.size() - n) : text; }
+
+void ReceiverTest::SetUp() {
+  ASSERT_TRUE(LoopbackCertificate::get().made) << "openssl could not make a certificate";
+  receiver = std::make_unique<Receiver>(home.root());
+  ASSERT_TRUE(receiver->running());
+  home.configure(receiver->url());
+}
+
+void ReceiverTest::restartReceiver(std::vector<std::string> faults) {
+  const int port = receiver->port();
+  receiver->stop();
+  receiver = std::make_unique<Receiver>(home.root(), port, std::move(faults));
+  ASSERT_TRUE(receiver->running());
+}
+
+void ReceiverTest::flush(std::chrono::seconds timeout) {
+  auto r = home.fbfctl({"flush"}, timeout);
+  ASSERT_EQ(r.status, 0) << r.err << tail(home.daemonLog());
 }
 
 }  // namespace fbf::testing

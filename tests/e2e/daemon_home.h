@@ -5,6 +5,7 @@
 #include "support/process.h"
 #include "support/test_support.h"
 
+#include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
 #include <memory>
@@ -86,6 +87,29 @@ class DaemonHome {
   XdgDirectories dirs_;
   std::map<std::string, std::string> env_;
   std::unique_ptr<ChildProcess> daemon_;
+};
+
+// Deletion reasons the cases look for; 12 is a delivered file, not a loss.
+enum DeletionReason { kTooOld = 1, kTooLarge = 2, kEmpty = 3, kPruned = 4, kUploaded = 12 };
+// Deletion events of files dropped without being delivered, by reason.
+std::map<int, int> lossesByReason(const std::vector<nlohmann::json>& events);
+int lossCount(const std::vector<nlohmann::json>& events);
+// Receiver records of requests answered with 200.
+size_t delivered(const std::vector<nlohmann::json>& records);
+std::string tail(const std::string& text, size_t n = 4000);
+
+// A home configured for a running receiver; each case writes its files and
+// starts the daemon.
+class ReceiverTest : public ::testing::Test {
+ protected:
+  void SetUp() override;
+  // Replaces the receiver by one on the same port with `faults`.
+  void restartReceiver(std::vector<std::string> faults = {});
+  // `fbfctl flush`, which must succeed.
+  void flush(std::chrono::seconds timeout = std::chrono::seconds(120));
+
+  DaemonHome home;
+  std::unique_ptr<Receiver> receiver;
 };
 
 }  // namespace fbf::testing

@@ -3,11 +3,7 @@
 #include "e2e/daemon_home.h"
 #include "upload/upload_manager.h"
 
-#include <gtest/gtest.h>
-#include <signal.h>
-
 #include <fstream>
-#include <map>
 #include <set>
 
 namespace fbf::testing {
@@ -15,25 +11,12 @@ namespace {
 
 using namespace std::chrono_literals;
 
-constexpr int kTooOld = 1, kTooLarge = 2, kEmpty = 3, kPruned = 4;
-// Reported for every file the receiver accepted; not a loss.
-constexpr int kUploaded = 12;
 constexpr uint64_t kSessionSizeLimit = 2'097'152;
 
-std::string uuid(unsigned n) {
-  char buf[40];
-  std::snprintf(buf, sizeof buf, "%08X-1111-4222-8333-444455556666", n);
+std::string session(unsigned n, const std::string& state) {
+  char buf[80];
+  std::snprintf(buf, sizeof buf, "session.4242.%08X-1111-4222-8333-444455556666.%s", n, state.c_str());
   return buf;
-}
-std::string session(unsigned n, const std::string& state) { return "session.4242." + uuid(n) + "." + state; }
-
-// Deletion events of files dropped without being delivered, by reason.
-std::map<int, int> losses(const std::vector<nlohmann::json>& events) {
-  std::map<int, int> out;
-  for (const auto& e : events) {
-    if (e.at("reason").get<int>() != kUploaded) ++out[e.at("reason").get<int>()];
-  }
-  return out;
 }
 
 std::multiset<std::string> typesOf(const std::vector<nlohmann::json>& records) {
@@ -48,92 +31,48 @@ size_t countEndingWith(const std::vector<std::string>& names, std::string_view s
   return n;
 }
 
-std::string summary(const std::vector<nlohmann::json>& records) {
-  std::string out;
-  for (const auto& r : records) {
-    out += r.value("type", "?") + " " + r["status"].dump() + " " + r.value("digest_kind", "?") + " " +
-           r["query"].dump() + "\n";
-  }
-  return out;
-}
-
-std::string tail(const std::string& text, size_t n = 6000) {
-  return text.size() > n ? text.substr(text.size() - n) : text;
-}
-
 // A retried upload carries no digest (it was computed while compressing, in
 // the earlier run), so the receiver checks that the body inflates and decodes.
-bool deliveredIntact(const nlohmann::json& r) {
-  return r.value("status", 0) == 200 && r["inflated_size"].is_number() && !r.contains("decode_error");
+size_t deliveredIntact(const std::vector<nlohmann::json>& records) {
+  size_t n = 0;
+  for (const auto& r : records) {
+    n += r.value("status", 0) == 200 && r["inflated_size"].is_number() && !r.contains("decode_error");
+  }
+  return n;
 }
 
-// A home with a receiver; the daemon is started by each case once its
-// files are in place.
-class FlushEndToEnd : public ::testing::Test {
- protected:
-  void SetUp() override {
-    ASSERT_TRUE(LoopbackCertificate::get().made) << "openssl could not make a certificate";
-    receiver = std::make_unique<Receiver>(home.root());
-    ASSERT_TRUE(receiver->running());
-    home.configure(receiver->url());
-  }
-
-  // The expected fate of every custom file, by its size against the limits.
-  struct CustomCensus {
-    std::multiset<std::string> validTypes;
-    int empty = 0, tooLarge = 0;
-  };
-  CustomCensus census(const std::map<std::string, uint64_t>& limits) {
-    CustomCensus c;
-    for (const auto& rel : home.customFiles()) {
-      std::string type = fs::path(rel).begin()->string();
-      auto size = fs::file_size(home.customDir() / rel);
-      auto it = limits.find(type);
-      uint64_t limit = it == limits.end() ? kSessionSizeLimit : it->second;
-      if (size == 0) {
-        ++c.empty;
-      } else if (size > limit) {
-        ++c.tooLarge;
-      } else {
-        c.validTypes.insert(type);
-      }
-    }
-    return c;
-  }
-
-  std::string flushOrFail() {
-    auto r = home.fbfctl({"flush"});
-    EXPECT_EQ(r.status, 0) << r.err << home.daemonLog();
-    return r.err;
-  }
-
-  DaemonHome home;
-  std::unique_ptr<Receiver> receiver;
-};
-
-using HealthyReceiver = FlushEndToEnd;
+// Guards against: a valid file not uploaded, a dropped file not reported (or
+// reported under the wrong reason), a wrong query or digest on the request.
+using HealthyReceiver = ReceiverTest;
 
 TEST_F(HealthyReceiver, FlushSendsEverythingValidAndDropsTheRestWithDeletionEvents) {
-  const std::map<std::string, uint64_t> limits = {{"Pelorus", 200}};
   home.writeBag(receiver->url(), {{"max_custom_feedback_sizes", {{"Pelorus", 200}}}});
-  ASSERT_EQ(home.generate(12, 14, 3).status, 0);
+  ASSERT_EQ(home.generate(8, 10, 3).status, 0);
   writeFile(home.customDir() / "Quenbury" / "empty", "");
   writeFile(home.customDir() / "Pelorus" / "too-large", std::string(201, 'x'));
   writeFile(home.cacheDir() / session(1, "closed"), std::string(kSessionSizeLimit + 1, '\x0a'));
-  auto custom = census(limits);
-  ASSERT_GE(custom.empty, 1);
-  ASSERT_GE(custom.tooLarge, 1);
-  ASSERT_FALSE(custom.validTypes.empty());
+  // The expected fate of every custom file, by its size against the limits.
+  std::multiset<std::string> expected;
+  for (int i = 0; i < 8; ++i) expected.insert("FeedbackV2PB");
+  int empty = 0, tooLarge = 1;  // the oversized session
+  for (const auto& rel : home.customFiles()) {
+    const std::string type = fs::path(rel).begin()->string();
+    const auto size = fs::file_size(home.customDir() / rel);
+    if (size == 0) {
+      ++empty;
+    } else if (size > (type == "Pelorus" ? 200 : kSessionSizeLimit)) {
+      ++tooLarge;
+    } else {
+      expected.insert(type);
+    }
+  }
 
   home.startDaemon();
-  flushOrFail();
+  flush();
 
-  auto records = receiver->records();
-  std::multiset<std::string> expected = custom.validTypes;
-  for (int i = 0; i < 12; ++i) expected.insert("FeedbackV2PB");
+  const auto records = receiver->records();
   EXPECT_EQ(typesOf(records), expected);
-  // Custom files may carry any bytes (the generator also writes JSON under
-  // protobuf type names), but every session must arrive as a session.
+  // Custom files may carry any bytes, but every session must arrive as one.
   int sessionsDecoded = 0;
   for (const auto& r : records) {
     const auto& q = r.at("query");
@@ -142,16 +81,12 @@ TEST_F(HealthyReceiver, FlushSendsEverythingValidAndDropsTheRestWithDeletionEven
     EXPECT_EQ(q.value("realtime", ""), "1") << "a client asked for this flush: " << r.dump();
     sessionsDecoded += q.value("type", "") == "FeedbackV2PB" && r["decoded"].is_object();
     EXPECT_TRUE(r.value("digest_ok", false)) << r.dump();
-    EXPECT_EQ(r.value("status", 0), 200) << r.dump();
   }
-  EXPECT_EQ(sessionsDecoded, 12);
+  EXPECT_EQ(delivered(records), records.size());
+  EXPECT_EQ(sessionsDecoded, 8);
   EXPECT_TRUE(home.sessionFiles().empty()) << ::testing::PrintToString(home.sessionFiles());
   EXPECT_TRUE(home.customFiles().empty()) << ::testing::PrintToString(home.customFiles());
-
-  auto lost = losses(home.deletionEvents());
-  EXPECT_EQ(lost[kEmpty], custom.empty);
-  EXPECT_EQ(lost[kTooLarge], custom.tooLarge + 1) << "the oversized session is reported too";
-  EXPECT_EQ(lost.size(), 2u) << nlohmann::json(home.deletionEvents()).dump();
+  EXPECT_EQ(lossesByReason(home.deletionEvents()), (std::map<int, int>{{kTooLarge, tooLarge}, {kEmpty, empty}}));
 }
 
 TEST_F(HealthyReceiver, SessionsOlderThanTheBagsAgeLimitAreDroppedAsTooOld) {
@@ -159,10 +94,20 @@ TEST_F(HealthyReceiver, SessionsOlderThanTheBagsAgeLimitAreDroppedAsTooOld) {
   home.writeBag(receiver->url(), {{"feedback_max_age_in_days", 0}});
   ASSERT_EQ(home.generate(4, 0, 5).status, 0);
   home.startDaemon();
-  flushOrFail();
+  flush();
   EXPECT_TRUE(receiver->records().empty());
   EXPECT_TRUE(home.sessionFiles().empty());
-  EXPECT_EQ(losses(home.deletionEvents()), (std::map<int, int>{{kTooOld, 4}}));
+  EXPECT_EQ(lossesByReason(home.deletionEvents()), (std::map<int, int>{{kTooOld, 4}}));
+}
+
+TEST_F(HealthyReceiver, LeftoverSessionFilesArePrunedToFifty) {
+  // Files still being processed by someone are never uploaded, so they pile up.
+  for (unsigned i = 0; i < 120; ++i) writeFile(home.cacheDir() / session(100 + i, "processing"), "p");
+  home.startDaemon();
+  flush();
+  EXPECT_EQ(home.sessionFiles().size(), 50u);
+  EXPECT_EQ(lossesByReason(home.deletionEvents()), (std::map<int, int>{{kPruned, 70}}));
+  EXPECT_TRUE(receiver->records().empty());
 }
 
 TEST_F(HealthyReceiver, TeeUploadsReceivesEachPayload) {
@@ -172,7 +117,7 @@ TEST_F(HealthyReceiver, TeeUploadsReceivesEachPayload) {
   auto tee = home.startFbfctl({"tee", "uploads", "--count", "5"}, teeOut);
   ASSERT_TRUE(waitUntil([&] { return readFile(fs::path(teeOut.string() + ".err")).find("listening") != std::string::npos; },
                         10s));
-  flushOrFail();
+  flush();
   auto status = tee->waitFor(20s);
   ASSERT_TRUE(status) << "tee did not end after five payloads";
   EXPECT_EQ(*status, 0);
@@ -200,45 +145,26 @@ TEST_F(HealthyReceiver, FlushSessionIsRefusedOutsideTheCacheDirectory) {
   EXPECT_TRUE(receiver->records().empty());
 }
 
-TEST_F(HealthyReceiver, LeftoverSessionFilesArePrunedToFifty) {
-  // Files still being processed by someone are never uploaded, so they pile up.
-  for (unsigned i = 0; i < 120; ++i) writeFile(home.cacheDir() / session(100 + i, "processing"), "p");
-  home.startDaemon();
-  flushOrFail();
-  EXPECT_EQ(home.sessionFiles().size(), 50u);
-  EXPECT_EQ(losses(home.deletionEvents()), (std::map<int, int>{{kPruned, 70}}));
-  EXPECT_TRUE(receiver->records().empty());
-}
-
-// ---- a receiver that fails, then recovers
-
-using FailingReceiver = FlushEndToEnd;
+// Guards against: files lost or reported dropped when the receiver fails or
+// is unreachable, and upload files that a later flush does not retry.
+using FailingReceiver = ReceiverTest;
 
 TEST_F(FailingReceiver, ServerErrorKeepsTheFilesAndALaterFlushRetriesThem) {
-  const int port = receiver->port();
-  receiver->stop();
-  receiver = std::make_unique<Receiver>(home.root(), port, std::vector<std::string>{"--status", "500"});
-  ASSERT_TRUE(receiver->running());
+  restartReceiver({"--status", "500"});
   ASSERT_EQ(home.generate(5, 3, 11).status, 0);
   home.startDaemon();
-  flushOrFail();
-
+  flush();
   EXPECT_EQ(receiver->records().size(), 8u);
   EXPECT_EQ(countEndingWith(home.sessionFiles(), ".uploadPending"), 5u) << ::testing::PrintToString(home.sessionFiles());
   EXPECT_EQ(countEndingWith(home.customFiles(), ".uploadPending"), 3u) << ::testing::PrintToString(home.customFiles());
-  EXPECT_TRUE(losses(home.deletionEvents()).empty()) << nlohmann::json(home.deletionEvents()).dump();
+  EXPECT_EQ(lossCount(home.deletionEvents()), 0);
 
-  receiver->stop();
-  receiver = std::make_unique<Receiver>(home.root(), port);
-  ASSERT_TRUE(receiver->running());
-  flushOrFail();
-
-  size_t ok = 0;
-  for (const auto& r : receiver->records()) ok += deliveredIntact(r);
-  EXPECT_EQ(ok, 8u) << summary(receiver->records());
+  restartReceiver();
+  flush();
+  EXPECT_EQ(deliveredIntact(receiver->records()), 8u);
   EXPECT_TRUE(home.sessionFiles().empty()) << ::testing::PrintToString(home.sessionFiles());
   EXPECT_TRUE(home.customFiles().empty()) << ::testing::PrintToString(home.customFiles());
-  EXPECT_TRUE(losses(home.deletionEvents()).empty()) << nlohmann::json(home.deletionEvents()).dump();
+  EXPECT_EQ(lossCount(home.deletionEvents()), 0);
 }
 
 TEST_F(FailingReceiver, ReceiverDownCancelsTheFlushAndLosesNothing) {
@@ -246,60 +172,21 @@ TEST_F(FailingReceiver, ReceiverDownCancelsTheFlushAndLosesNothing) {
   receiver->stop();
   ASSERT_EQ(home.generate(6, 3, 13).status, 0);
   home.startDaemon();
-  flushOrFail();
-
+  flush();
   EXPECT_NE(home.daemonLog().find("Device appears to be offline. Flush cancelled."), std::string::npos);
   EXPECT_EQ(home.sessionFiles().size(), 6u) << ::testing::PrintToString(home.sessionFiles());
   EXPECT_EQ(home.customFiles().size(), 3u) << ::testing::PrintToString(home.customFiles());
-  EXPECT_TRUE(losses(home.deletionEvents()).empty()) << nlohmann::json(home.deletionEvents()).dump();
+  EXPECT_EQ(lossCount(home.deletionEvents()), 0);
 
-  // The cancellation ended that flush only: the next one delivers all.
+  // The cancellation ended that flush only: the next one delivers all, once.
   receiver = std::make_unique<Receiver>(home.root(), port);
   ASSERT_TRUE(receiver->running());
-  flushOrFail();
-  std::multiset<std::string> sessionsSent;
-  for (const auto& r : receiver->records()) {
-    EXPECT_TRUE(deliveredIntact(r)) << summary({r});
-    if (r.value("type", "") == "FeedbackV2PB") sessionsSent.insert(r.dump());
-  }
-  EXPECT_EQ(receiver->records().size(), 9u);
-  EXPECT_EQ(sessionsSent.size(), 6u);
+  flush();
+  const auto records = receiver->records();
+  EXPECT_EQ(deliveredIntact(records), 9u);
+  EXPECT_EQ(records.size(), 9u);
   EXPECT_TRUE(home.sessionFiles().empty());
   EXPECT_TRUE(home.customFiles().empty());
-}
-
-// ---- termination in the middle of a long flush
-
-using TerminatedFlush = FlushEndToEnd;
-
-TEST_F(TerminatedFlush, SigtermStopsBetweenFilesAndLosesNothing) {
-  // Fewer than the pruning bound, so whatever the stop leaves is kept as is.
-  constexpr int kSessions = 90;
-  // A slow receiver keeps the flush going long enough to be interrupted.
-  const int port = receiver->port();
-  receiver->stop();
-  receiver = std::make_unique<Receiver>(home.root(), port, std::vector<std::string>{"--delay-ms", "30"});
-  ASSERT_EQ(home.generate(kSessions, 0, 17, "realistic").status, 0);
-  ASSERT_EQ(home.sessionFiles().size(), static_cast<size_t>(kSessions));
-  home.startDaemon();
-
-  auto flush = home.startFbfctl({"flush"}, home.root() / "flush.out");
-  ASSERT_TRUE(waitUntil([&] { return receiver->records().size() >= 3; }, 30s)) << home.daemonLog();
-  auto status = home.stopDaemon();
-  ASSERT_TRUE(status) << "the daemon did not exit after SIGTERM";
-  EXPECT_EQ(*status, 0) << tail(home.daemonLog());
-  flush->waitFor(10s);
-
-  auto left = home.sessionFiles();
-  size_t delivered = 0;
-  for (const auto& r : receiver->records()) delivered += r.value("status", 0) == 200;
-  // A payload delivered just before the exit may also still be on disk.
-  EXPECT_GE(left.size() + delivered, static_cast<size_t>(kSessions));
-  for (const auto& name : left) {
-    EXPECT_FALSE(name.ends_with(".processing")) << "interrupted in the middle of " << name;
-  }
-  EXPECT_GT(countEndingWith(left, ".closed"), 0u) << "the walk was not stopped";
-  EXPECT_TRUE(losses(home.deletionEvents()).empty()) << nlohmann::json(home.deletionEvents()).dump();
 }
 
 }  // namespace

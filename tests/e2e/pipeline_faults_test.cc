@@ -20,156 +20,140 @@ namespace {
 
 using namespace std::chrono_literals;
 
-constexpr int kUploaded = 12;
-
 #if defined(__SANITIZE_ADDRESS__)
-constexpr int kScale = 4;  // the sanitizers make every file several times dearer
+constexpr int kScale = 3;  // the sanitizers make every file several times dearer
 #else
 constexpr int kScale = 1;
 #endif
 
-int losses(const std::vector<nlohmann::json>& events) {
-  int n = 0;
-  for (const auto& e : events) n += e.at("reason").get<int>() != kUploaded;
-  return n;
-}
-
-size_t delivered(const std::vector<nlohmann::json>& records) {
-  size_t n = 0;
-  for (const auto& r : records) n += r.value("status", 0) == 200;
-  return n;
-}
-
-std::string tail(const std::string& text, size_t n = 4000) {
-  return text.size() > n ? text.substr(text.size() - n) : text;
-}
-
-class PipelineFaults : public ::testing::Test {
+class PipelineFaults : public ReceiverTest {
  protected:
-  void SetUp() override { ASSERT_TRUE(LoopbackCertificate::get().made); }
-
-  void startReceiver(std::vector<std::string> faults = {}, int port = 0) {
-    if (receiver) receiver->stop();
-    receiver = std::make_unique<Receiver>(home.root(), port, std::move(faults));
-    ASSERT_TRUE(receiver->running());
-  }
-
   // Everything on disk was delivered: no session or custom file is left, and
   // nothing was dropped on the way.
   void expectAllDelivered(size_t expected) {
     EXPECT_TRUE(home.sessionFiles().empty()) << home.sessionFiles().size() << " left, e.g. "
                                              << home.sessionFiles().front();
     EXPECT_TRUE(home.customFiles().empty()) << home.customFiles().size() << " custom files left";
-    EXPECT_EQ(losses(home.deletionEvents()), 0) << nlohmann::json(home.deletionEvents()).dump().substr(0, 2000);
+    EXPECT_EQ(lossCount(home.deletionEvents()), 0) << nlohmann::json(home.deletionEvents()).dump().substr(0, 2000);
     EXPECT_GE(delivered(receiver->records()), expected);
   }
-
-  DaemonHome home;
-  std::unique_ptr<Receiver> receiver;
 };
 
+// More sessions than the pruning bound, all still in flight when a slow
+// flush settles: none may be pruned or reported as anything but delivered.
 TEST_F(PipelineFaults, SlowReceiverNothingInFlightIsPrunedOrMisreported) {
-  startReceiver({"--delay-ms", "20"});
-  home.configure(receiver->url());
-  ASSERT_EQ(home.generate(300, 40, 5).status, 0);
+  restartReceiver({"--delay-ms", "20"});
+  ASSERT_EQ(home.generate(90, 12, 5).status, 0);
   const size_t files = home.sessionFiles().size() + home.customFiles().size();
   home.startDaemon();
-  ASSERT_EQ(home.fbfctl({"flush"}, 300s).status, 0) << tail(home.daemonLog());
-  // Custom files the generator made empty or too large are dropped by rule;
-  // every other file arrives, and nothing is called pruned.
-  for (const auto& e : home.deletionEvents()) EXPECT_NE(e.at("reason").get<int>(), 4) << e.dump();
+  flush();
+  // Custom files the generator made empty or too large are dropped by rule.
+  EXPECT_EQ(lossesByReason(home.deletionEvents()).count(kPruned), 0u);
   EXPECT_EQ(home.daemonLog().find("Error deleting file after successful upload"), std::string::npos);
   EXPECT_TRUE(home.sessionFiles().empty());
-  size_t dropped = static_cast<size_t>(losses(home.deletionEvents()));
-  EXPECT_EQ(delivered(receiver->records()) + dropped, files);
+  EXPECT_EQ(delivered(receiver->records()) + static_cast<size_t>(lossCount(home.deletionEvents())), files);
 }
 
-TEST_F(PipelineFaults, ThousandsOfSessionsUnderALowDescriptorLimitAllArrive) {
-  const int sessions = 4000 / kScale;
-  startReceiver({"--delay-ms", "2"});
-  home.configure(receiver->url());
+TEST_F(PipelineFaults, HundredsOfSessionsUnderALowDescriptorLimitAllArrive) {
+  const int sessions = 600 / kScale;
   ASSERT_EQ(home.generate(sessions, 0, 6).status, 0);
-  home.startDaemon(DaemonHome::descriptorLimit(256));
-  auto r = home.fbfctl({"flush"}, 600s);
-  ASSERT_EQ(r.status, 0) << r.err << tail(home.daemonLog());
+  home.startDaemon(DaemonHome::descriptorLimit(80));
+  flush();
   expectAllDelivered(static_cast<size_t>(sessions));
   EXPECT_EQ(home.daemonLog().find("Too many open files"), std::string::npos) << tail(home.daemonLog());
 }
 
 TEST_F(PipelineFaults, KillNineMidFlushThenRestartDeliversEverySessionAtMostOnceMorePerKill) {
-  constexpr int kRounds = 4;
-  const int perRound = 100 / kScale;
-  startReceiver({"--delay-ms", "3"});
-  home.configure(receiver->url());
+  constexpr int kRounds = 3;
+  const int perRound = 60 / kScale;
+  restartReceiver({"--delay-ms", "3"});
   std::mt19937 random(20261123);
   for (int round = 0; round < kRounds; ++round) {
     ASSERT_EQ(home.generate(perRound, 0, 100 + round, "realistic").status, 0);
     home.startDaemon();
     auto flush = home.startFbfctl({"flush"}, home.root() / "flush.out");
-    std::this_thread::sleep_for(std::chrono::milliseconds(50 + random() % 700));
+    std::this_thread::sleep_for(std::chrono::milliseconds(30 + random() % 300));
     home.daemon()->signal(SIGKILL);
     home.daemon()->waitFor(10s);
     flush->waitFor(10s);
   }
-  // A last run with nothing killed: recovery, then a whole flush.
+  // A last run with nothing killed: recovery, then a whole flush. A session
+  // killed in the middle of twice stays as a poison file, listed by status;
+  // every other one arrives.
   home.startDaemon();
-  ASSERT_EQ(home.fbfctl({"flush"}, 300s).status, 0) << tail(home.daemonLog());
+  flush();
   const size_t sessions = static_cast<size_t>(kRounds * perRound);
-  expectAllDelivered(sessions);
+  const auto left = home.sessionFiles();
+  for (const auto& name : left) EXPECT_TRUE(name.ends_with(".processing")) << name;
+  auto status = home.fbfctl({"status", "--json"});
+  ASSERT_EQ(status.status, 0) << status.err;
+  EXPECT_EQ(nlohmann::json::parse(status.out).at("poisonFiles").size(), left.size()) << status.out;
+  EXPECT_EQ(lossCount(home.deletionEvents()), 0);
+  EXPECT_GE(delivered(receiver->records()) + left.size(), sessions);
   // A payload the receiver recorded but whose answer the kill cut off is sent
   // again: at most one per connection. The bound leaves room for a loaded
   // machine; an unbounded walk sent about five per kill.
   EXPECT_LE(delivered(receiver->records()), sessions + 3 * kRounds) << "too many duplicates per kill";
+  EXPECT_LE(left.size(), sessions / 10) << "most sessions are interrupted at most once";
 }
 
 TEST_F(PipelineFaults, SessionsWaitForAMissingEndpointAndGoOnceTheBagIsFixed) {
-  startReceiver();
-  home.configure(receiver->url());
   home.writeBag("", {{"feedback_url", "not a url"}});
   ASSERT_EQ(home.generate(5, 3, 7).status, 0);
   const auto before = home.sessionFiles();
   home.startDaemon();
-  ASSERT_EQ(home.fbfctl({"flush"}).status, 0);
+  flush();
   EXPECT_EQ(home.sessionFiles(), before) << "claimed sessions without an endpoint";
   for (const auto& name : home.customFiles()) EXPECT_FALSE(name.ends_with(".uploadPending")) << name;
   EXPECT_TRUE(receiver->records().empty());
 
   home.writeBag(receiver->url());
-  ASSERT_EQ(home.fbfctl({"flush"}).status, 0);
+  flush();
   EXPECT_TRUE(home.sessionFiles().empty()) << tail(home.daemonLog());
   EXPECT_GE(delivered(receiver->records()), before.size());
 }
 
 TEST_F(PipelineFaults, AnAbsurdAgeLimitKeepsEverythingAndTheDaemonAlive) {
-  startReceiver({"--status", "500"});
-  home.configure(receiver->url(), {{"feedback_max_age_in_days", 1'000'000'000'000'000LL}});
+  restartReceiver({"--status", "500"});
+  home.writeBag(receiver->url(), {{"feedback_max_age_in_days", 1'000'000'000'000'000LL}});
   ASSERT_EQ(home.generate(4, 0, 8).status, 0);
   home.startDaemon();
   // Twice: the second flush retries the upload files the first one left.
-  ASSERT_EQ(home.fbfctl({"flush"}).status, 0) << tail(home.daemonLog());
-  ASSERT_EQ(home.fbfctl({"flush"}).status, 0) << tail(home.daemonLog());
+  flush();
+  flush();
   EXPECT_FALSE(home.daemon()->waitFor(0ms)) << "the daemon died";
-  EXPECT_EQ(losses(home.deletionEvents()), 0);
+  EXPECT_EQ(lossCount(home.deletionEvents()), 0);
   EXPECT_EQ(home.sessionFiles().size(), 4u);
   EXPECT_NE(home.daemonLog().find("too large to count in seconds"), std::string::npos);
 }
 
-TEST_F(PipelineFaults, SigtermDuringAStalledUploadExitsPromptlyAndKeepsTheFiles) {
-  startReceiver({"--delay-ms", "120000"});
-  home.configure(receiver->url());
-  ASSERT_EQ(home.generate(3, 0, 9).status, 0);
+// SIGTERM while uploads stall and more sessions wait than the pipeline holds:
+// a prompt exit 0 between files, every session still on disk, none left
+// half-claimed, and the walk stopped short.
+TEST_F(PipelineFaults, SigtermDuringStalledUploadsExitsPromptlyAndKeepsEveryFile) {
+  constexpr size_t kSessions = 60;
+  restartReceiver({"--delay-ms", "120000"});
+  ASSERT_EQ(home.generate(kSessions, 0, 9).status, 0);
   home.startDaemon();
   auto flush = home.startFbfctl({"flush"}, home.root() / "flush.out");
-  // The receiver holds each request for minutes; give the uploads time to start.
-  std::this_thread::sleep_for(1500ms);
+  ASSERT_TRUE(waitUntil([&] { return home.daemonLog().find("Enqueueing") != std::string::npos; }, 10s))
+      << tail(home.daemonLog());
+  std::this_thread::sleep_for(300ms);  // the transfers start and stall
   const auto start = std::chrono::steady_clock::now();
   auto status = home.stopDaemon();
   ASSERT_TRUE(status) << "no exit after SIGTERM";
-  EXPECT_EQ(*status, 0);
+  EXPECT_EQ(*status, 0) << tail(home.daemonLog());
   // Well inside the unit's TimeoutStopSec.
   EXPECT_LT(std::chrono::steady_clock::now() - start, 15s);
-  EXPECT_EQ(home.sessionFiles().size(), 3u) << "a stalled upload's files must stay for the next run";
-  EXPECT_EQ(losses(home.deletionEvents()), 0);
+  const auto left = home.sessionFiles();
+  EXPECT_EQ(left.size(), kSessions) << "a stalled upload's files must stay for the next run";
+  size_t closed = 0;
+  for (const auto& name : left) {
+    EXPECT_FALSE(name.ends_with(".processing")) << "interrupted in the middle of " << name;
+    closed += name.ends_with(".closed");
+  }
+  EXPECT_GT(closed, 0u) << "the walk was not stopped";
+  EXPECT_EQ(lossCount(home.deletionEvents()), 0);
 }
 
 TEST_F(PipelineFaults, AcceptLoopBacksOffWhenDescriptorsRunOutAndServesAgainAfter) {
@@ -178,8 +162,6 @@ TEST_F(PipelineFaults, AcceptLoopBacksOffWhenDescriptorsRunOutAndServesAgainAfte
   // reads /proc/self/maps), so with none left it reports errors of its own.
   GTEST_SKIP() << "descriptor exhaustion is checked in the release build";
 #endif
-  startReceiver();
-  home.configure(receiver->url());
   home.startDaemon(DaemonHome::descriptorLimit(40));
   std::vector<int> clients;
   for (int i = 0; i < 60; ++i) {
@@ -203,8 +185,8 @@ TEST_F(PipelineFaults, AcceptLoopBacksOffWhenDescriptorsRunOutAndServesAgainAfte
     return ticks;
   };
   const long before = cpuTicks();
-  std::this_thread::sleep_for(2s);
-  EXPECT_LT(cpuTicks() - before, sysconf(_SC_CLK_TCK) / 2) << "the accept loop spins";
+  std::this_thread::sleep_for(1s);
+  EXPECT_LT(cpuTicks() - before, sysconf(_SC_CLK_TCK) / 4) << "the accept loop spins";
   for (int fd : clients) ::close(fd);
   auto r = home.fbfctl({"status"}, 20s);
   EXPECT_EQ(r.status, 0) << r.err << tail(home.daemonLog());

@@ -45,13 +45,12 @@ std::string digestOf(const nlohmann::json& record) {
   return {};
 }
 
-class UploadContent : public ::testing::Test {
+// Guards against: explain showing other bytes than the flush sends, and any
+// field not listed as uploaded (or a device time) reaching the receiver.
+class UploadContent : public ReceiverTest {
  protected:
   void SetUp() override {
-    ASSERT_TRUE(LoopbackCertificate::get().made) << "openssl could not make a certificate";
-    receiver = std::make_unique<Receiver>(home.root());
-    ASSERT_TRUE(receiver->running());
-    home.configure(receiver->url());
+    ReceiverTest::SetUp();
     home.startDaemon();
   }
 
@@ -81,8 +80,6 @@ class UploadContent : public ::testing::Test {
     return out;
   }
 
-  DaemonHome home;
-  std::unique_ptr<Receiver> receiver;
 };
 
 // For generated sessions in both formats and for custom files, the payload
@@ -110,7 +107,7 @@ TEST_F(UploadContent, ExplainShowsExactlyWhatTheNextFlushUploads) {
     EXPECT_EQ(doc["upload"]["bytes"], explained[session].size());
     EXPECT_GT(doc["rewrite"]["identifiersMapped"].get<int>(), 0) << shown.out;
 
-    ASSERT_EQ(home.fbfctl({"flush"}).status, 0) << home.daemonLog();
+    flush();
     auto uploads = uploadsByDigest(before);
     for (const auto& [path, payload] : explained) {
       if (payload.empty()) continue;  // an empty custom file is dropped, not uploaded
@@ -258,7 +255,7 @@ TEST_F(UploadContent, NothingOutsideTheReadmeTableLeavesTheDevice) {
 
     const std::string payload = explainRaw(path);
     const size_t before = receiver->records().size();
-    ASSERT_EQ(home.fbfctl({"flush"}).status, 0) << home.daemonLog();
+    flush();
     auto records = receiver->records();
     ASSERT_EQ(records.size(), before + 1) << format;
     const auto& record = records.back();
