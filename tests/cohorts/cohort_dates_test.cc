@@ -13,8 +13,7 @@ namespace {
 
 SystemTime at(const std::array<int, 4>& d) { return localTime(d[0], d[1], d[2], d[3]); }
 
-// Guards against: a capture range that starts or ends off local midnight, has the wrong length across a
-// daylight-saving change or a leap month, or a week that ignores its locale's rule.
+// Guards against: a capture range that starts or ends off local midnight, has the wrong length across a daylight-saving change or a leap month, or a week that ignores its locale's rule.
 TEST(CaptureRanges, StartAndEndAtLocalMidnightsAndCountCalendarDays) {
   const struct {
     const char* name;
@@ -64,8 +63,7 @@ TEST(CaptureRanges, StartAndEndAtLocalMidnightsAndCountCalendarDays) {
   }
 }
 
-// Guards against: the process time zone ignored, lookback days counted as 24-hour spans, or distinct
-// days counted in UTC.
+// Guards against: the process time zone ignored, lookback days counted as 24-hour spans, or distinct days counted in UTC.
 TEST(NewYorkCalendar, DaysAreLocalCalendarDaysOfTheProcessTimeZone) {
   ScopedTimeZone zone("America/New_York");
   CohortCalendar calendar = CohortCalendar::current();
@@ -110,8 +108,7 @@ TEST(WeekRuleLocale, FollowsPosixPrecedence) {
   }
 }
 
-// Guards against: periods that overlap or leave a gap when two runs of the daemon see a different zone or
-// week rule, or where a transition skips midnight.
+// Guards against: periods that overlap or leave a gap when two runs of the daemon see a different zone or week rule, or where a transition skips midnight.
 TEST(PeriodsAcrossRuns, ChainWithoutOverlapOrGapAndCountCalendarDays) {
   using F = FlushFrequency;
   struct Row {

@@ -31,8 +31,7 @@ class RecordingConduit final : public ClientConduit {
   std::vector<std::string> received;
 };
 
-// Guards against: envelopes for the wrong period, client order, lookback or active days; markers not
-// advanced; shares or engagement totals computed or formatted wrongly; files or listener calls missing.
+// Guards against: envelopes for the wrong period, client order, lookback or active days; markers not advanced; shares or engagement totals computed or formatted wrongly; files or listener calls missing.
 class CohortEnvelopes : public OpenStore {
  protected:
   CohortEnvelopes() : OpenStore("America/New_York") {}
@@ -236,8 +235,7 @@ TEST_F(CohortEnvelopes, InTheDaemonEnvelopesBecomeUsageFilesAndReachTheListenerO
   EXPECT_EQ(first.client(), 2);
 }
 
-// Guards against: the flush aggregating days not yet due, skipping due ones, purging what a pending month
-// still needs, or not counting sessions.
+// Guards against: the flush aggregating days not yet due, skipping due ones, purging what a pending month still needs, or not counting sessions.
 TEST_F(CohortEnvelopes, TheCohortFlushAggregatesDueDaysAndPurgesOnlyWhatNoPeriodNeeds) {
   fs::create_directories(env.cacheDir() / "CustomFeedback");
   env.writeBag({{"cohorts_lookback_in_days", 7}});

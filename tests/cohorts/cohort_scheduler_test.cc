@@ -37,8 +37,7 @@ class RecordingGenerator final : public CohortFeedbackGeneratorProtocol {
   CohortCalendar calendar_;
 };
 
-// Guards against: a period aggregated before it ends or never after it, a coin that ignores the period's
-// age, idle periods skipped or merged when catching up, or a stuck generator looping forever.
+// Guards against: a period aggregated before it ends or never after it, a coin that ignores the period's age, idle periods skipped or merged when catching up, or a stuck generator looping forever.
 class CohortSchedule : public OpenStore {
  protected:
   CohortSchedule() : OpenStore("America/New_York") {}

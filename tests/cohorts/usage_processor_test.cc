@@ -16,8 +16,7 @@ const char* kScoutlume = "VIRScoutlumeSession";
 const char* kWayfin = "VIRWayfinSession";
 const char* kImages = "VIRImagesSession";
 
-// Guards against: a session counted for the wrong surface, twice, without an engagement or search, or a
-// counter past its 16-bit maximum stored instead of stopping.
+// Guards against: a session counted for the wrong surface, twice, without an engagement or search, or a counter past its 16-bit maximum stored instead of stopping.
 class UsageCounting : public OpenStore {
  protected:
   void SetUp() override {

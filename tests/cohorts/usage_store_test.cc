@@ -20,8 +20,7 @@ unsigned modeOf(const fs::path& p) {
   return st.st_mode & 0777;
 }
 
-// Guards against: a store invented without the Cohorts directory, a wrong collection start, markers not
-// staged or not saved, or a file with the wrong schema or permissions.
+// Guards against: a store invented without the Cohorts directory, a wrong collection start, markers not staged or not saved, or a file with the wrong schema or permissions.
 using StoreBringUp = StoreFixture;
 
 TEST_F(StoreBringUp, WithoutTheCohortsDirectoryThereIsNoStoreAndNoDirectoryIsMade) {
@@ -87,8 +86,7 @@ TEST_F(StoreBringUp, TheFileHasTheDocumentedTablesAndIsOwnerOnly) {
   EXPECT_EQ(modeOf(cohortsDir()), 0700u);
 }
 
-// Guards against: the store taking over, rewriting or migrating a file it cannot use instead of giving up
-// with one clear line.
+// Guards against: the store taking over, rewriting or migrating a file it cannot use instead of giving up with one clear line.
 TEST_F(StoreBringUp, AnUnusableFileYieldsNoStoreAndIsLeftAlone) {
   makeCohortsDirectory();
   struct Row {
@@ -169,8 +167,7 @@ PRAGMA user_version = 1;
   EXPECT_EQ(raw.scalar("SELECT appLaunch FROM VIRScoutlumeSession"), "3");
 }
 
-// Guards against: fetches that include a range's end or miss its start, come unsorted, mix clients, or
-// pick an older flush event.
+// Guards against: fetches that include a range's end or miss its start, come unsorted, mix clients, or pick an older flush event.
 using StoreQueries = OpenStore;
 
 TEST_F(StoreQueries, SentinelsAreNewestFirstForTheirClientInTheHalfOpenRange) {
@@ -251,8 +248,7 @@ TEST_F(StoreQueries, APurgeRemovesRecordsAtOrBeforeTheDateButNoCategories) {
   EXPECT_EQ(sql("SELECT min(timestamp) > " + std::to_string(secondsSinceEpoch(date)) + " FROM VIRUsageEvent"), "1");
 }
 
-// Guards against: staged records written before a save, kept after the row cache is emptied, or lost when
-// a save fails; and markers unusable after a reset.
+// Guards against: staged records written before a save, kept after the row cache is emptied, or lost when a save fails; and markers unusable after a reset.
 using StoreSaving = OpenStore;
 
 TEST_F(StoreSaving, StagedRecordsStayInMemoryUntilSavedAndAnEmptiedCacheDropsThem) {

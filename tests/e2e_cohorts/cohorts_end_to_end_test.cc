@@ -28,6 +28,7 @@ namespace {
 using namespace std::chrono_literals;
 using corevireon::CVCohortsFeedback;
 using corevireon::CVUsageEnvelope;
+using Env = std::map<std::string, std::string>;
 
 constexpr int64_t kDay = 86400;
 // Three whole days pass for the daemon, and half an hour into the fourth:
@@ -36,17 +37,7 @@ constexpr int64_t kDay = 86400;
 // number of aggregated periods does not depend on chance.
 constexpr int64_t kDaysForward = 4;
 constexpr int64_t kIntoTheDay = 1800;
-constexpr int kSessions = 48;
-
-std::optional<fs::path> preloadedFaketime() {
-  glob_t found{};
-  std::optional<fs::path> path;
-  if (glob("/usr/lib/*/faketime/libfaketimeMT.so.1", 0, nullptr, &found) == 0 && found.gl_pathc > 0) {
-    path = found.gl_pathv[0];
-  }
-  globfree(&found);
-  return path;
-}
+constexpr int kSessions = 24;
 
 std::string utcText(int64_t secondsSince1970, const char* format) {
   std::time_t t = secondsSince1970;
@@ -74,34 +65,34 @@ std::vector<nlohmann::json> jsonLines(const std::string& text) {
   return out;
 }
 
-// A receiver, a daemon home with its bag and preferences, and the Cohorts
-// directory made the way the search daemon makes it.
+// Guards against: usage not counted by the real daemon, due days not aggregated (or not yet due ones aggregated) after days pass, envelopes not teed, not uploaded or not deleted after upload, active days that disagree with the store, or a store file others can read.
 class CohortsAcrossDays : public ::testing::Test {
  protected:
   void SetUp() override {
-    auto faketime = preloadedFaketime();
-    if (!faketime) GTEST_SKIP() << "libfaketime (Debian package faketime) is not installed";
-    faketimeLibrary_ = *faketime;
+    glob_t found{};
+    if (glob("/usr/lib/*/faketime/libfaketimeMT.so.1", 0, nullptr, &found) == 0 && found.gl_pathc > 0) {
+      faketime_ = found.gl_pathv[0];
+    }
+    globfree(&found);
+    if (faketime_.empty()) GTEST_SKIP() << "libfaketime (Debian package faketime) is not installed";
 
     env_ = xdgEnvironment(home_.path());
     // Day arithmetic below is plain UTC; no daylight saving day in between.
     env_["TZ"] = "UTC";
     cacheDir_ = fs::path(env_["XDG_CACHE_HOME"]) / "vireond";
-
-    fs::create_directories(home_.path() / "tls");
-    std::string cmd = "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 30"
-                      " -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout '" +
-                      (home_.path() / "tls/key.pem").string() + "' -out '" + cert().string() + "' >/dev/null 2>&1";
-    ASSERT_EQ(std::system(cmd.c_str()), 0) << "the openssl command could not make a test certificate";
-
-    auto portFile = home_.path() / "ingest.port";
+    const std::string cert = path("cert.pem"), key = path("key.pem");
+    ASSERT_EQ(std::system(("openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 30"
+                           " -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout '" + key + "' -out '" +
+                           cert + "' >/dev/null 2>&1").c_str()),
+              0)
+        << "the openssl command could not make a test certificate";
     ingest_ = std::make_unique<ChildProcess>(
         binDir() / "fbf-ingest",
-        std::vector<std::string>{"--listen", "127.0.0.1:0", "--port-file", portFile.string(), "--tls", cert().string(),
-                                 (home_.path() / "tls/key.pem").string(), "--record", records().string()},
-        env_, home_.path() / "ingest.out", home_.path() / "ingest.err");
-    ASSERT_TRUE(waitUntil([&] { return !readFile(portFile).empty(); }, 20s)) << readFile(home_.path() / "ingest.err");
-    std::string url = "https://127.0.0.1:" + readFile(portFile) + "/feedback";
+        std::vector<std::string>{"--listen", "127.0.0.1:0", "--port-file", path("ingest.port"), "--tls", cert, key,
+                                 "--record", path("uploads.jsonl")},
+        env_, path("ingest.out"), path("ingest.err"));
+    ASSERT_TRUE(waitUntil([&] { return !readFile(path("ingest.port")).empty(); }, 20s)) << readFile(path("ingest.err"));
+    std::string url = "https://127.0.0.1:" + readFile(path("ingest.port")) + "/feedback";
     url.erase(std::remove(url.begin(), url.end(), '\n'), url.end());
 
     PropertyList bag = {{"feedback_url", url},
@@ -110,109 +101,78 @@ class CohortsAcrossDays : public ::testing::Test {
                         {"vireon_feedback_format", "FeedbackV2PB"},
                         {"cohorts_lookback_in_days", 56}};
     writeFile(cacheDir_ / "bag.plist", serializePropertyList(bag, PropertyListFormat::xml));
-    fs::permissions(cacheDir_ / "bag.plist", fs::perms::owner_read | fs::perms::owner_write);
-    fbfctl({"defaults", "write", "vireond", "VIRUploadCAFile", "-string", cert().string()});
+    fbfctl({"defaults", "write", "vireond", "VIRUploadCAFile", "-string", cert});
     fbfctl({"defaults", "write", "vireond", "FBFNoExit", "-bool", "true"});
     // Ten days between periodic flushes: the later daemon must not flush on
     // its own at launch, before the cohorts listener is there.
     fbfctl({"defaults", "write", "vireond", "FlushFrequencyInSeconds", "-int", "864000"});
     fbfctl({"defaults", "write", "vireon.privacy", "DiagnosticsAndUsageEnabled", "-bool", "true"});
-
     fs::create_directory(cohortsDir());
     fs::permissions(cohortsDir(), fs::perms::owner_all);
 
     realNow_ = static_cast<int64_t>(std::time(nullptr));
     day0_ = realNow_ / kDay * kDay;
-    fakeNow_ = day0_ + kDaysForward * kDay + kIntoTheDay;
+    // The clock at the fourth day, for every process started with it;
+    // timers and waits keep real monotonic time, file times stay real, and
+    // the preloaded library comes before the sanitizer runtime.
+    faked_ = env_;
+    faked_["LD_PRELOAD"] = faketime_;
+    faked_["FAKETIME"] = "@" + utcText(day0_ + kDaysForward * kDay + kIntoTheDay, "%Y-%m-%d %H:%M:%S");
+    faked_["DONT_FAKE_MONOTONIC"] = "1";
+    faked_["NO_FAKE_STAT"] = "1";
+    std::string asan = std::getenv("ASAN_OPTIONS") ? std::getenv("ASAN_OPTIONS") : "";
+    faked_["ASAN_OPTIONS"] = (asan.empty() ? "" : asan + ":") + "verify_asan_link_order=0";
   }
-
   void TearDown() override {
     if (daemon_) stopDaemon();
   }
 
-  fs::path cert() const { return home_.path() / "tls/cert.pem"; }
-  fs::path records() const { return home_.path() / "uploads.jsonl"; }
+  std::string path(const std::string& name) const { return (home_.path() / name).string(); }
   fs::path cohortsDir() const { return cacheDir_ / "Cohorts"; }
-  fs::path database() const { return cohortsDir() / "cohorts.sqlite"; }
   fs::path usageDir() const { return cacheDir_ / "CustomFeedback" / "Usage"; }
-
-  // The environment with the clock at `fakeNow_`, started afresh per process.
-  std::map<std::string, std::string> fakedEnvironment() const {
-    auto env = env_;
-    env["LD_PRELOAD"] = faketimeLibrary_.string();
-    env["FAKETIME"] = "@" + utcText(fakeNow_, "%Y-%m-%d %H:%M:%S");
-    // Timers and waits keep real monotonic time; file times stay real.
-    env["DONT_FAKE_MONOTONIC"] = "1";
-    env["NO_FAKE_STAT"] = "1";
-    // The preloaded library comes before the sanitizer runtime.
-    std::string asan = std::getenv("ASAN_OPTIONS") ? std::getenv("ASAN_OPTIONS") : "";
-    env["ASAN_OPTIONS"] = (asan.empty() ? "" : asan + ":") + "verify_asan_link_order=0";
-    return env;
-  }
 
   RunResult fbfctl(const std::vector<std::string>& args) {
     auto run = runProgram(binDir() / "fbfctl", args, env_);
     EXPECT_EQ(run.status, 0) << "fbfctl " << args.front() << ": " << run.err;
     return run;
   }
-
-  void startDaemon(const std::map<std::string, std::string>& env) {
+  nlohmann::json cohortsStatus() { return nlohmann::json::parse(fbfctl({"status", "--json"}).out)["cohorts"]; }
+  void startDaemon(const Env& env) {
     auto socket = XdgDirectories::underRoot(home_.path()).socketPath();
-    std::error_code ec;
-    fs::remove(socket, ec);
-    daemonLog_ = home_.path() / ("daemon" + std::to_string(++daemonRuns_) + ".log");
+    fs::remove(socket);
+    daemonLog_ = path("daemon" + std::to_string(++daemonRuns_) + ".log");
     daemon_ = std::make_unique<ChildProcess>(binDir() / "vireon-fbf", std::vector<std::string>{}, env,
-                                             home_.path() / "daemon.out", daemonLog_);
+                                             path("daemon.out"), daemonLog_);
     ASSERT_TRUE(waitUntil([&] { return fs::exists(socket); }, 20s)) << readFile(daemonLog_);
   }
-
   void stopDaemon() {
     daemon_->signal(SIGTERM);
     EXPECT_EQ(daemon_->waitFor(20s), 0) << readFile(daemonLog_);
     daemon_.reset();
   }
-
   std::vector<nlohmann::json> uploads(const std::string& type) const {
-    std::vector<nlohmann::json> out;
-    for (auto& r : jsonLines(readFile(records()))) {
-      if (r["type"] == type) out.push_back(std::move(r));
-    }
-    return out;
+    auto all = jsonLines(readFile(path("uploads.jsonl")));
+    std::erase_if(all, [&](const nlohmann::json& r) { return r["type"] != type; });
+    return all;
   }
-
   std::string sqlite(const std::string& sql) {
-    auto run = runProgram("/usr/bin/sqlite3", {"-readonly", database().string(), sql}, env_);
+    auto run = runProgram("/usr/bin/sqlite3", {"-readonly", (cohortsDir() / "cohorts.sqlite").string(), sql}, env_);
     EXPECT_EQ(run.status, 0) << sql << ": " << run.err;
     return run.out;
   }
-
-  // (client, UTC day) of every session sentinel in the store.
-  std::multimap<int32_t, int64_t> sentinelDays() {
-    std::multimap<int32_t, int64_t> out;
-    std::istringstream rows(sqlite(
-        "SELECT c.clientIntVal, e.timestamp FROM VIRUsageEvent AS e JOIN VIRCategory AS c ON c.rowid = e.usageCategory;"));
-    for (std::string row; std::getline(rows, row);) {
-      auto bar = row.find('|');
-      if (bar == std::string::npos) continue;
-      out.emplace(std::stoi(row.substr(0, bar)), static_cast<int64_t>(std::floor(std::stod(row.substr(bar + 1)))) / kDay * kDay);
-    }
-    return out;
-  }
-
   size_t usageFilesLeft() const {
     if (!fs::exists(usageDir())) return 0;
     return static_cast<size_t>(std::distance(fs::directory_iterator(usageDir()), fs::directory_iterator()));
   }
 
   TempDir home_;
-  std::map<std::string, std::string> env_;
+  Env env_, faked_;
   fs::path cacheDir_;
-  fs::path faketimeLibrary_;
-  std::unique_ptr<ChildProcess> ingest_;
-  std::unique_ptr<ChildProcess> daemon_;
+  std::string faketime_;
+  std::unique_ptr<ChildProcess> ingest_, daemon_;
   fs::path daemonLog_;
   int daemonRuns_ = 0;
-  int64_t realNow_ = 0, day0_ = 0, fakeNow_ = 0;
+  int64_t realNow_ = 0, day0_ = 0;
 };
 
 TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
@@ -220,7 +180,7 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   auto generated = runProgram(binDir() / "fbf-sessiongen",
                               {"--out", cacheDir_.string(), "--sessions", std::to_string(kSessions), "--custom", "0",
                                "--seed", "23", "--size-mix", "small", "--days", std::to_string(kDaysForward)},
-                              fakedEnvironment());
+                              faked_);
   if (generated.status != 0 && generated.err.find("AddressSanitizer") != std::string::npos) {
     GTEST_SKIP() << "the sanitizer runtime refuses the preloaded libfaketime: " << generated.err;
   }
@@ -232,34 +192,32 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   EXPECT_EQ(uploads("FeedbackV2PB").size(), static_cast<size_t>(kSessions)) << readFile(daemonLog_);
   EXPECT_TRUE(uploads("Usage").empty());
   EXPECT_EQ(usageFilesLeft(), 0u) << "the first hour never generates";
-
-  auto status = nlohmann::json::parse(fbfctl({"status", "--json"}).out);
-  ASSERT_TRUE(status["cohorts"].is_object()) << status.dump();
-  const double collectionStart = status["cohorts"]["collectionStart"].get<double>();
+  auto status = cohortsStatus();
+  ASSERT_TRUE(status.is_object());
+  const double collectionStart = status["collectionStart"].get<double>();
   EXPECT_NEAR(collectionStart, static_cast<double>(realNow_), 120.0);
   for (const char* frequency : {"daily", "weekly", "monthly"}) {
-    EXPECT_DOUBLE_EQ(status["cohorts"]["lastAggregations"][frequency].get<double>(), collectionStart)
+    EXPECT_DOUBLE_EQ(status["lastAggregations"][frequency].get<double>(), collectionStart)
         << "bring-up starts every frequency at the collection start";
   }
   uint64_t sentinelsCounted = 0;
-  for (const auto& s : status["cohorts"]["sentinels"]) sentinelsCounted += s["count"].get<uint64_t>();
+  for (const auto& s : status["sentinels"]) sentinelsCounted += s["count"].get<uint64_t>();
   EXPECT_GT(sentinelsCounted, 0u);
   EXPECT_EQ(std::stoull(sqlite("SELECT count(*) FROM VIRUsageEvent;")), sentinelsCounted);
   stopDaemon();
 
   // --- Second flush, days later: every due period aggregated -------------
-  startDaemon(fakedEnvironment());
-  ChildProcess tee(binDir() / "fbfctl", {"tee", "cohorts", "--count", "12"}, env_, home_.path() / "tee.out",
-                   home_.path() / "tee.err");
-  ASSERT_TRUE(waitUntil([&] { return readFile(home_.path() / "tee.err").find("listening") != std::string::npos; }, 20s));
+  startDaemon(faked_);
+  ChildProcess tee(binDir() / "fbfctl", {"tee", "cohorts", "--count", "12"}, env_, path("tee.out"), path("tee.err"));
+  ASSERT_TRUE(waitUntil([&] { return readFile(path("tee.err")).find("listening") != std::string::npos; }, 20s));
   fbfctl({"flush"});
-  ASSERT_EQ(tee.waitFor(20s), 0) << readFile(home_.path() / "tee.err") << readFile(daemonLog_);
+  ASSERT_EQ(tee.waitFor(20s), 0) << readFile(path("tee.err")) << readFile(daemonLog_);
   const size_t generatedFiles = usageFilesLeft();
   EXPECT_GE(generatedFiles, 12u) << readFile(daemonLog_);
   EXPECT_TRUE(uploads("Usage").empty()) << "generated at the end of the walk, uploaded by the next flush";
 
   // The three whole days, in order, each with the surfaces 2, 1, 4, 3.
-  auto teed = jsonLines(readFile(home_.path() / "tee.out"));
+  auto teed = jsonLines(readFile(path("tee.out")));
   ASSERT_EQ(teed.size(), 12u);
   std::vector<int> teedClients;
   std::set<std::string> teedUuids;
@@ -272,10 +230,7 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   }
   EXPECT_EQ(teedClients, (std::vector<int>{2, 1, 4, 3, 2, 1, 4, 3, 2, 1, 4, 3}));
   EXPECT_EQ(teedUuids.size(), 12u);
-
-  auto later = nlohmann::json::parse(fbfctl({"status", "--json"}).out);
-  EXPECT_DOUBLE_EQ(later["cohorts"]["lastAggregations"]["daily"].get<double>(),
-                   static_cast<double>(day0_ + 3 * kDay))
+  EXPECT_DOUBLE_EQ(cohortsStatus()["lastAggregations"]["daily"].get<double>(), static_cast<double>(day0_ + 3 * kDay))
       << "the fourth day is under an hour old";
   auto human = fbfctl({"status"}).out;
   EXPECT_NE(human.find("daily: " + utcText(day0_ + 3 * kDay, "%Y-%m-%dT%H:%M:%SZ")), std::string::npos) << human;
@@ -286,7 +241,16 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   ASSERT_EQ(usage.size(), generatedFiles) << readFile(daemonLog_);
   EXPECT_EQ(usageFilesLeft(), 0u);
 
-  auto sentinels = sentinelDays();
+  // (client, UTC day) of every session sentinel in the store.
+  std::multimap<int32_t, int64_t> sentinels;
+  std::istringstream sentinelRows(sqlite(
+      "SELECT c.clientIntVal, e.timestamp FROM VIRUsageEvent AS e JOIN VIRCategory AS c ON c.rowid = e.usageCategory;"));
+  for (std::string row; std::getline(sentinelRows, row);) {
+    auto bar = row.find('|');
+    if (bar == std::string::npos) continue;
+    sentinels.emplace(std::stoi(row.substr(0, bar)),
+                      static_cast<int64_t>(std::floor(std::stod(row.substr(bar + 1)))) / kDay * kDay);
+  }
   std::map<std::pair<int64_t, int32_t>, std::vector<int32_t>> clientsPerPeriod;
   std::set<std::string> uploadedDailyUuids;
   uint32_t dailyActiveDays = 0;
@@ -299,7 +263,6 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
     const auto& e = feedback.usageenvelope();
     EXPECT_EQ(e.collectionstarttimestamp(), static_cast<int64_t>(collectionStart));
     clientsPerPeriod[{e.collectionendtimestamp(), e.configuredlookbacktimeindays()}].push_back(e.client());
-
     // Active days: the distinct days of the surface's sentinels in the period.
     const int64_t end = e.collectionendtimestamp();
     const int64_t start = end - int64_t{e.configuredlookbacktimeindays()} * kDay;
@@ -325,13 +288,12 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   // --- The store, as an outside tool reads it ---------------------------
   for (const char* table : {"VIRUsageEvent", "VIRCategory", "VIRFlushEvent", "VIRScoutlumeSession",
                             "VIRWayfinSession", "VIRImagesSession"}) {
-    auto count = sqlite(std::string("SELECT count(*) FROM ") + table + ";");
-    EXPECT_GT(std::stoll(count), 0) << table;
+    EXPECT_GT(std::stoll(sqlite(std::string("SELECT count(*) FROM ") + table + ";")), 0) << table;
   }
   EXPECT_EQ(sqlite("SELECT max(timestamp) FROM VIRFlushEvent WHERE type = 0;"),
             std::to_string(day0_ + 3 * kDay) + ".0\n");
   struct stat st {};
-  ASSERT_EQ(stat(database().c_str(), &st), 0);
+  ASSERT_EQ(stat((cohortsDir() / "cohorts.sqlite").c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0600u);
 }
 

@@ -9,6 +9,7 @@
 namespace fbf::testing {
 namespace {
 
+// Guards against: the daemon ending on SIGTERM or SIGINT without its log line and a clean exit, or a socket others can use.
 class DaemonSignals : public ::testing::TestWithParam<int> {};
 
 TEST_P(DaemonSignals, LogsAndExitsCleanly) {
@@ -38,6 +39,7 @@ TEST_P(DaemonSignals, LogsAndExitsCleanly) {
 
 INSTANTIATE_TEST_SUITE_P(TermAndInt, DaemonSignals, ::testing::Values(SIGTERM, SIGINT));
 
+// Guards against: the daemon deleting a file that is not its socket.
 TEST(DaemonStartUp, LeavesAFileThatIsNotASocketAlone) {
   TempDir home;
   auto env = xdgEnvironment(home.path());
