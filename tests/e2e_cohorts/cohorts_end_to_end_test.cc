@@ -2,14 +2,11 @@
 // a later flush (the daemon's clock moved forward with libfaketime)
 // aggregates the days that have passed, and the flush after that uploads
 // the usage envelopes to a real receiver over HTTPS.
-#include "platform/property_list.h"
-#include "support/process.h"
-#include "support/test_support.h"
+#include "e2e/daemon_home.h"
 
 #include "corevireon.pb.h"
 
 #include <glob.h>
-#include <signal.h>
 #include <sys/stat.h>
 
 #include <google/protobuf/util/json_util.h>
@@ -28,7 +25,6 @@ namespace {
 using namespace std::chrono_literals;
 using corevireon::CVCohortsFeedback;
 using corevireon::CVUsageEnvelope;
-using Env = std::map<std::string, std::string>;
 
 constexpr int64_t kDay = 86400;
 // Three whole days pass for the daemon, and half an hour into the fourth:
@@ -75,88 +71,53 @@ class CohortsAcrossDays : public ::testing::Test {
     }
     globfree(&found);
     if (faketime_.empty()) GTEST_SKIP() << "libfaketime (Debian package faketime) is not installed";
-
-    env_ = xdgEnvironment(home_.path());
-    // Day arithmetic below is plain UTC; no daylight saving day in between.
-    env_["TZ"] = "UTC";
-    cacheDir_ = fs::path(env_["XDG_CACHE_HOME"]) / "vireond";
+    // A certificate of its own: the shared one expires before the faked days.
     const std::string cert = path("cert.pem"), key = path("key.pem");
     ASSERT_EQ(std::system(("openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 30"
                            " -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout '" + key + "' -out '" +
                            cert + "' >/dev/null 2>&1").c_str()),
-              0)
-        << "the openssl command could not make a test certificate";
+              0);
     ingest_ = std::make_unique<ChildProcess>(
         binDir() / "fbf-ingest",
-        std::vector<std::string>{"--listen", "127.0.0.1:0", "--port-file", path("ingest.port"), "--tls", cert, key,
+        std::vector<std::string>{"--listen", "127.0.0.1:0", "--port-file", path("port"), "--tls", cert, key,
                                  "--record", path("uploads.jsonl")},
-        env_, path("ingest.out"), path("ingest.err"));
-    ASSERT_TRUE(waitUntil([&] { return !readFile(path("ingest.port")).empty(); }, 20s)) << readFile(path("ingest.err"));
-    std::string url = "https://127.0.0.1:" + readFile(path("ingest.port")) + "/feedback";
-    url.erase(std::remove(url.begin(), url.end(), '\n'), url.end());
-
-    PropertyList bag = {{"feedback_url", url},
-                        {"crowdsourcing_url", url},
-                        {"feedback_max_age_in_days", 7},
-                        {"vireon_feedback_format", "FeedbackV2PB"},
-                        {"cohorts_lookback_in_days", 56}};
-    writeFile(cacheDir_ / "bag.plist", serializePropertyList(bag, PropertyListFormat::xml));
+        home_.environment(), path("ingest.out"), path("ingest.err"));
+    ASSERT_TRUE(waitUntil([&] { return !readFile(path("port")).empty(); }, 20s)) << readFile(path("ingest.err"));
+    home_.configure("https://127.0.0.1:" + std::to_string(std::stoi(readFile(path("port")))) + "/feedback",
+                    {{"cohorts_lookback_in_days", 56}});
     fbfctl({"defaults", "write", "vireond", "VIRUploadCAFile", "-string", cert});
-    fbfctl({"defaults", "write", "vireond", "FBFNoExit", "-bool", "true"});
-    // Ten days between periodic flushes: the later daemon must not flush on
-    // its own at launch, before the cohorts listener is there.
-    fbfctl({"defaults", "write", "vireond", "FlushFrequencyInSeconds", "-int", "864000"});
-    fbfctl({"defaults", "write", "vireon.privacy", "DiagnosticsAndUsageEnabled", "-bool", "true"});
     fs::create_directory(cohortsDir());
     fs::permissions(cohortsDir(), fs::perms::owner_all);
-
     realNow_ = static_cast<int64_t>(std::time(nullptr));
     day0_ = realNow_ / kDay * kDay;
-    // The clock at the fourth day, for every process started with it;
-    // timers and waits keep real monotonic time, file times stay real, and
-    // the preloaded library comes before the sanitizer runtime.
-    faked_ = env_;
-    faked_["LD_PRELOAD"] = faketime_;
-    faked_["FAKETIME"] = "@" + utcText(day0_ + kDaysForward * kDay + kIntoTheDay, "%Y-%m-%d %H:%M:%S");
-    faked_["DONT_FAKE_MONOTONIC"] = "1";
-    faked_["NO_FAKE_STAT"] = "1";
-    std::string asan = std::getenv("ASAN_OPTIONS") ? std::getenv("ASAN_OPTIONS") : "";
-    faked_["ASAN_OPTIONS"] = (asan.empty() ? "" : asan + ":") + "verify_asan_link_order=0";
-  }
-  void TearDown() override {
-    if (daemon_) stopDaemon();
+    // Day arithmetic below is plain UTC; no daylight saving day in between.
+    // The faked clock is at the fourth day, for every process started with
+    // it; timers and waits keep real monotonic time, file times stay real,
+    // and the preloaded library comes before the sanitizer runtime.
+    const char* asan = std::getenv("ASAN_OPTIONS");
+    faked_ = {"/usr/bin/env", "TZ=UTC", "LD_PRELOAD=" + faketime_,
+              "FAKETIME=@" + utcText(day0_ + kDaysForward * kDay + kIntoTheDay, "%Y-%m-%d %H:%M:%S"),
+              "DONT_FAKE_MONOTONIC=1", "NO_FAKE_STAT=1",
+              "ASAN_OPTIONS=" + std::string(asan ? asan + std::string(":") : "") + "verify_asan_link_order=0"};
   }
 
-  std::string path(const std::string& name) const { return (home_.path() / name).string(); }
-  fs::path cohortsDir() const { return cacheDir_ / "Cohorts"; }
-  fs::path usageDir() const { return cacheDir_ / "CustomFeedback" / "Usage"; }
-
+  std::string path(const std::string& name) const { return (home_.root() / name).string(); }
+  fs::path cohortsDir() const { return home_.cacheDir() / "Cohorts"; }
+  fs::path usageDir() const { return home_.customDir() / "Usage"; }
   RunResult fbfctl(const std::vector<std::string>& args) {
-    auto run = runProgram(binDir() / "fbfctl", args, env_);
+    auto run = home_.fbfctl(args);
     EXPECT_EQ(run.status, 0) << "fbfctl " << args.front() << ": " << run.err;
     return run;
   }
   nlohmann::json cohortsStatus() { return nlohmann::json::parse(fbfctl({"status", "--json"}).out)["cohorts"]; }
-  void startDaemon(const Env& env) {
-    auto socket = XdgDirectories::underRoot(home_.path()).socketPath();
-    fs::remove(socket);
-    daemonLog_ = path("daemon" + std::to_string(++daemonRuns_) + ".log");
-    daemon_ = std::make_unique<ChildProcess>(binDir() / "vireon-fbf", std::vector<std::string>{}, env,
-                                             path("daemon.out"), daemonLog_);
-    ASSERT_TRUE(waitUntil([&] { return fs::exists(socket); }, 20s)) << readFile(daemonLog_);
-  }
-  void stopDaemon() {
-    daemon_->signal(SIGTERM);
-    EXPECT_EQ(daemon_->waitFor(20s), 0) << readFile(daemonLog_);
-    daemon_.reset();
-  }
   std::vector<nlohmann::json> uploads(const std::string& type) const {
     auto all = jsonLines(readFile(path("uploads.jsonl")));
     std::erase_if(all, [&](const nlohmann::json& r) { return r["type"] != type; });
     return all;
   }
   std::string sqlite(const std::string& sql) {
-    auto run = runProgram("/usr/bin/sqlite3", {"-readonly", (cohortsDir() / "cohorts.sqlite").string(), sql}, env_);
+    auto run = runProgram("/usr/bin/sqlite3", {"-readonly", (cohortsDir() / "cohorts.sqlite").string(), sql},
+                          home_.environment());
     EXPECT_EQ(run.status, 0) << sql << ": " << run.err;
     return run.out;
   }
@@ -165,31 +126,28 @@ class CohortsAcrossDays : public ::testing::Test {
     return static_cast<size_t>(std::distance(fs::directory_iterator(usageDir()), fs::directory_iterator()));
   }
 
-  TempDir home_;
-  Env env_, faked_;
-  fs::path cacheDir_;
+  DaemonHome home_;
+  std::unique_ptr<ChildProcess> ingest_;
   std::string faketime_;
-  std::unique_ptr<ChildProcess> ingest_, daemon_;
-  fs::path daemonLog_;
-  int daemonRuns_ = 0;
+  std::vector<std::string> faked_;
   int64_t realNow_ = 0, day0_ = 0;
 };
 
 TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   // Session starts spread over the four days the daemon will look back on.
-  auto generated = runProgram(binDir() / "fbf-sessiongen",
-                              {"--out", cacheDir_.string(), "--sessions", std::to_string(kSessions), "--custom", "0",
-                               "--seed", "23", "--size-mix", "small", "--days", std::to_string(kDaysForward)},
-                              faked_);
+  std::vector<std::string> args(faked_.begin() + 1, faked_.end());
+  args.insert(args.end(), {(binDir() / "fbf-sessiongen").string(), "--out", home_.cacheDir().string(), "--sessions",
+                           std::to_string(kSessions), "--custom", "0", "--seed", "23", "--size-mix", "small", "--days", std::to_string(kDaysForward)});
+  auto generated = runProgram(faked_.front(), args, home_.environment());
   if (generated.status != 0 && generated.err.find("AddressSanitizer") != std::string::npos) {
     GTEST_SKIP() << "the sanitizer runtime refuses the preloaded libfaketime: " << generated.err;
   }
   ASSERT_EQ(generated.status, 0) << generated.err;
 
   // --- First flush, today: sessions counted, nothing due yet -------------
-  startDaemon(env_);
+  home_.startDaemon({"/usr/bin/env", "TZ=UTC"});
   fbfctl({"flush"});
-  EXPECT_EQ(uploads("FeedbackV2PB").size(), static_cast<size_t>(kSessions)) << readFile(daemonLog_);
+  EXPECT_EQ(uploads("FeedbackV2PB").size(), static_cast<size_t>(kSessions)) << home_.daemonLog();
   EXPECT_TRUE(uploads("Usage").empty());
   EXPECT_EQ(usageFilesLeft(), 0u) << "the first hour never generates";
   auto status = cohortsStatus();
@@ -204,20 +162,23 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   for (const auto& s : status["sentinels"]) sentinelsCounted += s["count"].get<uint64_t>();
   EXPECT_GT(sentinelsCounted, 0u);
   EXPECT_EQ(std::stoull(sqlite("SELECT count(*) FROM VIRUsageEvent;")), sentinelsCounted);
-  stopDaemon();
+  EXPECT_EQ(home_.stopDaemon(), 0);
 
   // --- Second flush, days later: every due period aggregated -------------
-  startDaemon(faked_);
-  ChildProcess tee(binDir() / "fbfctl", {"tee", "cohorts", "--count", "12"}, env_, path("tee.out"), path("tee.err"));
-  ASSERT_TRUE(waitUntil([&] { return readFile(path("tee.err")).find("listening") != std::string::npos; }, 20s));
+  // A restarted daemon truncates its log; readiness is this run's "setup".
+  fs::remove(home_.root() / "daemon.log");
+  home_.startDaemon(faked_);
+  const fs::path teeOut = home_.root() / "tee.out";
+  auto tee = home_.startFbfctl({"tee", "cohorts", "--count", "12"}, teeOut);
+  ASSERT_TRUE(waitUntil([&] { return readFile(teeOut.string() + ".err").find("listening") != std::string::npos; }, 20s));
   fbfctl({"flush"});
-  ASSERT_EQ(tee.waitFor(20s), 0) << readFile(path("tee.err")) << readFile(daemonLog_);
+  ASSERT_EQ(tee->waitFor(20s), 0) << readFile(teeOut.string() + ".err") << home_.daemonLog();
   const size_t generatedFiles = usageFilesLeft();
-  EXPECT_GE(generatedFiles, 12u) << readFile(daemonLog_);
+  EXPECT_GE(generatedFiles, 12u) << home_.daemonLog();
   EXPECT_TRUE(uploads("Usage").empty()) << "generated at the end of the walk, uploaded by the next flush";
 
   // The three whole days, in order, each with the surfaces 2, 1, 4, 3.
-  auto teed = jsonLines(readFile(path("tee.out")));
+  auto teed = jsonLines(readFile(teeOut));
   ASSERT_EQ(teed.size(), 12u);
   std::vector<int> teedClients;
   std::set<std::string> teedUuids;
@@ -238,7 +199,7 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   // --- Third flush: the envelopes reach the receiver ---------------------
   fbfctl({"flush"});
   auto usage = uploads("Usage");
-  ASSERT_EQ(usage.size(), generatedFiles) << readFile(daemonLog_);
+  ASSERT_EQ(usage.size(), generatedFiles) << home_.daemonLog();
   EXPECT_EQ(usageFilesLeft(), 0u);
 
   // (client, UTC day) of every session sentinel in the store.
