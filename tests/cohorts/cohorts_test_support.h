@@ -67,10 +67,8 @@ inline void addDidGoToSearch(corevireon::CVClientSession& s) { addItem(s)->mutab
 
 struct ResultSpec {
   std::optional<std::string> identifier = "r1";
-  int32_t knownResultBundleId = 0;
-  int32_t knownSectionBundleIdentifier = 0;
-  bool isLocalApplicationResult = false;
-  bool punchout = false;
+  int32_t knownResultBundleId = 0, knownSectionBundleIdentifier = 0;
+  bool isLocalApplicationResult = false, punchout = false;
 };
 
 inline corevireon::CVSearchResultForFeedback makeResult(const ResultSpec& spec) {
@@ -96,19 +94,9 @@ inline void addResultEngagement(corevireon::CVClientSession& s, std::optional<Re
 
 class RawDatabase {
  public:
-  explicit RawDatabase(const fs::path& path) {
-    if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) != SQLITE_OK) {
-      ADD_FAILURE() << "cannot open " << path;
-    }
-  }
+  explicit RawDatabase(const fs::path& path) { sqlite3_open(path.c_str(), &db_); }
   ~RawDatabase() { sqlite3_close_v2(db_); }
-  bool exec(const std::string& sql) {
-    char* message = nullptr;
-    int rc = sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &message);
-    if (rc != SQLITE_OK) lastError_ = message ? message : "error";
-    sqlite3_free(message);
-    return rc == SQLITE_OK;
-  }
+  bool exec(const std::string& sql) { return sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr) == SQLITE_OK; }
   // The first column of the first row, as text ("" when there is none).
   std::string scalar(const std::string& sql) {
     sqlite3_stmt* stmt = nullptr;
@@ -120,11 +108,9 @@ class RawDatabase {
     return out;
   }
   int64_t count(const std::string& table) { return std::stoll(scalar("SELECT count(*) FROM " + table)); }
-  const std::string& lastError() const { return lastError_; }
 
  private:
   sqlite3* db_ = nullptr;
-  std::string lastError_;
 };
 
 // --- A store in a temporary cache directory ---------------------------------

@@ -11,16 +11,13 @@
 namespace fbf::testing {
 namespace {
 
-std::string columns(RawDatabase& raw, const std::string& table) {
-  return raw.scalar("SELECT group_concat(name) FROM (SELECT name FROM pragma_table_info('" + table + "'))");
-}
 unsigned modeOf(const fs::path& p) {
   struct stat st {};
   EXPECT_EQ(stat(p.c_str(), &st), 0) << p;
   return st.st_mode & 0777;
 }
 
-// Guards against: a store invented without the Cohorts directory, a wrong collection start, markers not staged or not saved, or a file with the wrong schema or permissions.
+// Guards against: a store invented without the Cohorts directory, a wrong collection start, markers not staged, not saved or not reloaded as the newest of their type, or a file of the wrong version or permissions.
 using StoreBringUp = StoreFixture;
 
 TEST_F(StoreBringUp, WithoutTheCohortsDirectoryThereIsNoStoreAndNoDirectoryIsMade) {
@@ -42,7 +39,7 @@ TEST_F(StoreBringUp, CollectionStartIsTheDirectoryCreationTime) {
   EXPECT_LE(std::chrono::abs(store->collectionStartDate() - expected), std::chrono::microseconds(1));
 }
 
-TEST_F(StoreBringUp, TheFirstStagesOneMarkerPerFrequencyAndTheSecondLoadsThemSaved) {
+TEST_F(StoreBringUp, TheFirstStagesOneMarkerPerFrequencyAndTheNextLoadsTheNewestSaved) {
   makeCohortsDirectory();
   {
     LogCapture logs;
@@ -53,12 +50,15 @@ TEST_F(StoreBringUp, TheFirstStagesOneMarkerPerFrequencyAndTheSecondLoadsThemSav
       auto& aggregations = store->lastAggregations();
       ASSERT_EQ(aggregations.size(), 3u);
       for (auto f : kAllFlushFrequencies) {
-        ASSERT_TRUE(aggregations.count(f));
         EXPECT_EQ(aggregations[f]->type(), rawValue(f));
         EXPECT_EQ(aggregations[f]->timestamp(), store->collectionStartDate());
         EXPECT_EQ(aggregations[f]->rowid(), 0) << "staged, not saved yet";
       }
       aggregations[FlushFrequency::weekly]->setTimestamp(utcTime(2030, 1, 8));
+      for (int month : {4, 2}) {
+        VIRFlushEvent::createFlushEvent(store->eventFactory(), utcTime(2030, month, 1), FlushFrequency::monthly);
+      }
+      VIRFlushEvent::createFlushEvent(store->eventFactory(), utcTime(2030, 9, 1), FlushFrequency::daily);
     });
     EXPECT_EQ(RawDatabase(databasePath()).count("VIRFlushEvent"), 0);
     saveOrLogError(store->managedObjectContext());
@@ -67,21 +67,12 @@ TEST_F(StoreBringUp, TheFirstStagesOneMarkerPerFrequencyAndTheSecondLoadsThemSav
   onStore(*store, [&] {
     EXPECT_EQ(store->lastAggregations()[FlushFrequency::weekly]->timestamp(), utcTime(2030, 1, 8));
     EXPECT_NE(store->lastAggregations()[FlushFrequency::weekly]->rowid(), 0);
+    EXPECT_EQ(store->lastAggregations()[FlushFrequency::monthly]->timestamp(), utcTime(2030, 4, 1));
   });
   RawDatabase raw(databasePath());
-  EXPECT_EQ(raw.scalar("SELECT group_concat(type) FROM (SELECT type FROM VIRFlushEvent ORDER BY type)"), "0,1,2");
-}
-
-TEST_F(StoreBringUp, TheFileHasTheDocumentedTablesAndIsOwnerOnly) {
-  makeCohortsDirectory();
-  auto store = bringUpAndSettle();
-  ASSERT_NE(store, nullptr);
-  RawDatabase raw(databasePath());
+  EXPECT_EQ(raw.scalar("SELECT group_concat(type) FROM (SELECT type FROM VIRFlushEvent ORDER BY type)"), "0,0,1,2,2,2");
   EXPECT_EQ(raw.scalar("PRAGMA user_version"), "3");
   EXPECT_EQ(raw.scalar("PRAGMA journal_mode"), "wal");
-  EXPECT_EQ(columns(raw, "VIRUsageEvent"), "rowid,timestamp,usageCategory");
-  EXPECT_EQ(columns(raw, "VIRCategory"), "rowid,clientIntVal,usageEvent");
-  EXPECT_EQ(columns(raw, "VIRImagesSession"), "rowid,timestamp,image,querySuggestion,recentResult,zkw,other");
   EXPECT_EQ(modeOf(databasePath()), 0600u);
   EXPECT_EQ(modeOf(cohortsDir()), 0700u);
 }
@@ -89,69 +80,57 @@ TEST_F(StoreBringUp, TheFileHasTheDocumentedTablesAndIsOwnerOnly) {
 // Guards against: the store taking over, rewriting or migrating a file it cannot use instead of giving up with one clear line.
 TEST_F(StoreBringUp, AnUnusableFileYieldsNoStoreAndIsLeftAlone) {
   makeCohortsDirectory();
-  struct Row {
-    const char* name;
-    std::string sql;  // empty: 8 KiB of garbage
-    bool locked = false;
-  };
-  const Row rows[] = {
-      {"corrupt", ""},
+  const std::pair<const char*, std::string> rows[] = {
+      {"corrupt", ""},  // 8 KiB of garbage
       {"newer schema", "CREATE TABLE VIRFutureThing (x); PRAGMA user_version = 9;"},
       // A damaged header the cohorts fuzzer wrote; it used to index the
       // migrations out of bounds.
       {"impossible schema", "CREATE TABLE VIRFutureThing (x); PRAGMA user_version = -1325400064;"},
       {"foreign, unversioned", "CREATE TABLE notes (body TEXT); INSERT INTO notes VALUES ('keep me');"},
       // Another process using the file in rollback-journal mode.
-      {"locked by another process", "PRAGMA journal_mode=DELETE", true},
+      {"locked by another process", "PRAGMA journal_mode=DELETE"},
   };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
-    for (const char* suffix : {"", "-wal", "-shm", "-journal"}) fs::remove(databasePath().string() + suffix);
-    if (row.locked) saveOrLogError(bringUpAndSettle()->managedObjectContext());
-    if (row.sql.empty()) {
-      writeFile(databasePath(), std::string(8192, '\x5a'));
-    } else {
-      RawDatabase raw(databasePath());
-      ASSERT_TRUE(raw.exec(row.sql)) << raw.lastError();
-    }
+  for (const auto& [name, sql] : rows) {
+    SCOPED_TRACE(name);
+    const bool locked = sql.starts_with("PRAGMA journal_mode");
+    for (const char* suffix : {"", "-wal", "-shm"}) fs::remove(databasePath().string() + suffix);
+    if (locked) saveOrLogError(bringUpAndSettle()->managedObjectContext());
+    if (sql.empty()) writeFile(databasePath(), std::string(8192, '\x5a'));
+    ASSERT_TRUE(sql.empty() || RawDatabase(databasePath()).exec(sql));
     const std::string before = readFile(databasePath());
     RawDatabase holder(databasePath());
-    if (row.locked) { ASSERT_TRUE(holder.exec("BEGIN EXCLUSIVE")); }
+    ASSERT_TRUE(!locked || holder.exec("BEGIN EXCLUSIVE"));
     LogCapture logs;
     EXPECT_EQ(bringUp(), nullptr);
     EXPECT_EQ(readFile(databasePath()), before);
     EXPECT_FALSE(fs::exists(databasePath().string() + "-wal"));
     EXPECT_TRUE(logs.contains("Couldn't load the usage store")) << "one clear line says why";
-    if (row.locked) { ASSERT_TRUE(holder.exec("ROLLBACK")); }
+    ASSERT_TRUE(!locked || holder.exec("ROLLBACK"));
   }
 }
 
 // Guards against: a first-version file losing its rows or not reaching the current schema.
 TEST_F(StoreBringUp, AFirstVersionFileIsMigratedWithItsRowsKept) {
   makeCohortsDirectory();
-  std::string counters = "rowid INTEGER PRIMARY KEY, timestamp REAL";
-  for (const char* c : {"appLaunch", "onDeviceAddressBookData", "onDeviceOtherPersonalData", "punchout",
-                        "thirdPartyInAppContent", "vireon", "querySuggestion", "vexaSuggestions", "other"}) {
-    counters += std::string(", ") + c + " INTEGER NOT NULL DEFAULT 0";
-  }
-  {
-    RawDatabase raw(databasePath());
-    ASSERT_TRUE(raw.exec(R"sql(
+  auto table = [](const char* name, std::initializer_list<const char*> counters) {
+    std::string sql = std::string("CREATE TABLE ") + name + " (rowid INTEGER PRIMARY KEY, timestamp REAL";
+    for (const char* c : counters) sql += std::string(", ") + c + " INTEGER NOT NULL DEFAULT 0";
+    return sql + ");";
+  };
+  ASSERT_TRUE(RawDatabase(databasePath()).exec(
+      table("VIRScoutlumeSession", {"appLaunch", "onDeviceAddressBookData", "onDeviceOtherPersonalData", "punchout",
+                                    "thirdPartyInAppContent", "vireon", "querySuggestion", "vexaSuggestions", "other"}) +
+      table("VIRWayfinSession", {"goToSite", "localGoto", "localTap", "vireonGoto", "vireonTap",
+                                 "thirdPartyCompletionOrRecentSearch", "thirdPartyGoto", "thirdPartyTap", "other"}) +
+      R"sql(
 CREATE TABLE VIRUsageEvent (rowid INTEGER PRIMARY KEY, timestamp REAL, usageCategory INTEGER);
 CREATE TABLE VIRCategory (rowid INTEGER PRIMARY KEY, clientIntVal INTEGER, usageEvent INTEGER);
 CREATE TABLE VIRFlushEvent (rowid INTEGER PRIMARY KEY, timestamp REAL, type INTEGER);
-CREATE TABLE VIRWayfinSession (rowid INTEGER PRIMARY KEY, timestamp REAL, goToSite INTEGER NOT NULL DEFAULT 0,
-  localGoto INTEGER NOT NULL DEFAULT 0, localTap INTEGER NOT NULL DEFAULT 0, vireonGoto INTEGER NOT NULL DEFAULT 0,
-  vireonTap INTEGER NOT NULL DEFAULT 0, thirdPartyCompletionOrRecentSearch INTEGER NOT NULL DEFAULT 0,
-  thirdPartyGoto INTEGER NOT NULL DEFAULT 0, thirdPartyTap INTEGER NOT NULL DEFAULT 0, other INTEGER NOT NULL DEFAULT 0);
 INSERT INTO VIRUsageEvent VALUES (1, 1900000000, 1);
 INSERT INTO VIRCategory VALUES (1, 2, 1);
 INSERT INTO VIRFlushEvent VALUES (1, 1899990000, 0);
-PRAGMA user_version = 1;
-)sql" + ("CREATE TABLE VIRScoutlumeSession (" + counters + ");" +
-         "INSERT INTO VIRScoutlumeSession (timestamp, appLaunch) VALUES (1900000000, 3);")))
-        << raw.lastError();
-  }
+INSERT INTO VIRScoutlumeSession (timestamp, appLaunch) VALUES (1900000000, 3);
+PRAGMA user_version = 1;)sql"));
   auto store = bringUpAndSettle();
   ASSERT_NE(store, nullptr);
   onStore(*store, [&] {
@@ -167,41 +146,25 @@ PRAGMA user_version = 1;
   EXPECT_EQ(raw.scalar("SELECT appLaunch FROM VIRScoutlumeSession"), "3");
 }
 
-// Guards against: fetches that include a range's end or miss its start, come unsorted, mix clients, or pick an older flush event.
+// Guards against: fetches and purges that include or exclude a range's edge wrongly, come unsorted, mix clients, or remove categories.
 using StoreQueries = OpenStore;
 
 TEST_F(StoreQueries, SentinelsAreNewestFirstForTheirClientInTheHalfOpenRange) {
   SystemTime start = utcTime(2030, 5, 1), end = utcTime(2030, 5, 2);
-  for (SystemTime t : {start - seconds(1), start + hours(12), start, end}) {
-    addSentinel(corevireon::CV_CLIENT_NEWS, t);
-  }
+  for (SystemTime t : {start - seconds(1), start + hours(12), start, end}) addSentinel(corevireon::CV_CLIENT_NEWS, t);
   addSentinel(corevireon::CV_CLIENT_MESSAGING, start + hours(1));
   save();
   on([&] {
     auto& q = store->queryProcessor();
-    auto inRange = q.sessionSentinels(corevireon::CV_CLIENT_NEWS, DateInterval{start, end});
-    ASSERT_EQ(inRange.size(), 2u);
-    EXPECT_EQ(inRange[0]->timestamp(), start + hours(12));
-    EXPECT_EQ(inRange[1]->timestamp(), start);
-    std::vector<SystemTime> all;
+    std::vector<SystemTime> inRange, all;
+    for (const auto& e : q.sessionSentinels(corevireon::CV_CLIENT_NEWS, DateInterval{start, end})) {
+      inRange.push_back(*e->timestamp());
+    }
     for (const auto& e : q.sessionSentinels(corevireon::CV_CLIENT_NEWS, std::nullopt)) all.push_back(*e->timestamp());
+    EXPECT_EQ(inRange, (std::vector<SystemTime>{start + hours(12), start}));
     EXPECT_EQ(all, (std::vector<SystemTime>{end, start + hours(12), start, start - seconds(1)}));
     EXPECT_EQ(q.sessionSentinels(corevireon::CV_CLIENT_MESSAGING, std::nullopt).size(), 1u);
     EXPECT_TRUE(q.sessionSentinels(corevireon::CV_CLIENT_WEB_BROWSER, std::nullopt).empty());
-  });
-}
-
-TEST_F(StoreQueries, TheLastFlushEventIsTheNewestOfItsType) {
-  on([&] {
-    VIRFlushEvent::createFlushEvent(store->eventFactory(), utcTime(2030, 2, 1), FlushFrequency::monthly);
-    VIRFlushEvent::createFlushEvent(store->eventFactory(), utcTime(2030, 4, 1), FlushFrequency::monthly);
-    VIRFlushEvent::createFlushEvent(store->eventFactory(), utcTime(2030, 9, 1), FlushFrequency::daily);
-  });
-  save();
-  on([&] {
-    auto last = store->queryProcessor().lastFlushEvent(FlushFrequency::monthly);
-    ASSERT_NE(last, nullptr);
-    EXPECT_EQ(last->timestamp(), utcTime(2030, 4, 1));
   });
 }
 
@@ -214,14 +177,13 @@ TEST_F(StoreQueries, UsageSessionsAndColumnSumsCoverTheHalfOpenRange) {
   on([&] {
     EXPECT_EQ(store->queryProcessor().usageSessions<VIRWayfinSession>(start, end).size(), 2u);
     auto sums = store->queryProcessor().fetchColumnSums(VIRWayfinSession::kEntityName, start, end);
-    EXPECT_EQ(sums.size(), 9u);
-    EXPECT_EQ(sums["goToSite"], 2);
-    EXPECT_EQ(sums["other"], 4);
-    EXPECT_EQ(sums["localTap"], 0);
+    EXPECT_EQ(sums, (std::map<std::string, int64_t>{{"goToSite", 2}, {"localGoto", 0}, {"localTap", 0},
+                                                    {"other", 4}, {"thirdPartyCompletionOrRecentSearch", 0},
+                                                    {"thirdPartyGoto", 0}, {"thirdPartyTap", 0}, {"vireonGoto", 0},
+                                                    {"vireonTap", 0}}));
   });
 }
 
-// Guards against: a purge that keeps records at its date, removes later ones, or removes categories.
 TEST_F(StoreQueries, APurgeRemovesRecordsAtOrBeforeTheDateButNoCategories) {
   SystemTime date = utcTime(2030, 3, 1);
   for (SystemTime t : {date - hours(1), date, date + seconds(1)}) addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, t);
@@ -269,10 +231,7 @@ TEST_F(StoreSaving, AResetKeepsTheAggregationMarkersUsable) {
   // Unsaved markers are dropped by the reset and made anew; a later change
   // to them is saved.
   store->emptyRowCache();
-  on([&] {
-    ASSERT_EQ(store->lastAggregations().size(), 3u);
-    store->lastAggregations()[FlushFrequency::monthly]->setTimestamp(utcTime(2030, 8, 1));
-  });
+  setMarker(FlushFrequency::monthly, utcTime(2030, 8, 1));
   save();
   store->emptyRowCache();
   EXPECT_EQ(marker(FlushFrequency::monthly), utcTime(2030, 8, 1));
@@ -296,22 +255,13 @@ TEST_F(StoreSaving, AFailedSaveIsLoggedAndKeepsTheChangesStaged) {
   ASSERT_TRUE(holder.exec("ROLLBACK"));
   on([&] { EXPECT_TRUE(store->managedObjectContext().hasChanges()); });
   save();
-  EXPECT_EQ(holder.count("VIRUsageEvent"), 1);
-  EXPECT_EQ(holder.count("VIRCategory"), 1);
+  EXPECT_EQ(holder.count("VIRUsageEvent") + holder.count("VIRCategory"), 2);
 }
 
 // Guards against: records reachable from a thread other than the store's own queue.
-TEST(StoreQueue, RecordAccessOffTheStoreQueueStopsTheProcess) {
+TEST_F(StoreSaving, RecordAccessOffTheStoreQueueStopsTheProcess) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_DEATH(
-      {
-        ScopedTimeZone zone("UTC");
-        TestEnvironment env;
-        fs::create_directories(env.cacheDir() / "Cohorts");
-        auto store = ObjectGraphStorageContainer::make(*env.fileManager, [] { return SystemTime{}; }, {});
-        store->eventFactory().createFlushEvent();
-      },
-      "only reachable from the store's own queue");
+  EXPECT_DEATH(store->eventFactory().createFlushEvent(), "only reachable from the store's own queue");
 }
 
 }  // namespace
