@@ -11,52 +11,45 @@
 namespace fbf::testing {
 namespace {
 
-SystemTime at(const std::array<int, 4>& d) { return localTime(d[0], d[1], d[2], d[3]); }
+struct Place {
+  const char *zone, *locale;
+};
+const Place kNewYork{"America/New_York", "en_US"}, kBerlin{"Europe/Berlin", "de_DE"},
+    kChicago{"America/Chicago", "en_US"};
 
-// Guards against: a capture range that starts or ends off local midnight, has the wrong length across a daylight-saving change or a leap month, or a week that ignores its locale's rule.
+// Guards against: a capture range that starts or ends off local midnight, has the wrong length across a daylight-saving change or a leap month, or a week that ignores its locale's rule (ISO weeks in Germany, Sunday weeks with week 1 holding 1 January in the US).
 TEST(CaptureRanges, StartAndEndAtLocalMidnightsAndCountCalendarDays) {
+  using F = FlushFrequency;
   const struct {
     const char* name;
-    const char *zone, *locale;
+    Place place;
     FlushFrequency frequency;
-    std::array<int, 4> when, start, end;  // year, month, day, hour
+    std::array<int, 4> when;  // year, month, day, hour
+    std::array<int, 3> start, end;
     int64_t days, hours;
   } rows[] = {
-      {"a plain day", "America/New_York", "en_US", FlushFrequency::daily, {2030, 6, 1, 0}, {2030, 6, 1, 0},
-       {2030, 6, 2, 0}, 1, 24},
-      {"the spring-forward day", "America/New_York", "en_US", FlushFrequency::daily, {2030, 3, 10, 15},
-       {2030, 3, 10, 0}, {2030, 3, 11, 0}, 1, 23},
-      {"the fall-back day", "America/New_York", "en_US", FlushFrequency::daily, {2030, 11, 3, 1}, {2030, 11, 3, 0},
-       {2030, 11, 4, 0}, 1, 25},
-      {"leap February", "America/New_York", "en_US", FlushFrequency::monthly, {2028, 2, 29, 23}, {2028, 2, 1, 0},
-       {2028, 3, 1, 0}, 29, 29 * 24},
-      {"plain February", "America/New_York", "en_US", FlushFrequency::monthly, {2029, 2, 14, 0}, {2029, 2, 1, 0},
-       {2029, 3, 1, 0}, 28, 28 * 24},
-      {"a month across the spring forward", "America/New_York", "en_US", FlushFrequency::monthly, {2030, 3, 20, 0},
-       {2030, 3, 1, 0}, {2030, 4, 1, 0}, 31, 31 * 24 - 1},
-      {"a Sunday week across the fall back", "America/New_York", "en_US", FlushFrequency::weekly, {2030, 11, 5, 0},
-       {2030, 11, 3, 0}, {2030, 11, 10, 0}, 7, 7 * 24 + 1},
-      // ISO weeks (Monday, 4 days) in Germany.
-      {"ISO week 53 in its first year", "Europe/Berlin", "de_DE", FlushFrequency::weekly, {2020, 12, 31, 12},
-       {2020, 12, 28, 0}, {2021, 1, 4, 0}, 7, 7 * 24},
-      {"ISO week 53 in its second year", "Europe/Berlin", "de_DE", FlushFrequency::weekly, {2021, 1, 3, 23},
-       {2020, 12, 28, 0}, {2021, 1, 4, 0}, 7, 7 * 24},
-      {"ISO week 1 after it", "Europe/Berlin", "de_DE", FlushFrequency::weekly, {2021, 1, 4, 0}, {2021, 1, 4, 0},
-       {2021, 1, 11, 0}, 7, 7 * 24},
-      // Sunday weeks with week 1 holding 1 January in the US.
-      {"US week 53", "America/Chicago", "en_US", FlushFrequency::weekly, {2016, 12, 31, 22}, {2016, 12, 25, 0},
-       {2017, 1, 1, 0}, 7, 7 * 24},
-      {"US week 1", "America/Chicago", "en_US", FlushFrequency::weekly, {2017, 1, 1, 0}, {2017, 1, 1, 0},
-       {2017, 1, 8, 0}, 7, 7 * 24},
+      {"a plain day", kNewYork, F::daily, {2030, 6, 1, 0}, {2030, 6, 1}, {2030, 6, 2}, 1, 24},
+      {"the spring-forward day", kNewYork, F::daily, {2030, 3, 10, 15}, {2030, 3, 10}, {2030, 3, 11}, 1, 23},
+      {"the fall-back day", kNewYork, F::daily, {2030, 11, 3, 1}, {2030, 11, 3}, {2030, 11, 4}, 1, 25},
+      {"leap February", kNewYork, F::monthly, {2028, 2, 29, 23}, {2028, 2, 1}, {2028, 3, 1}, 29, 29 * 24},
+      {"plain February", kNewYork, F::monthly, {2029, 2, 14, 0}, {2029, 2, 1}, {2029, 3, 1}, 28, 28 * 24},
+      {"a month across the spring forward", kNewYork, F::monthly, {2030, 3, 20, 0}, {2030, 3, 1}, {2030, 4, 1}, 31,
+       31 * 24 - 1},
+      {"a week across the fall back", kNewYork, F::weekly, {2030, 11, 5, 0}, {2030, 11, 3}, {2030, 11, 10}, 7, 169},
+      {"ISO week 53 in its first year", kBerlin, F::weekly, {2020, 12, 31, 12}, {2020, 12, 28}, {2021, 1, 4}, 7, 168},
+      {"ISO week 53 in its second year", kBerlin, F::weekly, {2021, 1, 3, 23}, {2020, 12, 28}, {2021, 1, 4}, 7, 168},
+      {"ISO week 1 after it", kBerlin, F::weekly, {2021, 1, 4, 0}, {2021, 1, 4}, {2021, 1, 11}, 7, 168},
+      {"US week 53", kChicago, F::weekly, {2016, 12, 31, 22}, {2016, 12, 25}, {2017, 1, 1}, 7, 168},
+      {"US week 1", kChicago, F::weekly, {2017, 1, 1, 0}, {2017, 1, 1}, {2017, 1, 8}, 7, 168},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
-    ScopedTimeZone zone(row.zone);
-    CohortCalendar calendar(row.zone, row.locale);
-    auto range = calendar.containingCaptureRange(row.frequency, at(row.when));
+    ScopedTimeZone zone(row.place.zone);
+    CohortCalendar calendar(row.place.zone, row.place.locale);
+    auto range = calendar.containingCaptureRange(row.frequency, localTime(row.when[0], row.when[1], row.when[2], row.when[3]));
     ASSERT_TRUE(range);
-    EXPECT_EQ(range->start, at(row.start));
-    EXPECT_EQ(range->end, at(row.end));
+    EXPECT_EQ(range->start, localTime(row.start[0], row.start[1], row.start[2]));
+    EXPECT_EQ(range->end, localTime(row.end[0], row.end[1], row.end[2]));
     EXPECT_EQ(calendar.wholeDays(range->start, range->end), row.days);
     EXPECT_EQ(calendar.wholeHours(range->start, range->end), row.hours);
     EXPECT_EQ(range->end - range->start, hours(row.hours));
@@ -113,38 +106,35 @@ TEST(PeriodsAcrossRuns, ChainWithoutOverlapOrGapAndCountCalendarDays) {
   using F = FlushFrequency;
   struct Row {
     const char* name;
-    const char *zone1, *locale1, *zone2, *locale2;
+    Place first, second;
     FlushFrequency frequency;
-    int year, month, day;         // a date of the first run's period, at noon in zone1
+    int year, month, day;         // a date of the first run's period, at noon in its zone
     std::array<int64_t, 3> days;  // whole days of the first, second and third period
   };
+  const Place london{"Europe/London", "en_GB"}, londonUs{"Europe/London", "en_US"}, chicagoDe{"America/Chicago", "de_DE"},
+      tokyo{"Asia/Tokyo", "ja_JP"}, saoPaulo{"America/Sao_Paulo", "pt_BR"}, santiago{"America/Santiago", "en_US"},
+      havana{"America/Havana", "es_CU"}, beirut{"Asia/Beirut", "en_US"};
   const Row rows[] = {
-      {"Monday weeks, then Sunday weeks", "Europe/London", "en_GB", "Europe/London", "en_US", F::weekly, 2030, 6, 5,
-       {7, 6, 7}},
-      {"Sunday weeks, then Monday weeks", "America/Chicago", "en_US", "America/Chicago", "de_DE", F::weekly, 2030, 6,
-       5, {7, 1, 7}},
-      {"New York days, then Tokyo days", "America/New_York", "en_US", "Asia/Tokyo", "ja_JP", F::daily, 2030, 6, 5,
-       {1, 1, 1}},
-      {"Sao Paulo skips the midnight of 4 November 2018", "America/Sao_Paulo", "pt_BR", "America/Sao_Paulo", "pt_BR",
-       F::daily, 2018, 11, 3, {1, 1, 1}},
-      {"Santiago skips the midnight starting the week of 8 September 2030", "America/Santiago", "en_US",
-       "America/Santiago", "en_US", F::weekly, 2030, 9, 4, {7, 7, 7}},
-      {"Havana skips the midnight of 10 March 2030", "America/Havana", "es_CU", "America/Havana", "es_CU", F::daily,
-       2030, 3, 9, {1, 1, 1}},
-      {"Beirut skips the midnight starting the week of 31 March 2030", "Asia/Beirut", "en_US", "Asia/Beirut", "en_US",
-       F::weekly, 2030, 3, 27, {7, 7, 7}},
+      {"Monday weeks, then Sunday weeks", london, londonUs, F::weekly, 2030, 6, 5, {7, 6, 7}},
+      {"Sunday weeks, then Monday weeks", kChicago, chicagoDe, F::weekly, 2030, 6, 5, {7, 1, 7}},
+      {"New York days, then Tokyo days", kNewYork, tokyo, F::daily, 2030, 6, 5, {1, 1, 1}},
+      {"Sao Paulo skips the midnight of 4 November 2018", saoPaulo, saoPaulo, F::daily, 2018, 11, 3, {1, 1, 1}},
+      {"Santiago skips the midnight starting the week of 8 September", santiago, santiago, F::weekly, 2030, 9, 4,
+       {7, 7, 7}},
+      {"Havana skips the midnight of 10 March 2030", havana, havana, F::daily, 2030, 3, 9, {1, 1, 1}},
+      {"Beirut skips the midnight starting the week of 31 March", beirut, beirut, F::weekly, 2030, 3, 27, {7, 7, 7}},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
     std::optional<DateInterval> first;
     {
-      ScopedTimeZone zone(row.zone1);
-      CohortCalendar calendar(row.zone1, row.locale1);
+      ScopedTimeZone zone(row.first.zone);
+      CohortCalendar calendar(row.first.zone, row.first.locale);
       first = calendar.containingCaptureRange(row.frequency, localTime(row.year, row.month, row.day, 12));
       ASSERT_TRUE(first);
       EXPECT_EQ(calendar.wholeDays(first->start, first->end), row.days[0]);
     }
-    CohortCalendar calendar(row.zone2, row.locale2);
+    CohortCalendar calendar(row.second.zone, row.second.locale);
     auto second = calendar.periodAfter(row.frequency, first->end);
     ASSERT_TRUE(second);
     auto third = calendar.periodAfter(row.frequency, second->end);

@@ -67,49 +67,6 @@ TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecordButNewsOnlyA
             "4");
 }
 
-TEST_F(UsageCounting, SessionsThatDoNotQualifyCountNothing) {
-  struct Row {
-    const char* name;
-    const char* agent;
-    bool search;
-    std::function<void(CVClientSession&)> add;
-  };
-  const Row cases[] = {
-      {"a browser session without a search", "wayfin", false, [](auto& s) { addDidGoToSite(s); }},
-      // Previews in the system search surface are not engagements.
-      {"only a preview and an engagement elsewhere", "scoutlume", true,
-       [](auto& s) {
-         addResultEngagement(s, ResultSpec{}, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER);
-         addResultEngagement(s, ResultSpec{}, CV_TRIGGER_ENGAGEMENT_EVENT_TAP, 1);
-       }},
-      {"an unknown agent", "SomeOtherApp/1", true, [](auto& s) { addResultEngagement(s, ResultSpec{}); }},
-      {"keystrokeless search starts", "scoutlume", false,
-       [](auto& s) {
-         addItem(s)->mutable_startlocalsearch();
-         auto* network = addItem(s)->mutable_startnetworksearch();
-         network->set_input("typed");
-         network->set_endpoint(12);
-         addResultEngagement(s, ResultSpec{});
-       }},
-  };
-  for (const auto& row : cases) {
-    SCOPED_TRACE(row.name);
-    auto s = row.search ? searched(row.agent) : makeSession(row.agent, start);
-    row.add(s);
-    report(s);
-    EXPECT_EQ(rows("VIRUsageEvent"), 0);
-    EXPECT_EQ(rows(kWayfin) + rows(kScoutlume) + rows(kImages), 0);
-    // The save still wrote the aggregation markers staged at bring-up.
-    EXPECT_EQ(rows("VIRFlushEvent"), 3);
-    on([&] { EXPECT_FALSE(store->managedObjectContext().hasChanges()); });
-  }
-  // A messages session counts without a search.
-  auto messages = makeSession("messages", start);
-  addResultEngagement(messages, ResultSpec{});
-  report(messages);
-  EXPECT_EQ(clients(), "3");
-}
-
 TEST(UsageRule, OnFlags) {
   EXPECT_FALSE(UsageProcessor::session(true, false, corevireon::CV_CLIENT_MESSAGING));
   EXPECT_TRUE(UsageProcessor::session(false, true, corevireon::CV_CLIENT_MESSAGING));
@@ -123,21 +80,39 @@ TEST(UsageRule, OnFlags) {
 ResultSpec section(int32_t code) { return ResultSpec{.knownSectionBundleIdentifier = code}; }
 ResultSpec bundle(int32_t code) { return ResultSpec{.knownResultBundleId = code}; }
 
-TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagement) {
+// Each row is one session of a surface, searched unless said otherwise; a
+// row expecting no record is a session that must count nothing at all.
+TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagementAndNothingElseCounts) {
   using Add = std::function<void(CVClientSession&)>;
   auto engage = [](ResultSpec r, corevireon::CVTriggerEngagementEvent t = CV_TRIGGER_ENGAGEMENT_EVENT_TAP) -> Add {
     return [r, t](CVClientSession& s) { addResultEngagement(s, r, t); };
   };
   const Add noResult = [](CVClientSession& s) { addResultEngagement(s, std::nullopt); };
   const Add goToSite = addDidGoToSite, goToSearch = addDidGoToSearch;
+  // Previews in the system search surface are not engagements, nor are
+  // engagements with another destination.
+  const Add previewAndElsewhere = [](CVClientSession& s) {
+    addResultEngagement(s, ResultSpec{}, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER);
+    addResultEngagement(s, ResultSpec{}, CV_TRIGGER_ENGAGEMENT_EVENT_TAP, 1);
+  };
+  const Add keystrokeless = [](CVClientSession& s) {
+    addItem(s)->mutable_startlocalsearch();
+    auto* network = addItem(s)->mutable_startnetworksearch();
+    network->set_input("typed");
+    network->set_endpoint(12);
+    addResultEngagement(s, ResultSpec{});
+  };
   const ResultSpec local{.isLocalApplicationResult = true}, punchout{.punchout = true};
   const auto ret = CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY;
+  const char* none = "records: 0";
   const struct {
     const char* agent;
     Add add;
     const char* entity;
     const char* expected;
+    bool search = true;
   } cases[] = {
+      {"SomeOtherApp/1", engage(ResultSpec{}), kWayfin, none},
       {"scoutlume", goToSearch, kScoutlume, "vireon=1"},
       {"scoutlume", noResult, kScoutlume, "other=1"},
       {"scoutlume", engage(bundle(66)), kScoutlume, "querySuggestion=1"},
@@ -149,7 +124,10 @@ TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagement) {
       {"scoutlume", engage(section(100)), kScoutlume, "vireon=1"},
       {"scoutlume", engage(punchout), kScoutlume, "punchout=1"},
       {"scoutlume", engage(section(7)), kScoutlume, "other=1"},
+      {"scoutlume", previewAndElsewhere, kScoutlume, none},
+      {"scoutlume", keystrokeless, kScoutlume, none, false},
       {"wayfin", goToSite, kWayfin, "goToSite=1"},
+      {"wayfin", goToSite, kWayfin, none, false},
       {"wayfin", goToSearch, kWayfin, "thirdPartyGoto=1"},
       {"wayfin", noResult, kWayfin, "other=1"},
       {"wayfin", engage(bundle(44)), kWayfin, "thirdPartyCompletionOrRecentSearch=1"},
@@ -163,15 +141,21 @@ TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagement) {
       {"messages", engage(bundle(86)), kImages, "querySuggestion=1"},
       {"messages", engage(section(101)), kImages, "zkw=1"},
       {"messages", engage(section(5)), kImages, "image=1"},
+      {"messages", engage(section(5)), kImages, "image=1", false},
       {"messages", engage(ResultSpec{.identifier = std::nullopt}), kImages, "other=1"},
       {"messages", noResult, kImages, "other=1"},
   };
   for (const auto& row : cases) {
-    SCOPED_TRACE(std::string(row.agent) + " " + row.expected);
-    auto s = searched(row.agent);
+    SCOPED_TRACE(std::string(row.agent) + " " + row.expected + (row.search ? "" : " without a search"));
+    auto s = row.search ? searched(row.agent) : makeSession(row.agent, start);
     row.add(s);
     report(s);
     EXPECT_EQ(counters(row.entity), row.expected);
+    EXPECT_EQ(rows("VIRUsageEvent"), row.expected == none ? 0 : 1);
+    // The save still wrote the aggregation markers staged at bring-up (the
+    // first purge takes them).
+    EXPECT_EQ(rows("VIRFlushEvent"), &row == &cases[0] ? 3 : 0);
+    on([&] { EXPECT_FALSE(store->managedObjectContext().hasChanges()); });
     store->purgeEventsOlderThan(start);
     on([] {});
   }

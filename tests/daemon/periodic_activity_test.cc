@@ -108,15 +108,6 @@ TEST_F(PeriodicRun, EveryRunFinishesAndExitsTenSecondsLaterUnlessToldToStay) {
   }
 }
 
-TEST_F(PeriodicRun, CheckInDoesNothingButTheOverride) {
-  bag();
-  auto a = activity(ActivityState::continueRunning);
-  doPeriodicConduitActivity(a, env.assembly(), recorder.hooks());
-  env.manualQueue->drain();
-  EXPECT_EQ(recorder.flushes + recorder.exits, 0);
-  EXPECT_EQ(a->state(), ActivityState::continueRunning);
-}
-
 TEST_F(PeriodicRun, GoingOnBatteryDefersTheRunningFlush) {
   bag();
   env.defaults().setObject("FBFNoExit", true);
@@ -131,7 +122,7 @@ TEST_F(PeriodicRun, GoingOnBatteryDefersTheRunningFlush) {
   EXPECT_EQ(a->state(), ActivityState::done);
 }
 
-// Guards against: a due run skipped or repeated, a recent run not waited for, a run on battery, or an unreadable last-run record blocking flushes.
+// Guards against: a due run skipped or repeated, a flush at check-in, a recent run not waited for, a run on battery, or an unreadable last-run record blocking flushes.
 class Scheduling : public PeriodicRun {
  protected:
   std::shared_ptr<testing::ManualQueue> queue = std::make_shared<testing::ManualQueue>("activity");
