@@ -85,17 +85,6 @@ TEST_F(CohortSchedule, ADayIsNeverDueInItsFirstHourAndAlwaysADayLater) {
   EXPECT_FALSE(shouldAggregate(FlushFrequency::weekly)) << "a frequency without a marker";
 }
 
-TEST_F(CohortSchedule, TheCoinRateAtHHoursIsHOver24) {
-  SystemTime today = localTime(2030, 6, 10, 12);
-  makeScheduler(today, 20240601);
-  constexpr int kDraws = 24000;
-  for (int h : {1, 6, 12, 18, 23}) {
-    int heads = 0;
-    for (int i = 0; i < kDraws; ++i) heads += scheduler->flipAgeWeightedCoin(today - hours(h)) ? 1 : 0;
-    EXPECT_NEAR(static_cast<double>(heads) / kDraws, h / 24.0, 0.015) << h << " hours";
-  }
-}
-
 TEST_F(CohortSchedule, ThreeSkippedDaysGiveUpToThreeDailyPeriods) {
   bool sawTwo = false, sawThree = false;
   for (uint64_t seed = 0; seed < 40; ++seed) {
@@ -152,16 +141,6 @@ TEST_F(CohortSchedule, AGeneratorThatDoesNotAdvanceStopsThePassWithAnError) {
   scheduler.doPeriodicUsageCalculations();
   EXPECT_EQ(recorder->periods.size(), 3u) << "one attempt per frequency";
   EXPECT_EQ(logs.count("did not advance frequency"), 3u);
-}
-
-TEST_F(CohortSchedule, TodayAndEagernessComeFromTheAssembly) {
-  env.clock->set(localTime(2031, 2, 3, 4));
-  env.assembly().setFlushingEagerly(true);
-  CohortScheduler fromAssembly(env.assembly(), *store, std::make_shared<SeededRandomSource>(3));
-  EXPECT_EQ(fromAssembly.today(), localTime(2031, 2, 3, 4));
-  EXPECT_TRUE(fromAssembly.isFlushingEagerly());
-  env.clock->advance(hours(48));
-  EXPECT_EQ(fromAssembly.today(), localTime(2031, 2, 3, 4)) << "fixed at construction";
 }
 
 }  // namespace

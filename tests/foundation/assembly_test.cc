@@ -95,15 +95,5 @@ TEST(CleanExit, WaitsForTheLastOpenTransactionAndHappensOnce) {
   EXPECT_EQ(exits, 2) << "at once when nothing is open";
 }
 
-// Guards against: a dropped file not reported, or reported with its fields mixed up.
-TEST(DeletionEvents, AssemblySendsTheFeedbackLossEvent) {
-  TestEnvironment env;
-  env.assembly().didDeleteFeedbackFile(FeedbackDeletionEvent{12, 1, 3, 40});
-  auto events = env.analytics->events();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].first, "vireond.feedbackLoss");
-  EXPECT_EQ(events[0].second, (nlohmann::json{{"feedbackType", 12}, {"reason", 1}, {"size", 3}, {"age", 40}}));
-}
-
 }  // namespace
 }  // namespace fbf

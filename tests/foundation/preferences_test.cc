@@ -23,7 +23,7 @@ class PreferencesFiles : public ::testing::Test {
   fs::path file(const std::string& name) { return env.preferences->fileForDomain(name); }
 };
 
-TEST_F(PreferencesFiles, XmlAndBinaryFilesAreReadOnEveryUse) {
+TEST_F(PreferencesFiles, XmlAndBinaryFilesAreReadOnEveryUseAndWrittenBack) {
   PropertyList values = {{"FBFNoExit", true}, {"FlushFrequencyInSeconds", 3600}, {"VIRDebugParameters", "v=3"}};
   writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::xml));
   auto d = domain("vireond");
@@ -36,12 +36,8 @@ TEST_F(PreferencesFiles, XmlAndBinaryFilesAreReadOnEveryUse) {
   writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::binary));
   EXPECT_FALSE(d->boolForKey("FBFNoExit"));
   EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 3600);
-}
-
-TEST_F(PreferencesFiles, NegativeIntegersSurviveTheRoundTrip) {
-  auto d = domain("vireond");
   ASSERT_TRUE(d->setObject("FlushFrequencyInSeconds", -5));
-  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), -5);
+  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), -5) << "negative integers survive the round trip";
 }
 
 TEST_F(PreferencesFiles, MissingMalformedOrMistypedValuesReadAsDefaults) {
@@ -51,11 +47,9 @@ TEST_F(PreferencesFiles, MissingMalformedOrMistypedValuesReadAsDefaults) {
     size_t errorLines;
   } rows[] = {
       {"no file", std::nullopt, 0},
-      {"wrong value types", serializePropertyList({{"FBFNoExit", PropertyList::array({1})},
-                                                   {"FlushFrequencyInSeconds", "soon"},
-                                                   {"VIRDebugParameters", 12}},
-                                                  PropertyListFormat::xml),
-       0},
+      {"wrong value types",
+       serializePropertyList({{"FBFNoExit", PropertyList::array({1})}, {"FlushFrequencyInSeconds", "soon"},
+                              {"VIRDebugParameters", 12}}, PropertyListFormat::xml), 0},
       {"malformed", "<?xml version=\"1.0\"?><plist><dict><key>FBFNoExit</key><true/>", 1},
   };
   for (const auto& row : rows) {
@@ -85,7 +79,10 @@ TEST_F(PreferencesFiles, WritesAreOwnerOnlyAndKeepOtherKeys) {
 // Guards against: a bag read once and cached, a malformed or linked bag taken as configuration, or a mistyped value passed through.
 class BagFiles : public PreferencesFiles {};
 
-TEST_F(BagFiles, TypedAccessorsAndMissingKeys) {
+TEST_F(BagFiles, TypedAccessorsAndMissingKeysReadAnewOnEveryAccess) {
+  writeFile(env.cacheDir() / "bag.plist",
+            serializePropertyList({{"feedback_max_age_in_days", 2}}, PropertyListFormat::binary));
+  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 2);
   env.writeBag({{"feedback_url", "https://127.0.0.1:1/fb"},
                 {"feedback_max_age_in_days", 3},
                 {"max_custom_feedback_sizes", {{"UserReport", 100}, {"Crowdsourcing", "big"}, {"Usage", -1}}},
@@ -98,14 +95,6 @@ TEST_F(BagFiles, TypedAccessorsAndMissingKeys) {
   EXPECT_EQ(bag->vireonFeedbackFormat(), "FeedbackV2PB");
   EXPECT_FALSE(bag->crowdsourcingURL());
   EXPECT_FALSE(bag->cohortsLookbackInDays());
-}
-
-TEST_F(BagFiles, BinaryBagIsReadAnewOnEveryAccess) {
-  writeFile(env.cacheDir() / "bag.plist",
-            serializePropertyList({{"feedback_max_age_in_days", 2}}, PropertyListFormat::binary));
-  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 2);
-  env.writeBag({{"feedback_max_age_in_days", 9}});
-  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 9);
 }
 
 TEST_F(BagFiles, AMissingMalformedNonDictionaryOrSymlinkedBagIsNoBag) {
