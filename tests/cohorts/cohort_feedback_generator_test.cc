@@ -252,7 +252,7 @@ TEST_F(CohortEnvelopes, TheCohortFlushAggregatesDueDaysIntoFilesAndPurgesOnlyWha
             "0");
 
   auto session = makeSession("Messages", localTime(2030, 6, 1, 8));
-  addResultEngagement(session, ResultSpec{});
+  addResultEngagement(session, ResultFields{});
   flush.usageEventSink()->reportUsageEvents(session);
   EXPECT_EQ(rows("VIRImagesSession"), 1);
   flush.resetRowCache();

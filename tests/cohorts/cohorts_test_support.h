@@ -65,23 +65,23 @@ inline void addSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_star
 inline void addDidGoToSite(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosite(); }
 inline void addDidGoToSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosearch(); }
 
-struct ResultSpec {
+struct ResultFields {
   std::optional<std::string> identifier = "r1";
   int32_t knownResultBundleId = 0, knownSectionBundleIdentifier = 0;
   bool isLocalApplicationResult = false, punchout = false;
 };
 
-inline corevireon::CVSearchResultForFeedback makeResult(const ResultSpec& spec) {
+inline corevireon::CVSearchResultForFeedback makeResult(const ResultFields& fields) {
   corevireon::CVSearchResultForFeedback r;
-  if (spec.identifier) r.set_identifier(*spec.identifier);
-  r.set_knownresultbundleid(spec.knownResultBundleId);
-  r.set_knownsectionbundleidentifier(spec.knownSectionBundleIdentifier);
-  r.set_islocalapplicationresult(spec.isLocalApplicationResult);
-  if (spec.punchout) r.mutable_punchout()->set_bundleidentifier("com.example.app");
+  if (fields.identifier) r.set_identifier(*fields.identifier);
+  r.set_knownresultbundleid(fields.knownResultBundleId);
+  r.set_knownsectionbundleidentifier(fields.knownSectionBundleIdentifier);
+  r.set_islocalapplicationresult(fields.isLocalApplicationResult);
+  if (fields.punchout) r.mutable_punchout()->set_bundleidentifier("com.example.app");
   return r;
 }
 
-inline void addResultEngagement(corevireon::CVClientSession& s, std::optional<ResultSpec> result,
+inline void addResultEngagement(corevireon::CVClientSession& s, std::optional<ResultFields> result,
                                 corevireon::CVTriggerEngagementEvent trigger = corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP,
                                 int32_t destination = 0) {
   auto* e = addItem(s)->mutable_resultengagement();

@@ -58,7 +58,7 @@ class UsageCounting : public OpenStore {
 TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecordButNewsOnlyASentinel) {
   for (const char* agent : {"Wayfin/17.0", "ScoutLume/3", "Messages/2", "NewsReader/5"}) {
     auto s = searched(agent);
-    addResultEngagement(s, ResultSpec{});
+    addResultEngagement(s, ResultFields{});
     report(s);
   }
   EXPECT_EQ(clients(), "1,2,3,4");
@@ -67,6 +67,7 @@ TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecordButNewsOnlyA
             "4");
 }
 
+// Guards against: the rule that a session counts swapping its search and engagement flags or ignoring its client.
 TEST(UsageRule, OnFlags) {
   EXPECT_FALSE(UsageProcessor::session(true, false, corevireon::CV_CLIENT_MESSAGING));
   EXPECT_TRUE(UsageProcessor::session(false, true, corevireon::CV_CLIENT_MESSAGING));
@@ -77,14 +78,14 @@ TEST(UsageRule, OnFlags) {
 
 // --- Every counter is reachable -------------------------------------------
 
-ResultSpec section(int32_t code) { return ResultSpec{.knownSectionBundleIdentifier = code}; }
-ResultSpec bundle(int32_t code) { return ResultSpec{.knownResultBundleId = code}; }
+ResultFields section(int32_t code) { return ResultFields{.knownSectionBundleIdentifier = code}; }
+ResultFields bundle(int32_t code) { return ResultFields{.knownResultBundleId = code}; }
 
 // Each row is one session of a surface, searched unless said otherwise; a
 // row expecting no record is a session that must count nothing at all.
 TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagementAndNothingElseCounts) {
   using Add = std::function<void(CVClientSession&)>;
-  auto engage = [](ResultSpec r, corevireon::CVTriggerEngagementEvent t = CV_TRIGGER_ENGAGEMENT_EVENT_TAP) -> Add {
+  auto engage = [](ResultFields r, corevireon::CVTriggerEngagementEvent t = CV_TRIGGER_ENGAGEMENT_EVENT_TAP) -> Add {
     return [r, t](CVClientSession& s) { addResultEngagement(s, r, t); };
   };
   const Add noResult = [](CVClientSession& s) { addResultEngagement(s, std::nullopt); };
@@ -92,17 +93,17 @@ TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagementAndNothingElseCounts) 
   // Previews in the system search surface are not engagements, nor are
   // engagements with another destination.
   const Add previewAndElsewhere = [](CVClientSession& s) {
-    addResultEngagement(s, ResultSpec{}, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER);
-    addResultEngagement(s, ResultSpec{}, CV_TRIGGER_ENGAGEMENT_EVENT_TAP, 1);
+    addResultEngagement(s, ResultFields{}, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER);
+    addResultEngagement(s, ResultFields{}, CV_TRIGGER_ENGAGEMENT_EVENT_TAP, 1);
   };
   const Add keystrokeless = [](CVClientSession& s) {
     addItem(s)->mutable_startlocalsearch();
     auto* network = addItem(s)->mutable_startnetworksearch();
     network->set_input("typed");
     network->set_endpoint(12);
-    addResultEngagement(s, ResultSpec{});
+    addResultEngagement(s, ResultFields{});
   };
-  const ResultSpec local{.isLocalApplicationResult = true}, punchout{.punchout = true};
+  const ResultFields local{.isLocalApplicationResult = true}, punchout{.punchout = true};
   const auto ret = CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY;
   const char* none = "records: 0";
   const struct {
@@ -112,7 +113,7 @@ TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagementAndNothingElseCounts) 
     const char* expected;
     bool search = true;
   } cases[] = {
-      {"SomeOtherApp/1", engage(ResultSpec{}), kWayfin, none},
+      {"SomeOtherApp/1", engage(ResultFields{}), kWayfin, none},
       {"scoutlume", goToSearch, kScoutlume, "vireon=1"},
       {"scoutlume", noResult, kScoutlume, "other=1"},
       {"scoutlume", engage(bundle(66)), kScoutlume, "querySuggestion=1"},
@@ -142,7 +143,7 @@ TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagementAndNothingElseCounts) 
       {"messages", engage(section(101)), kImages, "zkw=1"},
       {"messages", engage(section(5)), kImages, "image=1"},
       {"messages", engage(section(5)), kImages, "image=1", false},
-      {"messages", engage(ResultSpec{.identifier = std::nullopt}), kImages, "other=1"},
+      {"messages", engage(ResultFields{.identifier = std::nullopt}), kImages, "other=1"},
       {"messages", noResult, kImages, "other=1"},
   };
   for (const auto& row : cases) {
@@ -165,10 +166,10 @@ TEST_F(UsageCounting, ImagesLookUpTheEngagedResultAmongTheSessionsResults) {
   auto s = makeSession("messages", start);
   // The engagement names only the identifier; the shown result says it was
   // a zero-keyword suggestion.
-  addResultEngagement(s, ResultSpec{.identifier = "img-7"});
+  addResultEngagement(s, ResultFields{.identifier = "img-7"});
   *addItem(s)->mutable_visibleresults()->add_results() =
-      makeResult(ResultSpec{.identifier = "img-7", .knownSectionBundleIdentifier = 101});
-  addResultEngagement(s, ResultSpec{.identifier = "img-8"});
+      makeResult(ResultFields{.identifier = "img-7", .knownSectionBundleIdentifier = 101});
+  addResultEngagement(s, ResultFields{.identifier = "img-8"});
   report(s);
   EXPECT_EQ(counters(kImages), "image=1 zkw=1");
 }
