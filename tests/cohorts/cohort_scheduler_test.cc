@@ -77,7 +77,9 @@ TEST_F(CohortSchedule, ADayIsNeverDueInItsFirstHourAndAlwaysADayLater) {
     SCOPED_TRACE(row.name);
     makeScheduler(row.today).setMaxAgeInHours(row.maxAgeInHours);
     int due = 0;
-    for (int draw = 0; draw < 200; ++draw) due += shouldAggregate(FlushFrequency::daily) ? 1 : 0;
+    on([&] {
+      for (int draw = 0; draw < 200; ++draw) due += scheduler->shouldAggregate(FlushFrequency::daily) ? 1 : 0;
+    });
     EXPECT_EQ(due, row.due ? 200 : 0);
   }
   on([&] { store->lastAggregations().erase(FlushFrequency::weekly); });
