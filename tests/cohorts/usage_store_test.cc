@@ -20,14 +20,13 @@ unsigned modeOf(const fs::path& p) {
 // Guards against: a store invented without the Cohorts directory, a wrong collection start, markers not staged, not saved or not reloaded as the newest of their type, or a file of the wrong version or permissions.
 using StoreBringUp = StoreFixture;
 
-TEST_F(StoreBringUp, WithoutTheCohortsDirectoryThereIsNoStoreAndNoDirectoryIsMade) {
-  LogCapture logs;
-  EXPECT_EQ(bringUp(), nullptr);
-  EXPECT_FALSE(fs::exists(cohortsDir()));
-  EXPECT_TRUE(logs.contains("Trying to bring up the ObjectGraph stack."));
-}
-
-TEST_F(StoreBringUp, CollectionStartIsTheDirectoryCreationTime) {
+TEST_F(StoreBringUp, OnlyInTheCohortsDirectoryWhoseCreationTimeIsTheCollectionStart) {
+  {
+    LogCapture logs;
+    EXPECT_EQ(bringUp(), nullptr);
+    EXPECT_FALSE(fs::exists(cohortsDir())) << "no directory is made";
+    EXPECT_TRUE(logs.contains("Trying to bring up the ObjectGraph stack."));
+  }
   makeCohortsDirectory();
   auto attributes = env.fileManager->attributes(cohortsDir());
   ASSERT_TRUE(attributes);
@@ -213,7 +212,9 @@ TEST_F(StoreQueries, APurgeRemovesRecordsAtOrBeforeTheDateButNoCategories) {
 // Guards against: staged records written before a save, kept after the row cache is emptied, or lost when a save fails; and markers unusable after a reset.
 using StoreSaving = OpenStore;
 
-TEST_F(StoreSaving, StagedRecordsStayInMemoryUntilSavedAndAnEmptiedCacheDropsThem) {
+TEST_F(StoreSaving, StagedRecordsStayInMemoryUntilSavedAndAnEmptiedCacheDropsThemButKeepsTheMarkers) {
+  // The bring-up's unsaved markers are dropped by a reset and made anew.
+  store->emptyRowCache();
   addSentinel(corevireon::CV_CLIENT_NEWS, utcTime(2030, 1, 1));
   EXPECT_EQ(rows("VIRUsageEvent"), 0);
   save();
@@ -225,12 +226,7 @@ TEST_F(StoreSaving, StagedRecordsStayInMemoryUntilSavedAndAnEmptiedCacheDropsThe
   on([&] { EXPECT_FALSE(store->managedObjectContext().hasChanges()); });
   save();
   EXPECT_EQ(rows("VIRUsageEvent"), 1);
-}
-
-TEST_F(StoreSaving, AResetKeepsTheAggregationMarkersUsable) {
-  // Unsaved markers are dropped by the reset and made anew; a later change
-  // to them is saved.
-  store->emptyRowCache();
+  // The markers stay usable across resets: a change to them is saved.
   setMarker(FlushFrequency::monthly, utcTime(2030, 8, 1));
   save();
   store->emptyRowCache();
