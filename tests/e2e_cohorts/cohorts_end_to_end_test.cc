@@ -16,6 +16,7 @@
 #include <ctime>
 #include <map>
 #include <set>
+#include <tuple>
 #include <sstream>
 
 namespace fbf::testing {
@@ -82,9 +83,16 @@ class CohortsAcrossDays : public ::testing::Test {
                                  "--record", path("uploads.jsonl")},
         home_.environment(), path("ingest.out"), path("ingest.err"));
     ASSERT_TRUE(waitUntil([&] { return !readFile(path("port")).empty(); }, 20s)) << readFile(path("ingest.err"));
-    home_.configure("https://127.0.0.1:" + std::to_string(std::stoi(readFile(path("port")))) + "/feedback",
-                    {{"cohorts_lookback_in_days", 56}});
-    fbfctl({"defaults", "write", "vireond", "VIRUploadCAFile", "-string", cert});
+    home_.writeBag("https://127.0.0.1:" + std::to_string(std::stoi(readFile(path("port")))) + "/feedback",
+                   {{"cohorts_lookback_in_days", 56}});
+    // Ten days between periodic flushes: the later daemon must not flush on
+    // its own at launch, before the cohorts listener is there.
+    for (const auto& [domain, key, type, value] :
+         {std::tuple{"vireond", "VIRUploadCAFile", "-string", cert}, {"vireond", "FBFNoExit", "-bool", "true"},
+          {"vireond", "FlushFrequencyInSeconds", "-int", "864000"},
+          {"vireon.privacy", "DiagnosticsAndUsageEnabled", "-bool", "true"}}) {
+      fbfctl({"defaults", "write", domain, key, type, value});
+    }
     fs::create_directory(cohortsDir());
     fs::permissions(cohortsDir(), fs::perms::owner_all);
     realNow_ = static_cast<int64_t>(std::time(nullptr));
