@@ -1,6 +1,6 @@
-// Shared pieces of the cohort tests: a time zone set for one test, local
-// dates, session builders, a raw SQLite handle for looking at the file from
-// outside, and a fixture with a real store in a temporary cache directory.
+// Shared pieces of the cohort tests: a time zone set for one test, local and
+// UTC dates, session builders, a raw SQLite handle for looking at the file
+// from outside, and fixtures with a real store in a temporary cache directory.
 #pragma once
 
 #include "cohorts/object_graph_storage_container.h"
@@ -28,11 +28,7 @@ class ScopedTimeZone {
     tzset();
   }
   ~ScopedTimeZone() {
-    if (previous_) {
-      setenv("TZ", previous_->c_str(), 1);
-    } else {
-      unsetenv("TZ");
-    }
+    previous_ ? setenv("TZ", previous_->c_str(), 1) : unsetenv("TZ");
     tzset();
   }
 
@@ -40,32 +36,19 @@ class ScopedTimeZone {
   std::optional<std::string> previous_;
 };
 
-// A wall-clock time in the current TZ.
-inline SystemTime localTime(int year, int month, int day, int hour = 0, int minute = 0, int second = 0) {
-  std::tm tm{};
-  tm.tm_year = year - 1900;
-  tm.tm_mon = month - 1;
-  tm.tm_mday = day;
-  tm.tm_hour = hour;
-  tm.tm_min = minute;
-  tm.tm_sec = second;
-  tm.tm_isdst = -1;
-  return std::chrono::system_clock::from_time_t(std::mktime(&tm));
+// A wall-clock time in the current TZ (or in UTC).
+inline SystemTime wallTime(bool utc, int year, int month, int day, int hour, int minute, int second) {
+  std::tm tm{second, minute, hour, day, month - 1, year - 1900, 0, 0, -1, 0, nullptr};
+  return std::chrono::system_clock::from_time_t(utc ? timegm(&tm) : std::mktime(&tm));
 }
-
+inline SystemTime localTime(int year, int month, int day, int hour = 0, int minute = 0, int second = 0) {
+  return wallTime(false, year, month, day, hour, minute, second);
+}
 inline SystemTime utcTime(int year, int month, int day, int hour = 0, int minute = 0, int second = 0) {
-  std::tm tm{};
-  tm.tm_year = year - 1900;
-  tm.tm_mon = month - 1;
-  tm.tm_mday = day;
-  tm.tm_hour = hour;
-  tm.tm_min = minute;
-  tm.tm_sec = second;
-  return std::chrono::system_clock::from_time_t(timegm(&tm));
+  return wallTime(true, year, month, day, hour, minute, second);
 }
 
 using std::chrono::hours;
-using std::chrono::minutes;
 using std::chrono::seconds;
 
 // --- Sessions ---------------------------------------------------------------
@@ -77,67 +60,43 @@ inline corevireon::CVClientSession makeSession(const std::string& agent, SystemT
   s.mutable_feedbacks();
   return s;
 }
+inline corevireon::CVFeedbackPayload* addItem(corevireon::CVClientSession& s) { return s.mutable_feedbacks()->add_items(); }
+inline void addSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_startlocalsearch()->set_input("weather"); }
+inline void addDidGoToSite(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosite(); }
+inline void addDidGoToSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosearch(); }
 
-inline void addSearch(corevireon::CVClientSession& s, const std::string& input = "weather") {
-  s.mutable_feedbacks()->add_items()->mutable_startlocalsearch()->set_input(input);
-}
-
-struct ResultSpec {
+struct ResultFields {
   std::optional<std::string> identifier = "r1";
-  int32_t knownResultBundleId = 0;
-  int32_t knownSectionBundleIdentifier = 0;
-  bool isLocalApplicationResult = false;
-  bool punchout = false;
+  int32_t knownResultBundleId = 0, knownSectionBundleIdentifier = 0;
+  bool isLocalApplicationResult = false, punchout = false;
 };
 
-inline corevireon::CVSearchResultForFeedback makeResult(const ResultSpec& spec) {
+inline corevireon::CVSearchResultForFeedback makeResult(const ResultFields& fields) {
   corevireon::CVSearchResultForFeedback r;
-  if (spec.identifier) r.set_identifier(*spec.identifier);
-  r.set_knownresultbundleid(spec.knownResultBundleId);
-  r.set_knownsectionbundleidentifier(spec.knownSectionBundleIdentifier);
-  r.set_islocalapplicationresult(spec.isLocalApplicationResult);
-  if (spec.punchout) r.mutable_punchout()->set_bundleidentifier("com.example.app");
+  if (fields.identifier) r.set_identifier(*fields.identifier);
+  r.set_knownresultbundleid(fields.knownResultBundleId);
+  r.set_knownsectionbundleidentifier(fields.knownSectionBundleIdentifier);
+  r.set_islocalapplicationresult(fields.isLocalApplicationResult);
+  if (fields.punchout) r.mutable_punchout()->set_bundleidentifier("com.example.app");
   return r;
 }
 
-inline void addResultEngagement(corevireon::CVClientSession& s, std::optional<ResultSpec> result,
+inline void addResultEngagement(corevireon::CVClientSession& s, std::optional<ResultFields> result,
                                 corevireon::CVTriggerEngagementEvent trigger = corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP,
                                 int32_t destination = 0) {
-  auto* e = s.mutable_feedbacks()->add_items()->mutable_resultengagement();
+  auto* e = addItem(s)->mutable_resultengagement();
   if (result) *e->mutable_result() = makeResult(*result);
   e->set_triggerevent(trigger);
   e->set_destination(destination);
-}
-
-inline void addVisibleResult(corevireon::CVClientSession& s, const ResultSpec& result) {
-  *s.mutable_feedbacks()->add_items()->mutable_visibleresults()->add_results() = makeResult(result);
-}
-
-inline void addDidGoToSite(corevireon::CVClientSession& s) { s.mutable_feedbacks()->add_items()->mutable_didgotosite(); }
-inline void addDidGoToSearch(corevireon::CVClientSession& s) {
-  s.mutable_feedbacks()->add_items()->mutable_didgotosearch();
 }
 
 // --- Looking at the file from outside ---------------------------------------
 
 class RawDatabase {
  public:
-  explicit RawDatabase(const fs::path& path) {
-    if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) != SQLITE_OK) {
-      ADD_FAILURE() << "cannot open " << path;
-    }
-  }
+  explicit RawDatabase(const fs::path& path) { sqlite3_open(path.c_str(), &db_); }
   ~RawDatabase() { sqlite3_close_v2(db_); }
-  bool exec(const std::string& sql) {
-    char* message = nullptr;
-    int rc = sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &message);
-    if (rc != SQLITE_OK) {
-      lastError_ = message ? message : "error";
-      sqlite3_free(message);
-      return false;
-    }
-    return true;
-  }
+  bool exec(const std::string& sql) { return sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr) == SQLITE_OK; }
   // The first column of the first row, as text ("" when there is none).
   std::string scalar(const std::string& sql) {
     sqlite3_stmt* stmt = nullptr;
@@ -149,28 +108,25 @@ class RawDatabase {
     return out;
   }
   int64_t count(const std::string& table) { return std::stoll(scalar("SELECT count(*) FROM " + table)); }
-  const std::string& lastError() const { return lastError_; }
 
  private:
   sqlite3* db_ = nullptr;
-  std::string lastError_;
 };
 
 // --- A store in a temporary cache directory ---------------------------------
 
 class StoreFixture : public ::testing::Test {
  protected:
-  StoreFixture() : zone_("UTC") {}
+  explicit StoreFixture(const char* zone = "UTC") : zone_(zone) {}
 
   fs::path cohortsDir() const { return env.cacheDir() / "Cohorts"; }
   fs::path databasePath() const { return cohortsDir() / "cohorts.sqlite"; }
   void makeCohortsDirectory() { fs::create_directories(cohortsDir()); }
 
-  std::unique_ptr<ObjectGraphStorageContainer> bringUp(FileManager* fileManager = nullptr) {
+  std::unique_ptr<ObjectGraphStorageContainer> bringUp() {
     ObjectGraphStoreOptions options;
     options.busyTimeout = std::chrono::milliseconds(0);
-    return ObjectGraphStorageContainer::make(fileManager ? *fileManager : *env.fileManager,
-                                             [this] { return env.clock->now(); }, options);
+    return ObjectGraphStorageContainer::make(*env.fileManager, [this] { return env.clock->now(); }, options);
   }
   // Brings the store up and waits for the last aggregations to load.
   std::unique_ptr<ObjectGraphStorageContainer> bringUpAndSettle() {
@@ -184,6 +140,49 @@ class StoreFixture : public ::testing::Test {
 
   ScopedTimeZone zone_;
   TestEnvironment env;
+};
+
+// A store already up, with helpers that stage records on its queue.
+class OpenStore : public StoreFixture {
+ protected:
+  using StoreFixture::StoreFixture;
+  void SetUp() override {
+    makeCohortsDirectory();
+    store = bringUpAndSettle();
+    ASSERT_NE(store, nullptr);
+  }
+  void on(const std::function<void()>& work) { onStore(*store, work); }
+  void save() { saveOrLogError(store->managedObjectContext()); }
+  void addSentinel(corevireon::CVClient client, SystemTime t) {
+    on([&] {
+      auto e = store->eventFactory().createUsageEvent();
+      e->setTimestamp(t);
+      e->usageCategory()->setClientIntVal(client);
+    });
+  }
+  void addWayfinSession(SystemTime t, std::initializer_list<std::pair<VIRWayfinSession::Counter, int>> counts) {
+    on([&] {
+      auto s = store->eventFactory().createWayfinSession();
+      s->setTimestamp(t);
+      for (auto [counter, n] : counts) {
+        for (int i = 0; i < n; ++i) s->incrementCounter(counter);
+      }
+    });
+  }
+  void setMarker(FlushFrequency f, SystemTime t) { on([&] { store->lastAggregations()[f]->setTimestamp(t); }); }
+  void setAllMarkers(SystemTime t) {
+    for (auto f : kAllFlushFrequencies) setMarker(f, t);
+  }
+  std::optional<SystemTime> marker(FlushFrequency f) {
+    std::optional<SystemTime> t;
+    on([&] { t = store->lastAggregations()[f]->timestamp(); });
+    return t;
+  }
+  // A column of the saved file, as text.
+  std::string sql(const std::string& query) { return RawDatabase(databasePath()).scalar(query); }
+  int64_t rows(const std::string& table) { return RawDatabase(databasePath()).count(table); }
+
+  std::unique_ptr<ObjectGraphStorageContainer> store;
 };
 
 }  // namespace fbf::testing

@@ -8,25 +8,32 @@
 namespace fbf::testing {
 namespace {
 
-using corevireon::CVClient;
+using corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY;
+using corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP;
+using corevireon::CVClientSession;
 
-class UsageCounting : public StoreFixture {
+const char* kScoutlume = "VIRScoutlumeSession";
+const char* kWayfin = "VIRWayfinSession";
+const char* kImages = "VIRImagesSession";
+
+// Guards against: a session counted for the wrong surface, twice, without an engagement or search, or a counter past its 16-bit maximum stored instead of stopping.
+class UsageCounting : public OpenStore {
  protected:
   void SetUp() override {
-    makeCohortsDirectory();
-    store = bringUpAndSettle();
-    ASSERT_NE(store, nullptr);
-    processor = std::make_unique<UsageProcessor>(*store);
+    OpenStore::SetUp();
+    if (store) processor = std::make_unique<UsageProcessor>(*store);
   }
-  RawDatabase& raw() {
-    if (!raw_) raw_ = std::make_unique<RawDatabase>(databasePath());
-    return *raw_;
+  void report(const CVClientSession& s) { processor->reportUsageEvents(s); }
+  CVClientSession searched(const char* agent) {
+    auto s = makeSession(agent, start);
+    addSearch(s);
+    return s;
   }
   // The one counter record of the entity, as "name=value" for every non-zero
   // counter.
   std::string counters(const std::string& entity) {
     std::string out;
-    onStore(*store, [&] {
+    on([&] {
       auto sessions = store->queryProcessor().usageSessions(entity, SystemTime{}, start + hours(1));
       if (sessions.size() != 1) {
         out = "records: " + std::to_string(sessions.size());
@@ -34,90 +41,33 @@ class UsageCounting : public StoreFixture {
       }
       for (size_t i = 0; i < sessions[0]->counterCount(); ++i) {
         if (sessions[0]->counter(i) == 0) continue;
-        if (!out.empty()) out += " ";
-        out += std::string(sessions[0]->counterName(i)) + "=" + std::to_string(sessions[0]->counter(i));
+        out += (out.empty() ? "" : " ") + std::string(sessions[0]->counterName(i)) + "=" +
+               std::to_string(sessions[0]->counter(i));
       }
     });
     return out;
   }
+  std::string clients() {
+    return sql("SELECT group_concat(clientIntVal) FROM (SELECT clientIntVal FROM VIRCategory ORDER BY 1)");
+  }
 
   SystemTime start = utcTime(2030, 4, 2, 9, 30);
-  std::unique_ptr<ObjectGraphStorageContainer> store;
   std::unique_ptr<UsageProcessor> processor;
-  std::unique_ptr<RawDatabase> raw_;
 };
 
-TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecord) {
-  for (const char* agent : {"Wayfin/17.0", "ScoutLume/3", "Messages/2"}) {
-    auto s = makeSession(agent, start);
-    addSearch(s);
-    addResultEngagement(s, ResultSpec{});
-    processor->reportUsageEvents(s);
+TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecordButNewsOnlyASentinel) {
+  for (const char* agent : {"Wayfin/17.0", "ScoutLume/3", "Messages/2", "NewsReader/5"}) {
+    auto s = searched(agent);
+    addResultEngagement(s, ResultFields{});
+    report(s);
   }
-  EXPECT_EQ(raw().scalar("SELECT group_concat(clientIntVal) FROM (SELECT clientIntVal FROM VIRCategory ORDER BY 1)"),
-            "1,2,3");
-  EXPECT_EQ(raw().count("VIRWayfinSession"), 1);
-  EXPECT_EQ(raw().count("VIRScoutlumeSession"), 1);
-  EXPECT_EQ(raw().count("VIRImagesSession"), 1);
-  EXPECT_EQ(raw().scalar("SELECT timestamp = " + std::to_string(secondsSinceEpoch(start)) + " FROM VIRUsageEvent LIMIT 1"),
-            "1");
+  EXPECT_EQ(clients(), "1,2,3,4");
+  for (const char* table : {kWayfin, kScoutlume, kImages}) EXPECT_EQ(rows(table), 1) << table;
+  EXPECT_EQ(sql("SELECT count(*) FROM VIRUsageEvent WHERE timestamp = " + std::to_string(secondsSinceEpoch(start))),
+            "4");
 }
 
-TEST_F(UsageCounting, ANewsSessionGetsASentinelButNoCounterRecord) {
-  auto s = makeSession("NewsReader/5", start);
-  addSearch(s);
-  addResultEngagement(s, ResultSpec{});
-  processor->reportUsageEvents(s);
-  EXPECT_EQ(raw().count("VIRUsageEvent"), 1);
-  EXPECT_EQ(raw().scalar("SELECT clientIntVal FROM VIRCategory"), "4");
-  EXPECT_EQ(raw().count("VIRWayfinSession") + raw().count("VIRScoutlumeSession") + raw().count("VIRImagesSession"), 0);
-}
-
-TEST_F(UsageCounting, AMessagesSessionCountsWithoutSearchesButABrowserSessionDoesNot) {
-  auto messages = makeSession("messages", start);
-  addResultEngagement(messages, ResultSpec{});
-  processor->reportUsageEvents(messages);
-  auto browser = makeSession("wayfin", start);
-  addDidGoToSite(browser);
-  processor->reportUsageEvents(browser);
-  EXPECT_EQ(raw().count("VIRUsageEvent"), 1);
-  EXPECT_EQ(raw().scalar("SELECT clientIntVal FROM VIRCategory"), "3");
-  EXPECT_EQ(raw().count("VIRWayfinSession"), 0);
-}
-
-TEST_F(UsageCounting, ASessionWithoutEngagementsCountsNothing) {
-  auto s = makeSession("scoutlume", start);
-  addSearch(s);
-  // Previews in the system search surface are not engagements.
-  addResultEngagement(s, ResultSpec{}, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER);
-  addResultEngagement(s, ResultSpec{}, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP, 1);
-  processor->reportUsageEvents(s);
-  EXPECT_EQ(raw().count("VIRUsageEvent"), 0);
-  EXPECT_EQ(raw().count("VIRScoutlumeSession"), 0);
-}
-
-TEST_F(UsageCounting, AnUnknownAgentStagesNothingButStillSaves) {
-  auto s = makeSession("SomeOtherApp/1", start);
-  addSearch(s);
-  addResultEngagement(s, ResultSpec{});
-  processor->reportUsageEvents(s);
-  EXPECT_EQ(raw().count("VIRUsageEvent"), 0);
-  // The save wrote the aggregation markers staged at bring-up.
-  EXPECT_EQ(raw().count("VIRFlushEvent"), 3);
-  onStore(*store, [&] { EXPECT_FALSE(store->managedObjectContext().hasChanges()); });
-}
-
-TEST_F(UsageCounting, KeystrokelessSearchStartsAreNotSearches) {
-  auto s = makeSession("scoutlume", start);
-  s.mutable_feedbacks()->add_items()->mutable_startlocalsearch();
-  auto* network = s.mutable_feedbacks()->add_items()->mutable_startnetworksearch();
-  network->set_input("typed");
-  network->set_endpoint(12);
-  addResultEngagement(s, ResultSpec{});
-  processor->reportUsageEvents(s);
-  EXPECT_EQ(raw().count("VIRUsageEvent"), 0);
-}
-
+// Guards against: the rule that a session counts swapping its search and engagement flags or ignoring its client.
 TEST(UsageRule, OnFlags) {
   EXPECT_FALSE(UsageProcessor::session(true, false, corevireon::CV_CLIENT_MESSAGING));
   EXPECT_TRUE(UsageProcessor::session(false, true, corevireon::CV_CLIENT_MESSAGING));
@@ -128,142 +78,134 @@ TEST(UsageRule, OnFlags) {
 
 // --- Every counter is reachable -------------------------------------------
 
-struct CounterCase {
-  const char* name;
-  const char* agent;
-  std::function<void(corevireon::CVClientSession&)> engage;
-  const char* entity;
-  const char* expected;
-};
+ResultFields section(int32_t code) { return ResultFields{.knownSectionBundleIdentifier = code}; }
+ResultFields bundle(int32_t code) { return ResultFields{.knownResultBundleId = code}; }
 
-void PrintTo(const CounterCase& c, std::ostream* os) { *os << c.name; }
-
-using corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY;
-using corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP;
-
-ResultSpec section(int32_t code) { return ResultSpec{.knownSectionBundleIdentifier = code}; }
-ResultSpec bundle(int32_t code) { return ResultSpec{.knownResultBundleId = code}; }
-ResultSpec local() { return ResultSpec{.isLocalApplicationResult = true}; }
-ResultSpec punchout() { return ResultSpec{.punchout = true}; }
-
-auto engage(ResultSpec r, corevireon::CVTriggerEngagementEvent t = CV_TRIGGER_ENGAGEMENT_EVENT_TAP) {
-  return [r, t](corevireon::CVClientSession& s) { addResultEngagement(s, r, t); };
+// Each row is one session of a surface, searched unless said otherwise; a
+// row expecting no record is a session that must count nothing at all.
+TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagementAndNothingElseCounts) {
+  using Add = std::function<void(CVClientSession&)>;
+  auto engage = [](ResultFields r, corevireon::CVTriggerEngagementEvent t = CV_TRIGGER_ENGAGEMENT_EVENT_TAP) -> Add {
+    return [r, t](CVClientSession& s) { addResultEngagement(s, r, t); };
+  };
+  const Add noResult = [](CVClientSession& s) { addResultEngagement(s, std::nullopt); };
+  const Add goToSite = addDidGoToSite, goToSearch = addDidGoToSearch;
+  // Previews in the system search surface are not engagements, nor are
+  // engagements with another destination.
+  const Add previewAndElsewhere = [](CVClientSession& s) {
+    addResultEngagement(s, ResultFields{}, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER);
+    addResultEngagement(s, ResultFields{}, CV_TRIGGER_ENGAGEMENT_EVENT_TAP, 1);
+  };
+  const Add keystrokeless = [](CVClientSession& s) {
+    addItem(s)->mutable_startlocalsearch();
+    auto* network = addItem(s)->mutable_startnetworksearch();
+    network->set_input("typed");
+    network->set_endpoint(12);
+    addResultEngagement(s, ResultFields{});
+  };
+  const ResultFields local{.isLocalApplicationResult = true}, punchout{.punchout = true};
+  const auto ret = CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY;
+  const char* none = "records: 0";
+  const struct {
+    const char* agent;
+    Add add;
+    const char* entity;
+    const char* expected;
+    bool search = true;
+  } cases[] = {
+      {"SomeOtherApp/1", engage(ResultFields{}), kWayfin, none},
+      {"scoutlume", goToSearch, kScoutlume, "vireon=1"},
+      {"scoutlume", noResult, kScoutlume, "other=1"},
+      {"scoutlume", engage(bundle(66)), kScoutlume, "querySuggestion=1"},
+      {"scoutlume", engage(section(102)), kScoutlume, "vexaSuggestions=1"},
+      {"scoutlume", engage(section(103)), kScoutlume, "onDeviceAddressBookData=1"},
+      {"scoutlume", engage(section(106)), kScoutlume, "onDeviceOtherPersonalData=1"},
+      {"scoutlume", engage(local), kScoutlume, "appLaunch=1"},
+      {"scoutlume", engage(section(110)), kScoutlume, "thirdPartyInAppContent=1"},
+      {"scoutlume", engage(section(100)), kScoutlume, "vireon=1"},
+      {"scoutlume", engage(punchout), kScoutlume, "punchout=1"},
+      {"scoutlume", engage(section(7)), kScoutlume, "other=1"},
+      {"scoutlume", previewAndElsewhere, kScoutlume, none},
+      {"scoutlume", keystrokeless, kScoutlume, none, false},
+      {"wayfin", goToSite, kWayfin, "goToSite=1"},
+      {"wayfin", goToSite, kWayfin, none, false},
+      {"wayfin", goToSearch, kWayfin, "thirdPartyGoto=1"},
+      {"wayfin", noResult, kWayfin, "other=1"},
+      {"wayfin", engage(bundle(44)), kWayfin, "thirdPartyCompletionOrRecentSearch=1"},
+      {"wayfin", engage(section(112), ret), kWayfin, "localGoto=1"},
+      {"wayfin", engage(local), kWayfin, "localTap=1"},
+      {"wayfin", engage(section(100), ret), kWayfin, "vireonGoto=1"},
+      {"wayfin", engage(section(100)), kWayfin, "vireonTap=1"},
+      {"wayfin", engage(section(114), ret), kWayfin, "thirdPartyGoto=1"},
+      {"wayfin", engage(section(114)), kWayfin, "thirdPartyTap=1"},
+      {"wayfin", engage(section(103)), kWayfin, "other=1"},
+      {"messages", engage(bundle(86)), kImages, "querySuggestion=1"},
+      {"messages", engage(section(101)), kImages, "zkw=1"},
+      {"messages", engage(section(5)), kImages, "image=1"},
+      {"messages", engage(section(5)), kImages, "image=1", false},
+      {"messages", engage(ResultFields{.identifier = std::nullopt}), kImages, "other=1"},
+      {"messages", noResult, kImages, "other=1"},
+  };
+  for (const auto& row : cases) {
+    SCOPED_TRACE(std::string(row.agent) + " " + row.expected + (row.search ? "" : " without a search"));
+    auto s = row.search ? searched(row.agent) : makeSession(row.agent, start);
+    row.add(s);
+    report(s);
+    EXPECT_EQ(counters(row.entity), row.expected);
+    EXPECT_EQ(rows("VIRUsageEvent"), row.expected == none ? 0 : 1);
+    // The save still wrote the aggregation markers staged at bring-up (the
+    // first purge takes them).
+    EXPECT_EQ(rows("VIRFlushEvent"), &row == &cases[0] ? 3 : 0);
+    on([&] { EXPECT_FALSE(store->managedObjectContext().hasChanges()); });
+    store->purgeEventsOlderThan(start);
+    on([] {});
+  }
 }
-auto engageWithoutResult() {
-  return [](corevireon::CVClientSession& s) { addResultEngagement(s, std::nullopt); };
-}
-
-class EveryCounter : public UsageCounting, public ::testing::WithParamInterface<CounterCase> {};
-
-TEST_P(EveryCounter, IsReachedByItsEngagement) {
-  const auto& c = GetParam();
-  auto s = makeSession(c.agent, start);
-  addSearch(s);
-  c.engage(s);
-  processor->reportUsageEvents(s);
-  EXPECT_EQ(counters(c.entity), c.expected);
-}
-
-const char* kScoutlume = "VIRScoutlumeSession";
-const char* kWayfin = "VIRWayfinSession";
-const char* kImages = "VIRImagesSession";
-
-INSTANTIATE_TEST_SUITE_P(
-    Classification, EveryCounter,
-    ::testing::Values(
-        CounterCase{"scoutlumeGoToSearch", "scoutlume", [](auto& s) { addDidGoToSearch(s); }, kScoutlume, "vireon=1"},
-        CounterCase{"scoutlumeNoResult", "scoutlume", engageWithoutResult(), kScoutlume, "other=1"},
-        CounterCase{"scoutlumeSuggestion", "scoutlume", engage(bundle(66)), kScoutlume, "querySuggestion=1"},
-        CounterCase{"scoutlumeAssistant", "scoutlume", engage(section(102)), kScoutlume, "vexaSuggestions=1"},
-        CounterCase{"scoutlumeContacts", "scoutlume", engage(section(103)), kScoutlume, "onDeviceAddressBookData=1"},
-        CounterCase{"scoutlumeNotes", "scoutlume", engage(section(106)), kScoutlume, "onDeviceOtherPersonalData=1"},
-        CounterCase{"scoutlumeApp", "scoutlume", engage(local()), kScoutlume, "appLaunch=1"},
-        CounterCase{"scoutlumeInApp", "scoutlume", engage(section(110)), kScoutlume, "thirdPartyInAppContent=1"},
-        CounterCase{"scoutlumeServer", "scoutlume", engage(section(100)), kScoutlume, "vireon=1"},
-        CounterCase{"scoutlumePunchout", "scoutlume", engage(punchout()), kScoutlume, "punchout=1"},
-        CounterCase{"scoutlumeOther", "scoutlume", engage(section(7)), kScoutlume, "other=1"},
-        CounterCase{"wayfinSite", "wayfin", [](auto& s) { addDidGoToSite(s); }, kWayfin, "goToSite=1"},
-        CounterCase{"wayfinSearch", "wayfin", [](auto& s) { addDidGoToSearch(s); }, kWayfin, "thirdPartyGoto=1"},
-        CounterCase{"wayfinNoResult", "wayfin", engageWithoutResult(), kWayfin, "other=1"},
-        CounterCase{"wayfinCompletion", "wayfin", engage(bundle(44)), kWayfin, "thirdPartyCompletionOrRecentSearch=1"},
-        CounterCase{"wayfinLocalGoto", "wayfin", engage(section(112), CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY), kWayfin,
-                    "localGoto=1"},
-        CounterCase{"wayfinLocalTap", "wayfin", engage(local()), kWayfin, "localTap=1"},
-        CounterCase{"wayfinServerGoto", "wayfin", engage(section(100), CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY), kWayfin,
-                    "vireonGoto=1"},
-        CounterCase{"wayfinServerTap", "wayfin", engage(section(100)), kWayfin, "vireonTap=1"},
-        CounterCase{"wayfinEngineGoto", "wayfin", engage(section(114), CV_TRIGGER_ENGAGEMENT_EVENT_RETURN_KEY), kWayfin,
-                    "thirdPartyGoto=1"},
-        CounterCase{"wayfinEngineTap", "wayfin", engage(section(114)), kWayfin, "thirdPartyTap=1"},
-        CounterCase{"wayfinOther", "wayfin", engage(section(103)), kWayfin, "other=1"},
-        CounterCase{"imagesSuggestion", "messages", engage(bundle(86)), kImages, "querySuggestion=1"},
-        CounterCase{"imagesZeroKeyword", "messages", engage(section(101)), kImages, "zkw=1"},
-        CounterCase{"imagesImage", "messages", engage(section(5)), kImages, "image=1"},
-        CounterCase{"imagesNoIdentifier", "messages", engage(ResultSpec{.identifier = std::nullopt}), kImages,
-                    "other=1"},
-        CounterCase{"imagesNoResult", "messages", engageWithoutResult(), kImages, "other=1"}),
-    [](const ::testing::TestParamInfo<CounterCase>& info) { return std::string(info.param.name); });
 
 TEST_F(UsageCounting, ImagesLookUpTheEngagedResultAmongTheSessionsResults) {
   auto s = makeSession("messages", start);
   // The engagement names only the identifier; the shown result says it was
   // a zero-keyword suggestion.
-  addResultEngagement(s, ResultSpec{.identifier = "img-7"});
-  addVisibleResult(s, ResultSpec{.identifier = "img-7", .knownSectionBundleIdentifier = 101});
-  addResultEngagement(s, ResultSpec{.identifier = "img-8"});
-  processor->reportUsageEvents(s);
+  addResultEngagement(s, ResultFields{.identifier = "img-7"});
+  *addItem(s)->mutable_visibleresults()->add_results() =
+      makeResult(ResultFields{.identifier = "img-7", .knownSectionBundleIdentifier = 101});
+  addResultEngagement(s, ResultFields{.identifier = "img-8"});
+  report(s);
   EXPECT_EQ(counters(kImages), "image=1 zkw=1");
 }
 
 TEST_F(UsageCounting, EveryEngagementOfASessionIsCountedOnce) {
-  auto s = makeSession("wayfin", start);
-  addSearch(s);
+  auto s = searched("wayfin");
   addDidGoToSite(s);
   addDidGoToSite(s);
   addResultEngagement(s, section(100));
   addResultEngagement(s, std::nullopt);
-  processor->reportUsageEvents(s);
+  report(s);
   EXPECT_EQ(counters(kWayfin), "goToSite=2 vireonTap=1 other=1");
 }
 
 TEST_F(UsageCounting, ASessionProcessedAgainIsCountedOnceAndADifferentOneStillCounts) {
-  auto s = makeSession("wayfin", start);
-  addSearch(s);
+  auto s = searched("wayfin");
   addDidGoToSite(s);
   // The same file read again after a crash, then another session of the
   // same surface and start.
-  processor->reportUsageEvents(s);
-  processor->reportUsageEvents(s);
+  report(s);
+  report(s);
   auto other = s;
   addDidGoToSite(other);
-  processor->reportUsageEvents(other);
-  EXPECT_EQ(raw().count("VIRUsageEvent"), 2);
-  EXPECT_EQ(raw().count("VIRWayfinSession"), 2);
-  EXPECT_EQ(raw().count("VIRCountedSession"), 2);
+  report(other);
+  for (const char* table : {"VIRUsageEvent", kWayfin, "VIRCountedSession"}) EXPECT_EQ(rows(table), 2) << table;
 }
 
-TEST(UsageCounterOverflow, PassingTheSigned16BitMaximumStopsTheProcess) {
-  GTEST_FLAG_SET(death_test_style, "threadsafe");
-  EXPECT_DEATH(
-      {
-        ScopedTimeZone zone("UTC");
-        TestEnvironment env;
-        fs::create_directories(env.cacheDir() / "Cohorts");
-        auto store = ObjectGraphStorageContainer::make(*env.fileManager, [] { return SystemTime{}; }, {});
-        UsageProcessor processor(*store);
-        auto s = makeSession("wayfin", utcTime(2030, 1, 1));
-        addSearch(s);
-        for (int i = 0; i < 32768; ++i) addDidGoToSite(s);
-        processor.reportUsageEvents(s);
-      },
-      "engagement counter overflow");
-}
-
-TEST_F(UsageCounting, TheSigned16BitMaximumItselfIsStored) {
-  auto s = makeSession("wayfin", start);
-  addSearch(s);
+TEST_F(UsageCounting, TheSigned16BitMaximumIsStoredAndOneMoreStopsTheProcess) {
+  auto s = searched("wayfin");
   for (int i = 0; i < 32767; ++i) addDidGoToSite(s);
-  processor->reportUsageEvents(s);
+  auto over = s;
+  addDidGoToSite(over);
+  // First, so that the death test's own run of this test stops here.
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  EXPECT_DEATH(report(over), "engagement counter overflow");
+  report(s);
   EXPECT_EQ(counters(kWayfin), "goToSite=32767");
 }
 

@@ -28,11 +28,7 @@ struct RecordingHooks {
     PeriodicActivityHooks h;
     h.beginFlush = [this](std::function<void()> completion) -> std::function<void()> {
       ++flushes;
-      if (completeAtOnce) {
-        completion();
-      } else {
-        pendingCompletion = std::move(completion);
-      }
+      completeAtOnce ? completion() : void(pendingCompletion = std::move(completion));
       return [this] {
         ++stops;
         if (pendingCompletion) std::exchange(pendingCompletion, nullptr)();
@@ -48,6 +44,7 @@ struct RecordingHooks {
   }
 };
 
+// Guards against: a flush started without a bag or while disabled, the process kept (or ended) against the no-exit flag, a flush not stopped on battery, or the interval override applied below one second.
 class PeriodicRun : public ::testing::Test {
  protected:
   TestEnvironment env;
@@ -58,74 +55,61 @@ class PeriodicRun : public ::testing::Test {
   std::shared_ptr<Activity> activity(ActivityState state = ActivityState::run) {
     return std::make_shared<Activity>(ActivityCriteria{std::chrono::hours(6), false, true}, power, state);
   }
-  void run(const std::shared_ptr<Activity>& a) {
-    doPeriodicConduitActivity(a, env.assembly(), recorder.hooks());
-    env.manualQueue->drain();
-  }
+  void bag() { env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}}); }
 };
 
 TEST_F(PeriodicRun, IntervalOverrideAppliesOnlyFromOneSecond) {
   auto a = activity();
-  env.defaults().setObject("FlushFrequencyInSeconds", 0);
+  for (int ignored : {0, -5}) {
+    env.defaults().setObject("FlushFrequencyInSeconds", ignored);
+    overrideActivityFrequencyIfNecessary(env.assembly(), *a);
+    EXPECT_EQ(a->criteria().interval, std::chrono::hours(6));
+    EXPECT_FALSE(a->criteria().allowBattery);
+  }
+  env.defaults().setObject("FlushFrequencyInSeconds", 1);
   overrideActivityFrequencyIfNecessary(env.assembly(), *a);
-  EXPECT_EQ(a->criteria().interval, std::chrono::hours(6));
-  env.defaults().setObject("FlushFrequencyInSeconds", -5);
-  overrideActivityFrequencyIfNecessary(env.assembly(), *a);
-  EXPECT_FALSE(a->criteria().allowBattery);
-
-  env.defaults().setObject("FlushFrequencyInSeconds", 3600);
-  overrideActivityFrequencyIfNecessary(env.assembly(), *a);
-  EXPECT_EQ(a->criteria().interval, std::chrono::seconds(3600));
+  EXPECT_EQ(a->criteria().interval, std::chrono::seconds(1));
   EXPECT_TRUE(a->criteria().allowBattery);
   EXPECT_FALSE(a->criteria().requireScreenSleep);
 }
 
-TEST_F(PeriodicRun, CheckInDoesNothingButTheOverride) {
-  env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}});
-  auto a = activity(ActivityState::continueRunning);
-  run(a);
-  EXPECT_EQ(recorder.flushes, 0);
-  EXPECT_EQ(recorder.exits, 0);
-  EXPECT_EQ(a->state(), ActivityState::continueRunning);
-}
-
-TEST_F(PeriodicRun, DisabledFlushStillFinishesAndExitsTenSecondsLater) {
-  env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}});
-  env.defaults().setObject("VIRFeedbackFlushDisabled", true);
-  auto a = activity();
-  run(a);
-  EXPECT_EQ(recorder.flushes, 0);
-  EXPECT_TRUE(logs.contains(
-      "FBF bailing because flushing is disabled. 'defaults delete vireond VIRFeedbackFlushDisabled' to re-enable"));
-  EXPECT_EQ(recorder.invalidations, 1);
-  ASSERT_EQ(recorder.delays.size(), 1u);
-  EXPECT_EQ(recorder.delays[0], std::chrono::seconds(10));
-  EXPECT_EQ(recorder.exits, 1);
-  EXPECT_TRUE(logs.contains("FBF: FBF's now finished."));
-  EXPECT_EQ(a->state(), ActivityState::done);
-  EXPECT_TRUE(logs.contains("Conduit activity done."));
-}
-
-TEST_F(PeriodicRun, NoBagMeansNoFlush) {
-  run(activity());
-  EXPECT_EQ(recorder.flushes, 0);
-  EXPECT_TRUE(logs.contains("FBF bailing because we found no cached bag on disk."));
-  EXPECT_EQ(recorder.exits, 1);
-}
-
-TEST_F(PeriodicRun, NoExitKeepsTheListenerAndTheProcess) {
-  env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}});
-  env.defaults().setObject("FBFNoExit", true);
-  run(activity());
-  EXPECT_EQ(recorder.flushes, 1);
-  EXPECT_EQ(recorder.invalidations, 0);
-  EXPECT_EQ(recorder.exits, 0);
-  EXPECT_TRUE(logs.contains("Respecting NoExit defaults flag and staying alive, staying alive."));
-  EXPECT_FALSE(env.assembly().conduitActivity());
+TEST_F(PeriodicRun, EveryRunFinishesAndExitsTenSecondsLaterUnlessToldToStay) {
+  const struct {
+    const char* name;
+    bool bag, disabled, noExit;
+    int flushes;
+    const char* log;
+  } rows[] = {
+      {"no bag", false, false, false, 0, "FBF bailing because we found no cached bag on disk."},
+      {"disabled", true, true, false, 0,
+       "FBF bailing because flushing is disabled. 'defaults delete vireond VIRFeedbackFlushDisabled' to re-enable"},
+      {"flushed", true, false, false, 1, "FBF: FBF's now finished."},
+      {"told to stay", true, false, true, 1, "Respecting NoExit defaults flag and staying alive, staying alive."},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    TestEnvironment env;
+    RecordingHooks recorder;
+    LogCapture logs;
+    if (row.bag) env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}});
+    env.defaults().setObject("VIRFeedbackFlushDisabled", row.disabled);
+    env.defaults().setObject("FBFNoExit", row.noExit);
+    auto a = activity();
+    doPeriodicConduitActivity(a, env.assembly(), recorder.hooks());
+    env.manualQueue->drain();
+    EXPECT_EQ(recorder.flushes, row.flushes);
+    EXPECT_TRUE(logs.contains(row.log));
+    EXPECT_EQ(recorder.invalidations, row.noExit ? 0 : 1);
+    EXPECT_EQ(recorder.exits, row.noExit ? 0 : 1);
+    EXPECT_EQ(recorder.delays, (std::vector<std::chrono::seconds>(row.noExit ? 0 : 1, std::chrono::seconds(10))));
+    EXPECT_EQ(a->state(), ActivityState::done);
+    EXPECT_TRUE(logs.contains("Conduit activity done."));
+    EXPECT_FALSE(env.assembly().conduitActivity());
+  }
 }
 
 TEST_F(PeriodicRun, GoingOnBatteryDefersTheRunningFlush) {
-  env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}});
+  bag();
   env.defaults().setObject("FBFNoExit", true);
   recorder.completeAtOnce = false;
   auto a = activity();
@@ -138,37 +122,42 @@ TEST_F(PeriodicRun, GoingOnBatteryDefersTheRunningFlush) {
   EXPECT_EQ(a->state(), ActivityState::done);
 }
 
+// Guards against: a due run skipped or repeated, a flush at check-in, a recent run not waited for, a run on battery, or an unreadable last-run record blocking flushes.
 class Scheduling : public PeriodicRun {
  protected:
   std::shared_ptr<testing::ManualQueue> queue = std::make_shared<testing::ManualQueue>("activity");
   std::shared_ptr<FixedPower> sharedPower = std::make_shared<FixedPower>();
   fs::path lastRun() { return env.cacheDir() / "fbf-last-flush"; }
-  std::unique_ptr<PeriodicActivityScheduler> make() {
-    env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}});
+  std::unique_ptr<PeriodicActivityScheduler> start() {
+    bag();
     env.defaults().setObject("FBFNoExit", true);
-    return std::make_unique<PeriodicActivityScheduler>(env.assembly(), queue, sharedPower, recorder.hooks(), lastRun());
+    auto s = std::make_unique<PeriodicActivityScheduler>(env.assembly(), queue, sharedPower, recorder.hooks(), lastRun());
+    s->start();
+    queue->drain();
+    env.manualQueue->drain();
+    return s;
   }
 };
 
-TEST_F(Scheduling, FirstStartRunsAtOnceAndRemembersTheRun) {
-  auto s = make();
-  s->start();
-  queue->drain();
-  env.manualQueue->drain();
+TEST_F(Scheduling, FirstStartOrAnUnreadableLastRunRunsAtOnceAndRemembersTheRun) {
+  testing::writeFile(lastRun(), "yesterday");
+  auto s = start();
   EXPECT_EQ(recorder.flushes, 1);
-  ASSERT_TRUE(fs::exists(lastRun()));
+  EXPECT_TRUE(logs.contains("Ignoring unreadable last-run file"));
   auto next = s->nextRunAt();
   ASSERT_TRUE(next);
   // The run is stored to the microsecond.
   EXPECT_NEAR(std::chrono::duration<double>(*next - env.clock->now()).count(),
               static_cast<double>(PeriodicActivityScheduler::kDefaultInterval.count()), 1.0);
+  fs::remove(lastRun());
+  start();
+  EXPECT_EQ(recorder.flushes, 2);
+  EXPECT_TRUE(fs::exists(lastRun()));
 }
 
 TEST_F(Scheduling, RecentRunArmsTheTimerInstead) {
   testing::writeFile(lastRun(), std::to_string(secondsSinceEpoch(env.clock->now() - std::chrono::hours(1))));
-  auto s = make();
-  s->start();
-  queue->drain();
+  auto s = start();
   EXPECT_EQ(recorder.flushes, 0);
   // Five hours later (the stored time is decimal seconds, so allow a
   // moment for rounding) the timer fires.
@@ -180,23 +169,12 @@ TEST_F(Scheduling, RecentRunArmsTheTimerInstead) {
 
 TEST_F(Scheduling, DueRunWaitsWhileOnBatteryUnlessOverridden) {
   sharedPower->battery = true;
-  auto s = make();
-  s->start();
-  queue->drain();
+  auto s = start();
   EXPECT_EQ(recorder.flushes, 0);
   sharedPower->battery = false;
   queue->advance(PeriodicActivityScheduler::kBatteryRecheck);
   env.manualQueue->drain();
   EXPECT_EQ(recorder.flushes, 1);
-}
-
-TEST_F(Scheduling, UnreadableLastRunFileCountsAsNoRun) {
-  testing::writeFile(lastRun(), "yesterday");
-  auto s = make();
-  s->start();
-  queue->drain();
-  EXPECT_EQ(recorder.flushes, 1);
-  EXPECT_TRUE(logs.contains("Ignoring unreadable last-run file"));
 }
 
 }  // namespace

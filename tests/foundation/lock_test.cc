@@ -9,38 +9,25 @@
 namespace fbf {
 namespace {
 
-TEST(ConditionLockTimeouts, ZeroTimeoutWithOtherValueFailsAtOnceAndReleasesTheLock) {
+// Guards against: a timed wait that keeps the lock on failure, returns without it on success, misses a wake-up, or accepts a negative timeout.
+TEST(ConditionLockTimeouts, SuccessHoldsTheLockAndFailureReleasesIt) {
   ConditionLock<int> cl(1);
   EXPECT_FALSE(cl.lockWhenValue(2, 0.0));
-  // The lock was released: another thread can take it.
+  // Released after the zero timeout: another thread can take it (a lock
+  // left held would hang here).
+  std::thread([&] { cl.lockWhenValue(1); cl.unlock(); }).join();
+  ASSERT_TRUE(cl.lockWhenValue(1, 5.0));
   std::atomic<bool> took{false};
-  std::thread t([&] {
-    cl.lock();
-    took = true;
-    cl.unlock();
-  });
-  t.join();
-  EXPECT_TRUE(took);
-}
-
-TEST(ConditionLockTimeouts, MatchingValueReturnsAtOnceHoldingTheLock) {
-  ConditionLock<int> cl(7);
-  ASSERT_TRUE(cl.lockWhenValue(7, 5.0));
-  std::atomic<bool> took{false};
-  std::thread t([&] {
+  std::thread taker([&] {
     cl.lock();
     took = true;
     cl.unlock();
   });
   std::this_thread::sleep_for(std::chrono::milliseconds(20));
-  EXPECT_FALSE(took) << "the lock must still be held by the waiter";
+  EXPECT_FALSE(took) << "held by the waiter until it unlocks";
   cl.unlock();
-  t.join();
-  EXPECT_TRUE(took);
-}
+  taker.join();
 
-TEST(ConditionLockTimeouts, WaiterWakesWhenAnotherThreadSetsTheValue) {
-  ConditionLock<int> cl(0);
   std::thread setter([&] {
     cl.lock();
     cl.unlockWithValue(3);
@@ -49,31 +36,21 @@ TEST(ConditionLockTimeouts, WaiterWakesWhenAnotherThreadSetsTheValue) {
   EXPECT_EQ(cl.value(), 3);
   cl.unlock();
   setter.join();
-}
-
-TEST(ConditionLockDeathTest, NegativeTimeoutStopsTheProcess) {
-  ConditionLock<int> cl(0);
   EXPECT_DEATH(cl.lockWhenValue(1, -1.0), "Fatal error");
 }
 
-TEST(AtomicValueCompareAndSwap, MakerRunsOnlyOnMatch) {
+// Guards against: atomics that return the old value, swap on a mismatch, or let two threads win.
+TEST(Atomics, ExchangeAddSubAndCompareAndSwapOnlyOnMatch) {
   AtomicValue<int> v(5);
   int calls = 0;
-  EXPECT_FALSE(v.compareAndSwap(4, [&] {
-    ++calls;
-    return 9;
-  }));
+  auto nine = [&] { return ++calls, 9; };
+  EXPECT_FALSE(v.compareAndSwap(4, nine));
   EXPECT_EQ(calls, 0);
   EXPECT_EQ(v.load(), 5);
-  EXPECT_TRUE(v.compareAndSwap(5, [&] {
-    ++calls;
-    return 9;
-  }));
+  EXPECT_TRUE(v.compareAndSwap(5, nine));
   EXPECT_EQ(calls, 1);
   EXPECT_EQ(v.load(), 9);
-}
 
-TEST(AtomicCells, ExchangeAddSubAndCompareAndExchange) {
   Atomic<int64_t> a(10);
   EXPECT_EQ(a.exchange(20), 10);
   EXPECT_EQ(a.add(5), 25);
@@ -82,7 +59,6 @@ TEST(AtomicCells, ExchangeAddSubAndCompareAndExchange) {
   EXPECT_EQ(a.load(), 18);
   EXPECT_TRUE(a.compareAndExchange(18, 1));
   EXPECT_EQ(a.load(), 1);
-
   Atomic<bool> flag(false);
   std::vector<std::thread> ts;
   std::atomic<int> winners{0};
@@ -91,6 +67,7 @@ TEST(AtomicCells, ExchangeAddSubAndCompareAndExchange) {
   EXPECT_EQ(winners, 1);
 }
 
+// Guards against: a body that throws leaving the lock taken.
 TEST(LockBodies, WithLockUnlocksWhenTheBodyThrows) {
   Lock lock;
   EXPECT_THROW(lock.withLock([]() -> int { throw std::runtime_error("x"); }), std::runtime_error);

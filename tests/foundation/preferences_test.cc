@@ -5,6 +5,9 @@
 
 #include <gtest/gtest.h>
 
+#include <functional>
+#include <optional>
+
 namespace fbf {
 namespace {
 
@@ -12,6 +15,7 @@ using testing::LogCapture;
 using testing::TestEnvironment;
 using testing::writeFile;
 
+// Guards against: preferences read once and cached, read with the wrong type or default, or written readable by others or losing other keys.
 class PreferencesFiles : public ::testing::Test {
  protected:
   TestEnvironment env;
@@ -19,14 +23,7 @@ class PreferencesFiles : public ::testing::Test {
   fs::path file(const std::string& name) { return env.preferences->fileForDomain(name); }
 };
 
-TEST_F(PreferencesFiles, MissingFileReadsAsDefaults) {
-  auto d = domain("vireond");
-  EXPECT_FALSE(d->boolForKey("VIRFeedbackFlushDisabled"));
-  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 0);
-  EXPECT_FALSE(d->stringForKey("VIRDebugParameters"));
-}
-
-TEST_F(PreferencesFiles, XmlAndBinaryFilesAreReadOnEveryUse) {
+TEST_F(PreferencesFiles, XmlAndBinaryFilesAreReadOnEveryUseAndWrittenBack) {
   PropertyList values = {{"FBFNoExit", true}, {"FlushFrequencyInSeconds", 3600}, {"VIRDebugParameters", "v=3"}};
   writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::xml));
   auto d = domain("vireond");
@@ -39,31 +36,32 @@ TEST_F(PreferencesFiles, XmlAndBinaryFilesAreReadOnEveryUse) {
   writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::binary));
   EXPECT_FALSE(d->boolForKey("FBFNoExit"));
   EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 3600);
-}
-
-TEST_F(PreferencesFiles, NegativeIntegersSurviveTheRoundTrip) {
-  auto d = domain("vireond");
   ASSERT_TRUE(d->setObject("FlushFrequencyInSeconds", -5));
-  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), -5);
+  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), -5) << "negative integers survive the round trip";
 }
 
-TEST_F(PreferencesFiles, WrongValueTypesReadAsDefaults) {
-  PropertyList values = {{"FBFNoExit", PropertyList::array({1})},
-                         {"FlushFrequencyInSeconds", "soon"},
-                         {"VIRDebugParameters", 12}};
-  writeFile(file("vireond"), serializePropertyList(values, PropertyListFormat::xml));
-  auto d = domain("vireond");
-  EXPECT_FALSE(d->boolForKey("FBFNoExit"));
-  EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 0);
-  EXPECT_FALSE(d->stringForKey("VIRDebugParameters"));
-}
-
-TEST_F(PreferencesFiles, MalformedFileMeansNoValuesAndOneErrorLine) {
-  writeFile(file("vireond"), "<?xml version=\"1.0\"?><plist><dict><key>FBFNoExit</key><true/>");
-  LogCapture logs;
-  auto d = domain("vireond");
-  EXPECT_FALSE(d->boolForKey("FBFNoExit"));
-  EXPECT_EQ(logs.count("Ignoring malformed preferences file"), 1u);
+TEST_F(PreferencesFiles, MissingMalformedOrMistypedValuesReadAsDefaults) {
+  const struct {
+    const char* name;
+    std::optional<std::string> file;
+    size_t errorLines;
+  } rows[] = {
+      {"no file", std::nullopt, 0},
+      {"wrong value types",
+       serializePropertyList({{"FBFNoExit", PropertyList::array({1})}, {"FlushFrequencyInSeconds", "soon"},
+                              {"VIRDebugParameters", 12}}, PropertyListFormat::xml), 0},
+      {"malformed", "<?xml version=\"1.0\"?><plist><dict><key>FBFNoExit</key><true/>", 1},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    if (row.file) writeFile(file("vireond"), *row.file);
+    LogCapture logs;
+    auto d = domain("vireond");
+    EXPECT_FALSE(d->boolForKey("FBFNoExit"));
+    EXPECT_EQ(d->integerForKey("FlushFrequencyInSeconds"), 0);
+    EXPECT_FALSE(d->stringForKey("VIRDebugParameters"));
+    EXPECT_EQ(logs.count("Ignoring malformed preferences file"), row.errorLines);
+  }
 }
 
 TEST_F(PreferencesFiles, WritesAreOwnerOnlyAndKeepOtherKeys) {
@@ -78,9 +76,13 @@ TEST_F(PreferencesFiles, WritesAreOwnerOnlyAndKeepOtherKeys) {
   EXPECT_EQ(attrs->mode, 0600u);
 }
 
+// Guards against: a bag read once and cached, a malformed or linked bag taken as configuration, or a mistyped value passed through.
 class BagFiles : public PreferencesFiles {};
 
-TEST_F(BagFiles, TypedAccessorsAndMissingKeys) {
+TEST_F(BagFiles, TypedAccessorsAndMissingKeysReadAnewOnEveryAccess) {
+  writeFile(env.cacheDir() / "bag.plist",
+            serializePropertyList({{"feedback_max_age_in_days", 2}}, PropertyListFormat::binary));
+  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 2);
   env.writeBag({{"feedback_url", "https://127.0.0.1:1/fb"},
                 {"feedback_max_age_in_days", 3},
                 {"max_custom_feedback_sizes", {{"UserReport", 100}, {"Crowdsourcing", "big"}, {"Usage", -1}}},
@@ -95,33 +97,34 @@ TEST_F(BagFiles, TypedAccessorsAndMissingKeys) {
   EXPECT_FALSE(bag->cohortsLookbackInDays());
 }
 
-TEST_F(BagFiles, BinaryBagIsReadAnewOnEveryAccess) {
-  writeFile(env.cacheDir() / "bag.plist",
-            serializePropertyList({{"feedback_max_age_in_days", 2}}, PropertyListFormat::binary));
-  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 2);
-  env.writeBag({{"feedback_max_age_in_days", 9}});
-  EXPECT_EQ(env.assembly().cachedBag()->feedbackMaxAgeInDays(), 9);
-}
-
-TEST_F(BagFiles, MissingMalformedOrNonDictionaryBagIsNoBag) {
-  EXPECT_FALSE(env.assembly().cachedBag());
-  LogCapture logs;
-  writeFile(env.cacheDir() / "bag.plist", "garbage\x01\x02");
-  EXPECT_FALSE(env.assembly().cachedBag());
-  EXPECT_TRUE(logs.contains("Ignoring malformed configuration bag"));
-  writeFile(env.cacheDir() / "bag.plist", serializePropertyList(PropertyList::array({1, 2}), PropertyListFormat::xml));
-  EXPECT_FALSE(env.assembly().cachedBag());
-  EXPECT_TRUE(logs.contains("top level is not a dictionary"));
-}
-
-TEST_F(BagFiles, SymlinkedBagIsNotFollowed) {
+TEST_F(BagFiles, AMissingMalformedNonDictionaryOrSymlinkedBagIsNoBag) {
   auto secret = env.temp.path() / "secret.plist";
   writeFile(secret, serializePropertyList({{"feedback_url", "https://evil"}}, PropertyListFormat::xml));
-  fs::create_symlink(secret, env.cacheDir() / "bag.plist");
-  EXPECT_FALSE(env.assembly().cachedBag());
+  const fs::path bag = env.cacheDir() / "bag.plist";
+  const struct {
+    const char* name;
+    std::function<void()> make;
+    const char* log;
+  } rows[] = {
+      {"missing", [] {}, ""},
+      {"malformed", [&] { writeFile(bag, "garbage\x01\x02"); }, "Ignoring malformed configuration bag"},
+      {"an array", [&] { writeFile(bag, serializePropertyList(PropertyList::array({1, 2}), PropertyListFormat::xml)); },
+       "top level is not a dictionary"},
+      {"a link", [&] { fs::create_symlink(secret, bag); }, ""},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    fs::remove(bag);
+    row.make();
+    LogCapture logs;
+    EXPECT_FALSE(env.assembly().cachedBag());
+    if (*row.log) {
+      EXPECT_TRUE(logs.contains(row.log));
+    }
+  }
 }
 
-
+// Guards against: binary property lists whose strings are not text being accepted.
 // Inputs the property-list fuzzer found. A binary list's strings and keys
 // may hold any character: a UTF-16 NUL aborted the process inside libplist,
 // and other bytes in an ASCII string made text that could be neither written
