@@ -62,6 +62,14 @@ inline corevireon::CVFeedbackPayload clearInput(uint64_t timestamp, uint64_t que
   return p;
 }
 
+// A payload shaped by `build`, for the kinds without a builder of their own.
+template <typename Build>
+corevireon::CVFeedbackPayload payloadWith(Build build) {
+  corevireon::CVFeedbackPayload p;
+  build(p);
+  return p;
+}
+
 inline corevireon::CVFeedbackPayload messageless(int32_t type) {
   corevireon::CVFeedbackPayload p;
   p.set_type(type);

@@ -3,349 +3,242 @@
 
 #include <gtest/gtest.h>
 
-#include <functional>
-
 namespace fbf {
 namespace {
 
 using namespace fbf::testing;
+using corevireon::CVFeedbackPayload;
 using corevireon::CVSearchResultForFeedback;
 
-std::vector<std::string> identifiersOf(const google::protobuf::RepeatedPtrField<CVSearchResultForFeedback>& rs) {
-  std::vector<std::string> out;
-  for (const auto& r : rs) out.push_back(r.has_identifier() ? r.identifier() : "<absent>");
+template <typename Items>
+std::string idsOf(const Items& items) {
+  std::string out;
+  for (const auto& r : items) out += (out.empty() ? "" : " ") + (r.has_identifier() ? r.identifier() : "-");
   return out;
 }
 
-// Results and suggestions outside the per-kind table are found through the
-// descriptors: mapped and stripped of their titles like the others, but they
-// do not count as shown or delivered.
-TEST(ItemsAnywhere, AreMappedAndStrippedWithoutBookkeeping) {
+// Processes each payload's feedback in turn, as a session does.
+void processAll(SessionProcessingHelper& helper, std::vector<CVFeedbackPayload>& payloads) {
+  for (auto& p : payloads) helper.process(mutableCodableMessage(p));
+}
+
+CVSearchResultForFeedback titled(const std::string& id, int32_t type, const std::string& title = "secret title") {
+  auto r = result(id, type);
+  r.set_title(title);
+  return r;
+}
+
+// Guards against: replacement numbers reused across keys, handed out twice for one key, or given to empty identifiers.
+TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearance) {
+  struct Call {
+    std::optional<std::string> id;
+    int32_t type;
+    std::optional<std::string> expected;
+  };
+  const std::pair<const char*, std::vector<Call>> rows[] = {
+      {"another type maps anew", {{"alpha", 3, "1"}, {"alpha", 4, "2"}, {"alpha", 3, "1"}}},
+      {"keys have no separator: ab+17 is ab1+7", {{"ab", 17, "1"}, {"ab1", 7, "1"}, {"ab", 7, "2"}}},
+      {"empty or absent uses no number", {{std::nullopt, 1, std::nullopt}, {"", 1, std::nullopt}, {"x", 1, "1"}}},
+  };
+  for (const auto& [name, calls] : rows) {
+    SCOPED_TRACE(name);
+    SessionProcessingHelper helper;
+    for (const auto& c : calls) EXPECT_EQ(helper.replacementForIdentifier(c.id, c.type), c.expected);
+  }
+  // Through the messages: one number per key across kinds, counted past nine.
+  SessionProcessingHelper helper;
+  for (int i = 0; i < 12; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
+  std::vector<CVFeedbackPayload> payloads = {
+      visibleResults(1, {result("id11", 0), result("id1", 0), result("new", 0), result("", 0)}),
+      payloadWith([](auto& p) { *p.mutable_resultengagement()->mutable_result() = result("new", 0); })};
+  processAll(helper, payloads);
+  EXPECT_EQ(idsOf(payloads[0].visibleresults().results()), "12 2 13 -");
+  EXPECT_EQ(payloads[1].resultengagement().result().identifier(), "13");
+  EXPECT_EQ(helper.nextMappedId(), 14);
+}
+
+// Guards against: an item referenced but never delivered in full not being reported missing (or reported twice,
+// out of order, or when it was delivered).
+TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
+  auto shown = [](const std::string& id, int32_t type = 5) { return visibleResults(1, {result(id, type)}); };
+  auto after = [](const std::string& id) {
+    return payloadWith([&](auto& p) { *p.mutable_resultsreceivedaftertimeout()->add_results() = result(id, 5); });
+  };
+  auto ranked = [](const std::string& id) {
+    return payloadWith([&](auto& p) { *p.mutable_resultranking()->mutable_result() = result(id, 5); });
+  };
+  auto suggested = [](const std::string& id) {
+    return payloadWith([&](auto& p) { *p.mutable_visiblesuggestions()->add_suggestions() = suggestion(id); });
+  };
+  auto engagedSuggestion = [](const std::string& id) {
+    return payloadWith([&](auto& p) { *p.mutable_suggestionengagement()->mutable_suggestion() = suggestion(id); });
+  };
   struct Row {
     const char* name;
-    std::function<void(corevireon::CVFeedbackPayload&)> build;
-    std::function<const CVSearchResultForFeedback&(const corevireon::CVFeedbackPayload&)> item;
+    std::vector<CVFeedbackPayload> payloads;
+    std::string missingResults, missingSuggestions;  // "identifier:type[:title]" each
   };
-  auto titled = [](int32_t type) {
-    auto r = result("secret-id", type);
-    r.set_title("secret title");
-    return r;
+  Row rows[] = {
+      {"shown twice, never delivered: missing once", {shown("r"), shown("r")}, "1:5", ""},
+      {"shown, then delivered", {shown("r"), after("r")}, "", ""},
+      {"delivered, then shown", {ranked("r"), shown("r")}, "", ""},
+      {"suggestion engaged but never shown", {suggested("s1"), engagedSuggestion("s1"), engagedSuggestion("s2")},
+       "", "2:1"},
+      {"the first reference is kept (type 9 keeps titles)",
+       {payloadWith([](auto& p) { *p.mutable_resultgrading()->mutable_result() = titled("r", 9, "first"); }),
+        payloadWith([](auto& p) { *p.mutable_resultengagement()->mutable_result() = titled("r", 9, "second"); })},
+       "1:9:first", ""},
+      {"in the order of their numbers",
+       {visibleResults(1, {result("a"), result("b"), result("c"), result("d"), result("e"), result("f"),
+                           result("g"), result("h"), result("i"), result("j"), result("k")})},
+       "1:2 2:2 3:2 4:2 5:2 6:2 7:2 8:2 9:2 10:2 11:2", ""},
   };
-  const Row rows[] = {
-      {"section header, plain type",
-       [&](auto& p) {
-         *p.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled(2);
-       },
-       [](const auto& p) -> const auto& { return p.visiblesectionheader().section().results().items(0); }},
-      {"missing results written by the search daemon",
-       [&](auto& p) { *p.mutable_sessionmissingresults()->add_results() = titled(5); },
-       [](const auto& p) -> const auto& { return p.sessionmissingresults().results(0); }},
+  auto describe = [](const auto& items) {
+    std::string out;
+    for (const auto& r : *items) {
+      out += (out.empty() ? "" : " ") + r.identifier() + ":" + std::to_string(r.type());
+      if constexpr (requires { r.title(); }) out += r.has_title() ? ":" + r.title() : "";
+    }
+    return out;
   };
-  for (const auto& row : rows) {
+  for (auto& row : rows) {
+    SCOPED_TRACE(row.name);
     SessionProcessingHelper helper;
-    corevireon::CVFeedbackPayload payload;
-    row.build(payload);
-    helper.process(mutableCodableMessage(payload));
-    EXPECT_EQ(row.item(payload).identifier(), "1") << row.name;
-    EXPECT_FALSE(row.item(payload).has_title()) << row.name;
-    EXPECT_EQ(helper.identifiersMapped(), 1u) << row.name;
-    EXPECT_EQ(helper.titlesCleared(), 1u) << row.name;
-    EXPECT_TRUE(helper.missingResults()->empty()) << row.name;
+    processAll(helper, row.payloads);
+    ASSERT_TRUE(helper.missingResults() && helper.missingSuggestions());
+    EXPECT_EQ(describe(helper.missingResults()), row.missingResults);
+    EXPECT_EQ(describe(helper.missingSuggestions()), row.missingSuggestions);
   }
-  // A title-keeping type keeps it wherever it appears; a suggestion is mapped.
+}
+
+// Guards against: rankings processed in the wrong order, section results kept beside result rankings, or
+// ranked items not counting as delivered.
+TEST(RankingProcessing, SectionsInOrderResultRankingsFirst) {
+  auto sectionRanking = [](corevireon::CVSectionRankingFeedback* sr, const std::string& ranked,
+                           const std::string& inSection) {
+    if (!ranked.empty()) *sr->add_results()->mutable_result() = result(ranked);
+    *sr->mutable_section()->mutable_results()->add_items() = result(inSection);
+  };
   SessionProcessingHelper helper;
-  corevireon::CVFeedbackPayload payload;
-  *payload.mutable_sessionmissingsuggestions()->add_suggestions() = suggestion("secret-s");
-  helper.process(mutableCodableMessage(payload));
-  EXPECT_EQ(payload.sessionmissingsuggestions().suggestions(0).identifier(), "1");
-  corevireon::CVFeedbackPayload header;
-  *header.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled(9);
-  helper.process(mutableCodableMessage(header));
-  EXPECT_EQ(header.visiblesectionheader().section().results().items(0).title(), "secret title");
-  EXPECT_EQ(header.visiblesectionheader().section().results().items(0).identifier(), "2");
-}
-
-// Replacement numbers are handed out per key (identifier + decimal type).
-class IdentifierReplacement : public ::testing::Test {
- protected:
-  SessionProcessingHelper helper;
-};
-
-TEST_F(IdentifierReplacement, SameIdentifierInTwoMessagesMapsOnce) {
-  auto shown = visibleResults(1, {result("alpha", 3), result("beta", 3)});
-  corevireon::CVResultEngagementFeedback engaged;
-  *engaged.mutable_result() = result("alpha", 3);
-
-  helper.process(shown.mutable_visibleresults());
-  helper.process(&engaged);
-
-  EXPECT_EQ(identifiersOf(shown.visibleresults().results()), (std::vector<std::string>{"1", "2"}));
-  EXPECT_EQ(engaged.result().identifier(), "1");
-  EXPECT_EQ(helper.nextMappedId(), 3);
-}
-
-TEST_F(IdentifierReplacement, SameIdentifierUnderAnotherTypeMapsAnew) {
-  EXPECT_EQ(helper.replacementForIdentifier("alpha", 3), "1");
-  EXPECT_EQ(helper.replacementForIdentifier("alpha", 4), "2");
-  EXPECT_EQ(helper.replacementForIdentifier("alpha", 3), "1");
-  EXPECT_EQ(helper.allIdSet(), (std::set<std::string>{"1", "2"}));
-}
-
-TEST_F(IdentifierReplacement, KeysHaveNoSeparatorSoAb17AndAb1With7Collide) {
-  EXPECT_EQ(helper.replacementForIdentifier("ab", 17), "1");
-  EXPECT_EQ(helper.replacementForIdentifier("ab1", 7), "1");
-  EXPECT_EQ(helper.replacementForIdentifier("ab", 7), "2");
-}
-
-TEST_F(IdentifierReplacement, EmptyOrAbsentIdentifierBecomesAbsentAndUsesNoNumber) {
-  EXPECT_EQ(helper.replacementForIdentifier(std::nullopt, 1), std::nullopt);
-  EXPECT_EQ(helper.replacementForIdentifier("", 1), std::nullopt);
-  auto shown = visibleResults(1, {result("", 2), result("x", 2)});
-  helper.process(shown.mutable_visibleresults());
-  EXPECT_FALSE(shown.visibleresults().results(0).has_identifier());
-  EXPECT_EQ(shown.visibleresults().results(1).identifier(), "1");
-}
-
-TEST_F(IdentifierReplacement, NumberingRestartsForEverySession) {
-  EXPECT_EQ(helper.replacementForIdentifier("x", 1), "1");
-  SessionProcessingHelper next;
-  EXPECT_EQ(next.replacementForIdentifier("y", 1), "1");
-}
-
-TEST_F(IdentifierReplacement, NumbersFollowFirstAppearanceBeyondNine) {
-  for (int i = 0; i < 12; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
-  auto shown = visibleResults(1, {result("id11", 0), result("id1", 0), result("new", 0)});
-  helper.process(shown.mutable_visibleresults());
-  EXPECT_EQ(identifiersOf(shown.visibleresults().results()), (std::vector<std::string>{"12", "2", "13"}));
-}
-
-// Referenced items that are never delivered in full become missing.
-class ReferencedAndExpanded : public ::testing::Test {
- protected:
-  SessionProcessingHelper helper;
-};
-
-TEST_F(ReferencedAndExpanded, ShownButNeverDeliveredIsMissingOnceWithItsReplacement) {
-  auto first = visibleResults(1, {result("r", 5)});
-  auto again = visibleResults(1, {result("r", 5)});
-  helper.process(first.mutable_visibleresults());
-  helper.process(again.mutable_visibleresults());
-  auto missing = helper.missingResults();
-  ASSERT_TRUE(missing);
-  ASSERT_EQ(missing->size(), 1u);
-  EXPECT_EQ((*missing)[0].identifier(), "1");
-  EXPECT_EQ((*missing)[0].type(), 5);
-}
-
-TEST_F(ReferencedAndExpanded, ReferencedThenExpandedIsNotMissing) {
-  auto shown = visibleResults(1, {result("r", 5)});
-  corevireon::CVResultsReceivedAfterTimeoutFeedback delivered;
-  *delivered.add_results() = result("r", 5);
-  helper.process(shown.mutable_visibleresults());
-  helper.process(&delivered);
-  EXPECT_TRUE(helper.missingResults()->empty());
-  EXPECT_EQ(helper.expandedIdSet(), std::set<std::string>{"1"});
-}
-
-TEST_F(ReferencedAndExpanded, ReferencedAfterExpansionIsNeverRecorded) {
-  corevireon::CVResultRankingFeedback ranking;
-  *ranking.mutable_result() = result("r", 5);
-  helper.process(&ranking);
-  auto shown = visibleResults(1, {result("r", 5)});
-  helper.process(shown.mutable_visibleresults());
-  EXPECT_TRUE(helper.missingResults()->empty());
-}
-
-TEST_F(ReferencedAndExpanded, SuggestionEngagedButNeverShownIsAMissingSuggestion) {
-  corevireon::CVVisibleSuggestionsFeedback shown;
-  *shown.add_suggestions() = suggestion("s1");
-  corevireon::CVSuggestionEngagementFeedback engagedShown;
-  *engagedShown.mutable_suggestion() = suggestion("s1");
-  corevireon::CVSuggestionEngagementFeedback engagedUnknown;
-  *engagedUnknown.mutable_suggestion() = suggestion("s2");
-  helper.process(&shown);
-  helper.process(&engagedShown);
-  helper.process(&engagedUnknown);
-  auto missing = helper.missingSuggestions();
-  ASSERT_EQ(missing->size(), 1u);
-  EXPECT_EQ((*missing)[0].identifier(), "2");
-  EXPECT_TRUE(helper.missingResults()->empty());
-}
-
-TEST_F(ReferencedAndExpanded, FirstReferenceIsKept) {
-  // Type 9 keeps its title, so the copy kept tells the two references apart.
-  auto r1 = result("r", 9);
-  r1.set_title("first");
-  auto r2 = result("r", 9);
-  r2.set_title("second");
-  corevireon::CVResultGradingFeedback graded;
-  *graded.mutable_result() = r1;
-  corevireon::CVResultEngagementFeedback engaged;
-  *engaged.mutable_result() = r2;
-  helper.process(&graded);
-  helper.process(&engaged);
-  ASSERT_EQ(helper.missingResults()->size(), 1u);
-  EXPECT_EQ(helper.missingResults()->front().title(), "first");
-}
-
-TEST_F(ReferencedAndExpanded, MissingResultsComeInOrderOfTheirNumbers) {
-  std::initializer_list<CVSearchResultForFeedback> many = {
-      result("a"), result("b"), result("c"), result("d"), result("e"), result("f"),
-      result("g"), result("h"), result("i"), result("j"), result("k")};
-  auto shown = visibleResults(1, many);
-  helper.process(shown.mutable_visibleresults());
-  std::vector<std::string> ids;
-  const auto missing = helper.missingResults();
-  for (const auto& r : *missing) ids.push_back(r.identifier());
-  EXPECT_EQ(ids, (std::vector<std::string>{"1", "2", "3", "4", "5", "6", "7", "8", "9", "10", "11"}));
-}
-
-// Rankings are taken apart section by section.
-class RankingProcessing : public ::testing::Test {
- protected:
-  static corevireon::CVSectionRankingFeedback sectionRanking(const std::string& ranked, const std::string& inSection,
-                                                             bool withResultRanking) {
-    corevireon::CVSectionRankingFeedback sr;
-    if (withResultRanking) *sr.add_results()->mutable_result() = result(ranked);
-    *sr.mutable_section()->mutable_results()->add_items() = result(inSection);
-    return sr;
-  }
-  SessionProcessingHelper helper;
-};
-
-TEST_F(RankingProcessing, ThreeSectionRankingsAreProcessedInOrderResultRankingsFirst) {
-  corevireon::CVRankingFeedback ranking;
-  *ranking.add_sections() = sectionRanking("a-ranked", "a-section", true);
-  *ranking.add_sections() = sectionRanking("b-ranked", "b-section", true);
-  *ranking.add_sections() = sectionRanking("c-ranked", "c-section", false);
-  helper.process(&ranking);
-
-  // The numbers handed out show the order in which the items were seen.
+  std::vector<CVFeedbackPayload> payloads = {payloadWith([&](auto& p) {
+    sectionRanking(p.mutable_ranking()->add_sections(), "a-ranked", "a-section");
+    sectionRanking(p.mutable_ranking()->add_sections(), "b-ranked", "b-section");
+    sectionRanking(p.mutable_ranking()->add_sections(), "", "c-section");
+  })};
+  processAll(helper, payloads);
+  const auto& ranking = payloads[0].ranking();
   EXPECT_EQ(ranking.sections(0).results(0).result().identifier(), "1");
   EXPECT_EQ(ranking.sections(1).results(0).result().identifier(), "3");
+  EXPECT_FALSE(ranking.sections(1).section().has_results());  // cleared beside result rankings
+  ASSERT_TRUE(ranking.sections(2).section().has_results());
   EXPECT_EQ(ranking.sections(2).section().results().items(0).identifier(), "5");
   auto probe = visibleResults(1, {result("a-section"), result("b-section")});
   helper.process(probe.mutable_visibleresults());
-  EXPECT_EQ(identifiersOf(probe.visibleresults().results()), (std::vector<std::string>{"2", "4"}));
-  // Everything in a ranking counts as delivered.
+  EXPECT_EQ(idsOf(probe.visibleresults().results()), "2 4");
   EXPECT_TRUE(helper.missingResults()->empty());
-}
 
-TEST_F(RankingProcessing, SectionResultsAreClearedOnlyWhenResultRankingsArePresent) {
-  auto with = sectionRanking("r", "s", true);
-  auto without = sectionRanking("", "t", false);
-  helper.process(&with);
-  helper.process(&without);
-  EXPECT_TRUE(with.has_section());
-  EXPECT_FALSE(with.section().has_results());
-  ASSERT_TRUE(without.section().has_results());
-  EXPECT_EQ(without.section().results().items(0).identifier(), "3");
-}
-
-TEST_F(RankingProcessing, ResultRankingExpandsDuplicatesHiddenAndResultInThatOrder) {
   corevireon::CVResultRankingFeedback rr;
   *rr.mutable_result() = result("main");
   *rr.add_duplicateresults() = result("dup");
   *rr.add_hiddenresults() = result("hidden");
-  helper.process(&rr);
-  EXPECT_EQ(rr.duplicateresults(0).identifier(), "1");
-  EXPECT_EQ(rr.hiddenresults(0).identifier(), "2");
-  EXPECT_EQ(rr.result().identifier(), "3");
-  EXPECT_EQ(helper.expandedIdSet(), (std::set<std::string>{"1", "2", "3"}));
-}
-
-TEST_F(RankingProcessing, LateSectionsAreExpanded) {
   corevireon::CVLateSectionsAppendedFeedback late;
   *late.add_sections()->mutable_results()->add_items() = result("x");
   *late.add_sections()->mutable_results()->add_items() = result("y");
-  helper.process(&late);
-  EXPECT_EQ(late.sections(1).results().items(0).identifier(), "2");
-  EXPECT_EQ(helper.expandedIdSet().size(), 2u);
+  SessionProcessingHelper other;
+  other.process(&rr);
+  other.process(&late);
+  EXPECT_EQ(idsOf(rr.duplicateresults()) + " " + idsOf(rr.hiddenresults()) + " " + rr.result().identifier(), "1 2 3");
+  EXPECT_EQ(late.sections(1).results().items(0).identifier(), "5");
+  EXPECT_EQ(other.expandedIdSet(), (std::set<std::string>{"1", "2", "3", "4", "5"}));
 }
 
-// The privacy rewrites made while gathering.
-class EngagementRewrites : public ::testing::TestWithParam<int32_t> {};
+// Guards against: a title or an unengaged-suggestion flag leaving for a result type that must not keep it.
+TEST(EngagementRewrites, TitleKeptOnlyForTheEightListedTypes) {
+  const std::set<int32_t> keeping = {9, 10, 11, 12, 13, 14, 18, 19};
+  for (int32_t type = 0; type < 22; ++type) {
+    corevireon::CVResultEngagementFeedback engaged;
+    *engaged.mutable_result() = result("r", type);
+    engaged.set_titletext("what the user saw");
+    engaged.set_matchesunengagedsuggestion(true);
+    SessionProcessingHelper().process(&engaged);
+    EXPECT_EQ(engaged.has_titletext(), keeping.count(type) == 1) << "type " << type;
+    EXPECT_EQ(engaged.matchesunengagedsuggestion(), keeping.count(type) == 1) << "type " << type;
+  }
+  corevireon::CVResultEngagementFeedback withoutResult;
+  withoutResult.set_titletext("title");
+  SessionProcessingHelper().process(&withoutResult);
+  EXPECT_FALSE(withoutResult.has_titletext());
+}
 
-TEST_P(EngagementRewrites, TitleKeptOnlyForTheEightListedTypes) {
-  const int32_t type = GetParam();
-  const bool kept = type == 9 || type == 10 || type == 11 || type == 12 || type == 13 || type == 14 ||
-                    type == 18 || type == 19;
-  corevireon::CVResultEngagementFeedback engaged;
-  *engaged.mutable_result() = result("r", type);
-  engaged.set_titletext("what the user saw");
-  engaged.set_matchesunengagedsuggestion(true);
+// Guards against: items outside the per-kind table escaping the rewrite, or counting as shown.
+TEST(ItemsAnywhere, AreMappedAndStrippedWithoutBookkeeping) {
   SessionProcessingHelper helper;
-  helper.process(&engaged);
-  EXPECT_EQ(engaged.has_titletext(), kept) << "type " << type;
-  EXPECT_EQ(engaged.matchesunengagedsuggestion(), kept) << "type " << type;
+  std::vector<CVFeedbackPayload> payloads = {
+      payloadWith([](auto& p) {
+        *p.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled("a", 2);
+      }),
+      payloadWith([](auto& p) { *p.mutable_sessionmissingresults()->add_results() = titled("b", 5); }),
+      payloadWith([](auto& p) { *p.mutable_sessionmissingsuggestions()->add_suggestions() = suggestion("c"); }),
+      payloadWith([](auto& p) {
+        *p.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled("d", 9);
+      })};
+  processAll(helper, payloads);
+  const auto& header = payloads[0].visiblesectionheader().section().results().items(0);
+  const auto& missing = payloads[1].sessionmissingresults().results(0);
+  const auto& kept = payloads[3].visiblesectionheader().section().results().items(0);
+  EXPECT_EQ(header.identifier() + missing.identifier() + kept.identifier(), "124");
+  EXPECT_EQ(payloads[2].sessionmissingsuggestions().suggestions(0).identifier(), "3");
+  EXPECT_FALSE(header.has_title() || missing.has_title());
+  EXPECT_EQ(kept.title(), "secret title");
+  EXPECT_EQ(helper.identifiersMapped(), 4u);
+  EXPECT_EQ(helper.titlesCleared(), 2u);
+  EXPECT_TRUE(helper.missingResults()->empty() && helper.missingSuggestions()->empty());
 }
 
-INSTANTIATE_TEST_SUITE_P(ResultTypes, EngagementRewrites, ::testing::Range(0, 22));
-
-TEST(EngagementWithoutResult, LosesItsTitle) {
-  corevireon::CVResultEngagementFeedback engaged;
-  engaged.set_titletext("title");
-  SessionProcessingHelper helper;
-  helper.process(&engaged);
-  EXPECT_FALSE(engaged.has_titletext());
-}
-
-class SectionEngagementRewrites : public ::testing::Test {
- protected:
-  corevireon::CVSectionEngagementFeedback engagement(corevireon::CVTriggerEngagementEvent trigger) {
+// Guards against: an engaged section keeping its results (or an expanded one losing them).
+TEST(SectionEngagementRewrites, ResultsRemovedUnlessExpandedButStillReferenced) {
+  for (auto trigger : {corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND}) {
+    const bool expand = trigger == corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND;
     corevireon::CVSectionEngagementFeedback se;
     se.set_triggerevent(trigger);
     se.mutable_section()->set_bundleidentifier("vireon.apps");
     *se.mutable_section()->mutable_results()->add_items() = result("r");
-    return se;
+    SessionProcessingHelper helper;
+    helper.process(&se);
+    EXPECT_EQ(se.section().bundleidentifier(), "vireon.apps");
+    ASSERT_EQ(se.section().has_results(), expand);
+    if (expand) {
+      EXPECT_EQ(se.section().results().items(0).identifier(), "1");
+    } else {
+      EXPECT_EQ(idsOf(*helper.missingResults()), "1");
+    }
   }
-  SessionProcessingHelper helper;
-};
-
-TEST_F(SectionEngagementRewrites, ResultsRemovedUnlessExpandedButStillReferenced) {
-  auto tapped = engagement(corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP);
-  helper.process(&tapped);
-  EXPECT_FALSE(tapped.section().has_results());
-  EXPECT_EQ(tapped.section().bundleidentifier(), "vireon.apps");
-  ASSERT_EQ(helper.missingResults()->size(), 1u);
-  EXPECT_EQ(helper.missingResults()->front().identifier(), "1");
 }
 
-TEST_F(SectionEngagementRewrites, ExpandTriggerKeepsTheResults) {
-  auto expanded = engagement(corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND);
-  helper.process(&expanded);
-  ASSERT_TRUE(expanded.section().has_results());
-  EXPECT_EQ(expanded.section().results().items(0).identifier(), "1");
-}
-
-class LocalApplicationCodes : public ::testing::Test {
- protected:
-  static CVSearchResultForFeedback app(int32_t type) {
-    auto r = result("app", type);
+// Guards against: local application codes leaving unmasked, or masked for type 20 or non-local results.
+TEST(LocalApplicationCodes, SetToTwoUnlessType20AndCarriedIntoTheMissingList) {
+  auto app = [](int32_t type) {
+    auto r = result("app" + std::to_string(type), type);
     r.set_islocalapplicationresult(true);
     r.set_knownapplicationbundleidentifier(77);
     r.set_knownresultbundleid(78);
     return r;
-  }
-  SessionProcessingHelper helper;
-};
-
-TEST_F(LocalApplicationCodes, SetToTwoUnlessType20AndCarriedIntoTheMissingList) {
-  auto shown = visibleResults(1, {app(3), app(20)});
+  };
   auto notLocal = result("web", 3);
   notLocal.set_knownresultbundleid(5);
-  *shown.mutable_visibleresults()->add_results() = notLocal;
+  auto shown = visibleResults(1, {app(3), app(20), notLocal});
+  SessionProcessingHelper helper;
   helper.process(shown.mutable_visibleresults());
-  const auto& rs = shown.visibleresults().results();
-  EXPECT_EQ(rs[0].knownapplicationbundleidentifier(), 2);
-  EXPECT_EQ(rs[0].knownresultbundleid(), 2);
-  EXPECT_EQ(rs[1].knownapplicationbundleidentifier(), 77);
-  EXPECT_EQ(rs[1].knownresultbundleid(), 78);
-  EXPECT_EQ(rs[2].knownresultbundleid(), 5);
+  std::string codes;
+  for (const auto& r : shown.visibleresults().results()) {
+    codes += std::to_string(r.knownapplicationbundleidentifier()) + "/" + std::to_string(r.knownresultbundleid()) + " ";
+  }
+  EXPECT_EQ(codes, "2/2 77/78 0/5 ");
   ASSERT_EQ(helper.missingResults()->size(), 3u);
   EXPECT_EQ(helper.missingResults()->front().knownresultbundleid(), 2);
 }
 
+// Guards against: query texts or punch-outs leaving for a result type other than 1, or the title being cleared.
 TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
   auto r = webResult("x", "https://example.com/");
   r.set_userinput("typed");
@@ -358,29 +251,29 @@ TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
   redact(typeOne);
   EXPECT_FALSE(r.has_userinput() || r.has_completedquery() || r.has_intendedquery() || r.has_punchout());
   EXPECT_EQ(r.title(), "kept");
-  EXPECT_TRUE(typeOne.has_userinput() && typeOne.has_punchout());
+  EXPECT_TRUE(typeOne.has_userinput() && typeOne.has_completedquery() && typeOne.has_intendedquery() &&
+              typeOne.has_punchout());
 }
 
+// Guards against: the results a feedback contains being gathered from the wrong fields or in the wrong order.
 TEST(ContainedResults, FollowTheKindsOfFeedback) {
+  auto ids = [](const auto& feedback) {
+    std::string out;
+    for (const auto* r : containedResults(feedback)) out += r->identifier() + " ";
+    return out;
+  };
   corevireon::CVRankingFeedback ranking;
   auto* sr = ranking.add_sections();
   *sr->add_results()->mutable_result() = result("ranked-only");
   *sr->mutable_section()->mutable_results()->add_items() = result("s1");
   *ranking.add_sections()->mutable_section()->mutable_results()->add_items() = result("s2");
-  std::vector<std::string> ids;
-  for (const auto* r : containedResults(ranking)) ids.push_back(r->identifier());
-  EXPECT_EQ(ids, (std::vector<std::string>{"s1", "s2"}));
-
+  EXPECT_EQ(ids(ranking), "s1 s2 ");
   corevireon::CVResultRankingFeedback rr;
   *rr.mutable_result() = result("main");
   *rr.add_hiddenresults() = result("hidden");
   *rr.add_duplicateresults() = result("dup");
-  ids.clear();
-  for (const auto* r : containedResults(rr)) ids.push_back(r->identifier());
-  EXPECT_EQ(ids, (std::vector<std::string>{"dup", "hidden", "main"}));
-
-  corevireon::CVClearInputFeedback other;
-  EXPECT_TRUE(containedResults(other).empty());
+  EXPECT_EQ(ids(rr), "dup hidden main ");
+  EXPECT_EQ(ids(corevireon::CVClearInputFeedback()), "");
 }
 
 }  // namespace
