@@ -10,6 +10,16 @@
 
 namespace fbf::testing {
 
+// A payload shaped by `build`, for the kinds without a builder of their own.
+template <typename Build>
+corevireon::CVFeedbackPayload payloadWith(Build build, uint64_t queryId = 0, int32_t type = 0) {
+  corevireon::CVFeedbackPayload p;
+  p.set_queryid(queryId);
+  p.set_type(type);
+  build(p);
+  return p;
+}
+
 inline corevireon::CVSearchResultForFeedback result(const std::string& id, int32_t type = 2) {
   corevireon::CVSearchResultForFeedback r;
   r.set_identifier(id);
@@ -32,48 +42,27 @@ inline corevireon::CVSearchSuggestionForFeedback suggestion(const std::string& i
   return s;
 }
 
-inline corevireon::CVFeedbackPayload visibleResults(uint64_t queryId,
-                                                    std::initializer_list<corevireon::CVSearchResultForFeedback> rs,
-                                                    uint64_t timestamp = 0) {
-  corevireon::CVFeedbackPayload p;
-  p.set_queryid(queryId);
-  p.set_type(8);
-  auto* m = p.mutable_visibleresults();
-  m->set_timestamp(timestamp);
-  for (const auto& r : rs) *m->add_results() = r;
-  return p;
+inline corevireon::CVFeedbackPayload visibleResults(
+    uint64_t queryId, std::initializer_list<corevireon::CVSearchResultForFeedback> rs, uint64_t timestamp = 0) {
+  return payloadWith([&](auto& p) {
+    p.mutable_visibleresults()->set_timestamp(timestamp);
+    for (const auto& r : rs) *p.mutable_visibleresults()->add_results() = r;
+  }, queryId, 8);
 }
 
-inline corevireon::CVFeedbackPayload cba(uint64_t queryId, std::optional<std::string> url, uint64_t timestamp = 0) {
-  corevireon::CVFeedbackPayload p;
-  p.set_queryid(queryId);
-  p.set_type(40);
-  auto* m = p.mutable_cbaengagement();
-  m->set_timestamp(timestamp);
-  if (url) m->set_url(*url);
-  return p;
+inline corevireon::CVFeedbackPayload cba(uint64_t queryId, std::optional<std::string> url) {
+  return payloadWith([&](auto& p) {
+    p.mutable_cbaengagement()->set_timestamp(0);
+    if (url) p.mutable_cbaengagement()->set_url(*url);
+  }, queryId, 40);
 }
 
 inline corevireon::CVFeedbackPayload clearInput(uint64_t timestamp, uint64_t queryId = 0) {
-  corevireon::CVFeedbackPayload p;
-  p.set_queryid(queryId);
-  p.set_type(25);
-  p.mutable_clearinput()->set_timestamp(timestamp);
-  return p;
-}
-
-// A payload shaped by `build`, for the kinds without a builder of their own.
-template <typename Build>
-corevireon::CVFeedbackPayload payloadWith(Build build) {
-  corevireon::CVFeedbackPayload p;
-  build(p);
-  return p;
+  return payloadWith([&](auto& p) { p.mutable_clearinput()->set_timestamp(timestamp); }, queryId, 25);
 }
 
 inline corevireon::CVFeedbackPayload messageless(int32_t type) {
-  corevireon::CVFeedbackPayload p;
-  p.set_type(type);
-  return p;
+  return payloadWith([](auto&) {}, 0, type);
 }
 
 }  // namespace fbf::testing

@@ -60,18 +60,21 @@ TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearanc
 // Guards against: an item referenced but never delivered in full not being reported missing (or reported twice,
 // out of order, or when it was delivered).
 TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
-  auto shown = [](const std::string& id, int32_t type = 5) { return visibleResults(1, {result(id, type)}); };
-  auto after = [](const std::string& id) {
+  auto shown = [](const std::string& id) { return visibleResults(1, {result(id, 5)}); };
+  auto late = [](const std::string& id) {
     return payloadWith([&](auto& p) { *p.mutable_resultsreceivedaftertimeout()->add_results() = result(id, 5); });
   };
   auto ranked = [](const std::string& id) {
     return payloadWith([&](auto& p) { *p.mutable_resultranking()->mutable_result() = result(id, 5); });
   };
-  auto suggested = [](const std::string& id) {
-    return payloadWith([&](auto& p) { *p.mutable_visiblesuggestions()->add_suggestions() = suggestion(id); });
+  auto suggested = [](const std::string& id, bool engaged) {
+    return payloadWith([&](auto& p) {
+      *(engaged ? p.mutable_suggestionengagement()->mutable_suggestion()
+                : p.mutable_visiblesuggestions()->add_suggestions()) = suggestion(id);
+    });
   };
-  auto engagedSuggestion = [](const std::string& id) {
-    return payloadWith([&](auto& p) { *p.mutable_suggestionengagement()->mutable_suggestion() = suggestion(id); });
+  auto graded = [](auto mutableKind, const char* title) {
+    return payloadWith([&](auto& p) { *(p.*mutableKind)()->mutable_result() = titled("r", 9, title); });
   };
   struct Row {
     const char* name;
@@ -80,13 +83,13 @@ TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
   };
   Row rows[] = {
       {"shown twice, never delivered: missing once", {shown("r"), shown("r")}, "1:5", ""},
-      {"shown, then delivered", {shown("r"), after("r")}, "", ""},
+      {"shown, then delivered", {shown("r"), late("r")}, "", ""},
       {"delivered, then shown", {ranked("r"), shown("r")}, "", ""},
-      {"suggestion engaged but never shown", {suggested("s1"), engagedSuggestion("s1"), engagedSuggestion("s2")},
+      {"suggestion engaged, never shown", {suggested("s1", false), suggested("s1", true), suggested("s2", true)},
        "", "2:1"},
       {"the first reference is kept (type 9 keeps titles)",
-       {payloadWith([](auto& p) { *p.mutable_resultgrading()->mutable_result() = titled("r", 9, "first"); }),
-        payloadWith([](auto& p) { *p.mutable_resultengagement()->mutable_result() = titled("r", 9, "second"); })},
+       {graded(&CVFeedbackPayload::mutable_resultgrading, "first"),
+        graded(&CVFeedbackPayload::mutable_resultengagement, "second")},
        "1:9:first", ""},
       {"in the order of their numbers",
        {visibleResults(1, {result("a"), result("b"), result("c"), result("d"), result("e"), result("f"),
@@ -217,23 +220,20 @@ TEST(SectionEngagementRewrites, ResultsRemovedUnlessExpandedButStillReferenced) 
 
 // Guards against: local application codes leaving unmasked, or masked for type 20 or non-local results.
 TEST(LocalApplicationCodes, SetToTwoUnlessType20AndCarriedIntoTheMissingList) {
-  auto app = [](int32_t type) {
-    auto r = result("app" + std::to_string(type), type);
-    r.set_islocalapplicationresult(true);
-    r.set_knownapplicationbundleidentifier(77);
-    r.set_knownresultbundleid(78);
-    return r;
-  };
-  auto notLocal = result("web", 3);
-  notLocal.set_knownresultbundleid(5);
-  auto shown = visibleResults(1, {app(3), app(20), notLocal});
+  auto shown = visibleResults(1, {result("app", 3), result("app", 20), result("web", 3)});
+  for (int i = 0; i < 3; ++i) {
+    auto* r = shown.mutable_visibleresults()->mutable_results(i);
+    r->set_islocalapplicationresult(i < 2);
+    r->set_knownapplicationbundleidentifier(77);
+    r->set_knownresultbundleid(78);
+  }
   SessionProcessingHelper helper;
   helper.process(shown.mutable_visibleresults());
   std::string codes;
   for (const auto& r : shown.visibleresults().results()) {
     codes += std::to_string(r.knownapplicationbundleidentifier()) + "/" + std::to_string(r.knownresultbundleid()) + " ";
   }
-  EXPECT_EQ(codes, "2/2 77/78 0/5 ");
+  EXPECT_EQ(codes, "2/2 77/78 77/78 ");
   ASSERT_EQ(helper.missingResults()->size(), 3u);
   EXPECT_EQ(helper.missingResults()->front().knownresultbundleid(), 2);
 }
