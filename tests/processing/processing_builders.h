@@ -3,12 +3,23 @@
 
 #include "corevireon.pb.h"
 
+#include <google/protobuf/text_format.h>
+#include <gtest/gtest.h>
+
 #include <cstdint>
 #include <initializer_list>
 #include <optional>
 #include <string>
 
 namespace fbf::testing {
+
+// A message from its text form, e.g. pb(R"(visibleResults { results { identifier: "r" } })").
+template <typename T = corevireon::CVFeedbackPayload>
+T pb(const std::string& text) {
+  T m;
+  EXPECT_TRUE(google::protobuf::TextFormat::ParseFromString(text, &m)) << text;
+  return m;
+}
 
 // A payload shaped by `build`, for the kinds without a builder of their own.
 template <typename Build>

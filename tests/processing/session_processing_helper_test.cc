@@ -114,45 +114,77 @@ TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
   }
 }
 
-// Guards against: rankings processed in the wrong order, section results kept beside result rankings, or
-// ranked items not counting as delivered.
-TEST(RankingProcessing, SectionsInOrderResultRankingsFirst) {
-  auto sectionRanking = [](corevireon::CVSectionRankingFeedback* sr, const std::string& ranked,
-                           const std::string& inSection) {
-    if (!ranked.empty()) *sr->add_results()->mutable_result() = result(ranked);
-    *sr->mutable_section()->mutable_results()->add_items() = result(inSection);
+// Guards against: a rewrite made to the wrong items or in the wrong order: rankings section by section with result
+// rankings first (their sections' results cleared), items outside the per-kind table, engaged sections, local
+// application codes.
+TEST(Rewrites, EachKindRewrittenInPlace) {
+  struct Row {
+    const char* name;
+    std::vector<std::string> in;
+    std::string out, missing, counts;  // payloads and missing results as text; identifiers mapped/titles cleared
   };
-  SessionProcessingHelper helper;
-  std::vector<CVFeedbackPayload> payloads = {payloadWith([&](auto& p) {
-    sectionRanking(p.mutable_ranking()->add_sections(), "a-ranked", "a-section");
-    sectionRanking(p.mutable_ranking()->add_sections(), "b-ranked", "b-section");
-    sectionRanking(p.mutable_ranking()->add_sections(), "", "c-section");
-  })};
-  processAll(helper, payloads);
-  const auto& ranking = payloads[0].ranking();
-  EXPECT_EQ(ranking.sections(0).results(0).result().identifier(), "1");
-  EXPECT_EQ(ranking.sections(1).results(0).result().identifier(), "3");
-  EXPECT_FALSE(ranking.sections(1).section().has_results());  // cleared beside result rankings
-  ASSERT_TRUE(ranking.sections(2).section().has_results());
-  EXPECT_EQ(ranking.sections(2).section().results().items(0).identifier(), "5");
-  auto probe = visibleResults(1, {result("a-section"), result("b-section")});
-  helper.process(probe.mutable_visibleresults());
-  EXPECT_EQ(idsOf(probe.visibleresults().results()), "2 4");
-  EXPECT_TRUE(helper.missingResults()->empty());
-
-  corevireon::CVResultRankingFeedback rr;
-  *rr.mutable_result() = result("main");
-  *rr.add_duplicateresults() = result("dup");
-  *rr.add_hiddenresults() = result("hidden");
-  corevireon::CVLateSectionsAppendedFeedback late;
-  *late.add_sections()->mutable_results()->add_items() = result("x");
-  *late.add_sections()->mutable_results()->add_items() = result("y");
-  SessionProcessingHelper other;
-  other.process(&rr);
-  other.process(&late);
-  EXPECT_EQ(idsOf(rr.duplicateresults()) + " " + idsOf(rr.hiddenresults()) + " " + rr.result().identifier(), "1 2 3");
-  EXPECT_EQ(late.sections(1).results().items(0).identifier(), "5");
-  EXPECT_EQ(other.expandedIdSet(), (std::set<std::string>{"1", "2", "3", "4", "5"}));
+  const Row rows[] = {
+      {"ranking",
+       {R"(ranking { sections { results { result { identifier: "a1" } } section { results { items { identifier: "a2" } } } }
+           sections { results { result { identifier: "b1" } } section { results { items { identifier: "b2" } } } }
+           sections { section { results { items { identifier: "c2" } } } } })",
+        R"(visibleResults { results { identifier: "a2" } results { identifier: "b2" } })"},
+       R"(ranking { sections { results { result { identifier: "1" } } section { } } )"
+       R"(sections { results { result { identifier: "3" } } section { } } )"
+       R"(sections { section { results { items { identifier: "5" } } } } } | )"
+       R"(visibleResults { results { identifier: "2" } results { identifier: "4" } })",
+       "", "7/0"},
+      {"result ranking and late sections",
+       {R"(resultRanking { result { identifier: "m" } duplicateResults { identifier: "d" } hiddenResults { identifier: "h" } })",
+        R"(lateSectionsAppended { sections { results { items { identifier: "x" } } } sections { results { items { identifier: "y" } } } })"},
+       R"(resultRanking { result { identifier: "3" } duplicateResults { identifier: "1" } hiddenResults { identifier: "2" } } | )"
+       R"(lateSectionsAppended { sections { results { items { identifier: "4" } } } sections { results { items { identifier: "5" } } } })",
+       "", "5/0"},
+      {"items anywhere: mapped and stripped, never missing",
+       {R"(visibleSectionHeader { section { results { items { identifier: "a" type: 2 title: "t" } } } })",
+        R"(sessionMissingResults { results { identifier: "b" type: 5 title: "t" } })",
+        R"(sessionMissingSuggestions { suggestions { identifier: "c" } })",
+        R"(visibleSectionHeader { section { results { items { identifier: "d" type: 9 title: "t" } } } })"},
+       R"(visibleSectionHeader { section { results { items { identifier: "1" type: 2 } } } } | )"
+       R"(sessionMissingResults { results { identifier: "2" type: 5 } } | )"
+       R"(sessionMissingSuggestions { suggestions { identifier: "3" } } | )"
+       R"(visibleSectionHeader { section { results { items { identifier: "4" type: 9 title: "t" } } } })",
+       "", "4/2"},
+      {"tapped section loses its results, still referenced",
+       {R"(sectionEngagement { section { bundleIdentifier: "apps" results { items { identifier: "r" } } } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_TAP })"},
+       R"(sectionEngagement { section { bundleIdentifier: "apps" } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_TAP })",
+       R"(identifier: "1")", "1/0"},
+      {"expanded section keeps its results, still referenced",
+       {R"(sectionEngagement { section { results { items { identifier: "r" } } } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND })"},
+       R"(sectionEngagement { section { results { items { identifier: "1" } } } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND })",
+       R"(identifier: "1")", "1/0"},
+      {"local application codes",
+       {R"(visibleResults { results { identifier: "a" type: 3 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 }
+           results { identifier: "b" type: 20 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 }
+           results { identifier: "c" type: 3 knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 } })"},
+       R"(visibleResults { results { identifier: "1" type: 3 isLocalApplicationResult: true knownApplicationBundleIdentifier: 2 knownResultBundleId: 2 } )"
+       R"(results { identifier: "2" type: 20 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 } )"
+       R"(results { identifier: "3" type: 3 knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 } })",
+       R"(identifier: "1" type: 3 isLocalApplicationResult: true knownApplicationBundleIdentifier: 2 knownResultBundleId: 2 | )"
+       R"(identifier: "2" type: 20 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 | )"
+       R"(identifier: "3" type: 3 knownApplicationBundleIdentifier: 77 knownResultBundleId: 78)",
+       "3/0"},
+  };
+  auto join = [](const auto& messages) {
+    std::string out;
+    for (const auto& m : messages) out += (out.empty() ? "" : " | ") + m.ShortDebugString();
+    return out;
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    std::vector<CVFeedbackPayload> payloads;
+    for (const auto& text : row.in) payloads.push_back(pb(text));
+    SessionProcessingHelper helper;
+    processAll(helper, payloads);
+    EXPECT_EQ(join(payloads), row.out);
+    EXPECT_EQ(join(*helper.missingResults()), row.missing);
+    EXPECT_EQ(std::to_string(helper.identifiersMapped()) + "/" + std::to_string(helper.titlesCleared()), row.counts);
+  }
 }
 
 // Guards against: a title or an unengaged-suggestion flag leaving for a result type that must not keep it.
@@ -173,86 +205,14 @@ TEST(EngagementRewrites, TitleKeptOnlyForTheEightListedTypes) {
   EXPECT_FALSE(withoutResult.has_titletext());
 }
 
-// Guards against: items outside the per-kind table escaping the rewrite, or counting as shown.
-TEST(ItemsAnywhere, AreMappedAndStrippedWithoutBookkeeping) {
-  SessionProcessingHelper helper;
-  std::vector<CVFeedbackPayload> payloads = {
-      payloadWith([](auto& p) {
-        *p.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled("a", 2);
-      }),
-      payloadWith([](auto& p) { *p.mutable_sessionmissingresults()->add_results() = titled("b", 5); }),
-      payloadWith([](auto& p) { *p.mutable_sessionmissingsuggestions()->add_suggestions() = suggestion("c"); }),
-      payloadWith([](auto& p) {
-        *p.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled("d", 9);
-      })};
-  processAll(helper, payloads);
-  const auto& header = payloads[0].visiblesectionheader().section().results().items(0);
-  const auto& missing = payloads[1].sessionmissingresults().results(0);
-  const auto& kept = payloads[3].visiblesectionheader().section().results().items(0);
-  EXPECT_EQ(header.identifier() + missing.identifier() + kept.identifier(), "124");
-  EXPECT_EQ(payloads[2].sessionmissingsuggestions().suggestions(0).identifier(), "3");
-  EXPECT_FALSE(header.has_title() || missing.has_title());
-  EXPECT_EQ(kept.title(), "secret title");
-  EXPECT_EQ(helper.identifiersMapped(), 4u);
-  EXPECT_EQ(helper.titlesCleared(), 2u);
-  EXPECT_TRUE(helper.missingResults()->empty() && helper.missingSuggestions()->empty());
-}
-
-// Guards against: an engaged section keeping its results (or an expanded one losing them).
-TEST(SectionEngagementRewrites, ResultsRemovedUnlessExpandedButStillReferenced) {
-  for (auto trigger : {corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP, corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND}) {
-    const bool expand = trigger == corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND;
-    corevireon::CVSectionEngagementFeedback se;
-    se.set_triggerevent(trigger);
-    se.mutable_section()->set_bundleidentifier("vireon.apps");
-    *se.mutable_section()->mutable_results()->add_items() = result("r");
-    SessionProcessingHelper helper;
-    helper.process(&se);
-    EXPECT_EQ(se.section().bundleidentifier(), "vireon.apps");
-    ASSERT_EQ(se.section().has_results(), expand);
-    if (expand) {
-      EXPECT_EQ(se.section().results().items(0).identifier(), "1");
-    } else {
-      EXPECT_EQ(idsOf(*helper.missingResults()), "1");
-    }
-  }
-}
-
-// Guards against: local application codes leaving unmasked, or masked for type 20 or non-local results.
-TEST(LocalApplicationCodes, SetToTwoUnlessType20AndCarriedIntoTheMissingList) {
-  auto shown = visibleResults(1, {result("app", 3), result("app", 20), result("web", 3)});
-  for (int i = 0; i < 3; ++i) {
-    auto* r = shown.mutable_visibleresults()->mutable_results(i);
-    r->set_islocalapplicationresult(i < 2);
-    r->set_knownapplicationbundleidentifier(77);
-    r->set_knownresultbundleid(78);
-  }
-  SessionProcessingHelper helper;
-  helper.process(shown.mutable_visibleresults());
-  std::string codes;
-  for (const auto& r : shown.visibleresults().results()) {
-    codes += std::to_string(r.knownapplicationbundleidentifier()) + "/" + std::to_string(r.knownresultbundleid()) + " ";
-  }
-  EXPECT_EQ(codes, "2/2 77/78 77/78 ");
-  ASSERT_EQ(helper.missingResults()->size(), 3u);
-  EXPECT_EQ(helper.missingResults()->front().knownresultbundleid(), 2);
-}
-
-// Guards against: query texts or punch-outs leaving for a result type other than 1, or the title being cleared.
+// Guards against: query texts or punch-outs leaving for a result type other than 1, or redaction touching the title.
 TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
-  auto r = webResult("x", "https://example.com/");
-  r.set_userinput("typed");
-  r.set_completedquery("completed");
-  r.set_intendedquery("intended");
-  r.set_title("kept");
-  auto typeOne = r;
-  r.set_type(2);
-  redact(r);
+  const std::string fields = R"(title: "t" userInput: "u" completedQuery: "c" intendedQuery: "i" punchout { name: "p" })";
+  auto other = pb<CVSearchResultForFeedback>("type: 2 " + fields), typeOne = pb<CVSearchResultForFeedback>("type: 1 " + fields);
+  redact(other);
   redact(typeOne);
-  EXPECT_FALSE(r.has_userinput() || r.has_completedquery() || r.has_intendedquery() || r.has_punchout());
-  EXPECT_EQ(r.title(), "kept");
-  EXPECT_TRUE(typeOne.has_userinput() && typeOne.has_completedquery() && typeOne.has_intendedquery() &&
-              typeOne.has_punchout());
+  EXPECT_EQ(other.ShortDebugString(), R"(type: 2 title: "t")");
+  EXPECT_EQ(typeOne.ShortDebugString(), pb<CVSearchResultForFeedback>("type: 1 " + fields).ShortDebugString());
 }
 
 // Guards against: the results a feedback contains being gathered from the wrong fields or in the wrong order.
