@@ -78,20 +78,15 @@ TEST(SessionTimeline, SortedStablyAndMadeRelativeToTheFirstTimeInMilliseconds) {
 
 // Guards against: nested ranking times, or the session start under removeTimestamps, leaving as device times.
 TEST(SessionTimeline, NestedTimesAndSessionStart) {
-  CVFeedbackPayload ranking;
-  ranking.mutable_ranking()->set_timestamp(2'000 * kMs);
-  auto* section = ranking.mutable_ranking()->add_sections();
-  section->set_timestamp(2'005 * kMs);
-  section->add_results()->set_timestamp(1'000 * kMs);  // before the base: removed
-  auto s = sessionWith({clearInput(2'000 * kMs), ranking});
+  auto s = sessionWith({clearInput(2'000 * kMs), pb(R"(ranking { timestamp: 2000000000 sections {
+      timestamp: 2005000000 results { timestamp: 1000000000 } } })")});  // the last one lies before the base
   s.set_removetimestamps(true);
   s.set_sessionstart(1'700'000'000.5);
   FlushableSession session(s);
   session.postProcessFeedback(nullptr);
-  const auto& processed = session.backingStore().feedbacks().items(1).ranking();
-  EXPECT_EQ(processed.timestamp(), 0u);
-  EXPECT_EQ(processed.sections(0).timestamp(), 5u);
-  EXPECT_EQ(processed.sections(0).results(0).timestamp(), 0u);
+  // Zero times are not printed.
+  EXPECT_EQ(session.backingStore().feedbacks().items(1).ShortDebugString(),
+            "ranking { sections { timestamp: 5 results { } } }");
   EXPECT_EQ(session.backingStore().sessionstart(), 0.0);
   EXPECT_EQ(session.generateSessionJSON()["base_time"], 0);
 }
@@ -120,23 +115,15 @@ TEST(SessionWithoutFeedback, AbsentStaysAbsentEmptyStaysEmptyBothCounted) {
 
 // Guards against: missing suggestions and results not leading the list, in that order, or carrying a secret.
 TEST(MissingItemsFeedback, MissingSuggestionsThenMissingResultsLeadTheList) {
-  auto engaged = payloadWith([](auto& p) {
-    p.set_type(20);
-    p.mutable_suggestionengagement()->set_timestamp(20 * kMs);
-    *p.mutable_suggestionengagement()->mutable_suggestion() = suggestion("s-secret");
-  });
-  FlushableSession session(sessionWith({visibleResults(1, {result("r-secret")}, 10 * kMs), engaged}));
+  FlushableSession session(sessionWith(
+      {visibleResults(1, {result("r-secret")}, 10 * kMs),
+       pb(R"(type: 20 suggestionEngagement { timestamp: 20000000 suggestion { identifier: "s-secret" type: 1 } })")}));
   session.postProcessFeedback(nullptr);
-  const auto& items = session.backingStore().feedbacks().items();
-  ASSERT_EQ(items.size(), 4);
-  EXPECT_EQ(items[0].type(), 31);
-  ASSERT_EQ(items[0].sessionmissingsuggestions().suggestions_size(), 1);
-  EXPECT_EQ(items[0].sessionmissingsuggestions().suggestions(0).identifier(), "2");
-  EXPECT_EQ(items[1].type(), 30);
-  ASSERT_EQ(items[1].sessionmissingresults().results_size(), 1);
-  EXPECT_EQ(items[1].sessionmissingresults().results(0).identifier(), "1");
-  EXPECT_EQ(timeline(session.backingStore()), "0:0 0:0 1:0 0:10");
-  EXPECT_EQ(session.backingStore().SerializeAsString().find("secret"), std::string::npos);
+  EXPECT_EQ(session.backingStore().feedbacks().ShortDebugString(),
+            R"(items { type: 31 sessionMissingSuggestions { suggestions { identifier: "2" type: 1 } } } )"
+            R"(items { type: 30 sessionMissingResults { results { identifier: "1" type: 2 } } } )"
+            R"(items { queryId: 1 type: 8 visibleResults { results { identifier: "1" type: 2 } } } )"
+            R"(items { type: 20 suggestionEngagement { timestamp: 10 suggestion { identifier: "2" type: 1 } } })");
 }
 
 // Guards against: engagements counted for the wrong client, lazy members recomputed after processing, or the
