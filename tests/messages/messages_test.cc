@@ -1,5 +1,5 @@
-// The schema properties the daemon relies on: declared JSON names, presence
-// where readers tell absent from empty, and stable field numbers.
+// The schema properties the daemon relies on: presence where readers tell
+// absent from empty, and stable field numbers.
 //
 // The wire-number check compares against wire_numbers.golden. After adding
 // fields, regenerate it with FBF_UPDATE_WIRE_GOLDEN=1 and review the diff: it
@@ -10,7 +10,6 @@
 #include <google/protobuf/descriptor.h>
 #include <google/protobuf/descriptor.pb.h>
 #include <google/protobuf/message.h>
-#include <google/protobuf/util/json_util.h>
 
 #include <cstdint>
 #include <cstdlib>
@@ -37,27 +36,6 @@ std::unique_ptr<Message> RoundTrip(const Message& in) {
   std::unique_ptr<Message> out(in.New());
   EXPECT_TRUE(out->ParseFromString(bytes));
   return out;
-}
-
-// Guards against: JSON keys that differ from the declared field names (the JSON upload uses the declared names).
-TEST(Json, KeysAreTheDeclaredNames) {
-  corevireon::CVClientSession session;
-  session.set_userguidstring("G");
-  std::string json;
-  ASSERT_TRUE(google::protobuf::util::MessageToJsonString(session, &json).ok());
-  EXPECT_EQ(json, R"({"userGuidString":"G"})");
-  for (const FileDescriptor* file : {session.GetDescriptor()->file(), fbf::ipc::Request::descriptor()->file()}) {
-    std::vector<const Descriptor*> pending;
-    for (int i = 0; i < file->message_type_count(); ++i) pending.push_back(file->message_type(i));
-    while (!pending.empty()) {
-      const Descriptor* d = pending.back();
-      pending.pop_back();
-      for (int i = 0; i < d->nested_type_count(); ++i) pending.push_back(d->nested_type(i));
-      for (int i = 0; i < d->field_count() && !d->options().map_entry(); ++i) {
-        EXPECT_EQ(d->field(i)->json_name(), d->field(i)->name()) << d->field(i)->full_name();
-      }
-    }
-  }
 }
 
 // Guards against: an empty string or message decoding as absent (or absent as empty) where readers tell them apart.
