@@ -7,6 +7,8 @@
 #include "flushing/upload_manager_protocol.h"
 #include "corevireon.pb.h"
 
+#include <gtest/gtest.h>
+
 #include <cstdio>
 #include <deque>
 #include <functional>
@@ -29,17 +31,19 @@ class FakeUploadManager final : public UploadManagerProtocol {
 
   std::optional<UploadRequest> uploadProtobufFeedback(const corevireon::CVClientSession& session,
                                                       const fs::path& sessionURL) override {
-    return session_(sessionURL, session.ByteSizeLong(), "FeedbackV2PB");
+    auto parsed = SessionFilename::fromString(sessionURL.filename().string());
+    if (!parsed) return std::nullopt;
+    parsed->uploadFormat = UploadFormat::pb;
+    return prepared(sessionURL, sessionURL.parent_path() / parsed->uploadFilenameString(), session.ByteSizeLong(),
+                    "FeedbackV2PB");
   }
-  std::optional<UploadRequest> uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
-                                                  const fs::path& sessionURL) override {
-    return session_(sessionURL, dictionary.dump().size(), "FeedbackV2");
+  // These tests run with the protobuf format only.
+  std::optional<UploadRequest> uploadJSONFeedback(const nlohmann::ordered_json&, const fs::path&) override {
+    ADD_FAILURE() << "unexpected JSON upload";
+    return std::nullopt;
   }
   std::optional<UploadRequest> uploadCustomFeedback(const fs::path& fileURL, const std::string& type) override {
-    log_->prepared.emplace_back(fileURL, type);
-    std::error_code ec;
-    const auto size = fs::file_size(fileURL, ec);
-    return prepared(fs::path(fileURL.string() + ".uploadPending"), ec ? 0 : size, type);
+    return prepared(fileURL, fs::path(fileURL.string() + ".uploadPending"), fs::file_size(fileURL), type);
   }
   void enqueue(UploadRequest request, UploadCompletion completion) override {
     log_->pending.emplace_back(std::move(request), std::move(completion));
@@ -65,15 +69,10 @@ class FakeUploadManager final : public UploadManagerProtocol {
   }
 
  private:
-  std::optional<UploadRequest> session_(const fs::path& sessionURL, uint64_t size, const char* type) {
-    auto parsed = SessionFilename::fromString(sessionURL.filename().string());
-    if (!parsed) return std::nullopt;
-    parsed->uploadFormat = std::string_view(type) == "FeedbackV2PB" ? UploadFormat::pb : parsed->uploadFormat;
-    log_->prepared.emplace_back(sessionURL, type);
-    return prepared(sessionURL.parent_path() / parsed->uploadFilenameString(), size, type);
-  }
-  // The upload file exists, as the real manager's would.
-  static std::optional<UploadRequest> prepared(fs::path uploadFile, uint64_t size, const std::string& type) {
+  // Logs the preparation; the upload file exists, as the real manager's would.
+  std::optional<UploadRequest> prepared(const fs::path& source, fs::path uploadFile, uint64_t size,
+                                        const std::string& type) {
+    log_->prepared.emplace_back(source, type);
     if (FILE* f = std::fopen(uploadFile.c_str(), "w")) std::fclose(f);
     return UploadRequest{{}, std::move(uploadFile), static_cast<int64_t>(size), static_cast<int64_t>(size / 2), type, {}};
   }
