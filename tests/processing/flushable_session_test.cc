@@ -129,33 +129,22 @@ TEST(MissingItemsFeedback, MissingSuggestionsThenMissingResultsLeadTheList) {
 // Guards against: engagements counted for the wrong client, lazy members recomputed after processing, or the
 // earlier of two results with one identifier winning.
 TEST(LazyMembers, FollowTheClientAndTheUnprocessedSession) {
-  auto engagement = [](int trigger, const std::string& id) {
-    return payloadWith([&](auto& p) {
-      p.mutable_resultengagement()->set_triggerevent(static_cast<corevireon::CVTriggerEngagementEvent>(trigger));
-      *p.mutable_resultengagement()->mutable_result() = result(id);
-    });
-  };
-  auto first = result("b"), second = result("b"), anonymous = corevireon::CVSearchResultForFeedback();
-  first.set_title("first");
-  second.set_title("second");
-  auto s = sessionWith({engagement(8, "a"), engagement(1, "b"), messageless(10), clearInput(1),
-                        payloadWith([](auto& p) { p.mutable_didgotosite(); }),
-                        payloadWith([](auto& p) { p.mutable_startlocalsearch()->set_input("p"); }),
-                        visibleResults(1, {first, anonymous}), visibleResults(1, {second})});
+  auto s = sessionWith({pb(R"(resultEngagement { triggerEvent: 8 result { identifier: "a" } })"),
+                        pb(R"(resultEngagement { triggerEvent: 1 result { identifier: "b" } })"), messageless(10),
+                        pb("didGoToSite { }"), pb(R"(startLocalSearch { input: "p" })"),
+                        pb(R"(visibleResults { results { identifier: "b" title: "first" } results { } })"),
+                        pb(R"(visibleResults { results { identifier: "b" title: "second" } })")});
   s.set_agent("Scoutlume/17");
   FlushableSession scoutlume(s);
   ASSERT_EQ(scoutlume.engagements().size(), 1u);
   EXPECT_EQ(scoutlume.engagements()[0].resultEngagement()->result().identifier(), "b");
   s.set_agent("Wayfin/17");
   EXPECT_EQ(FlushableSession(s).engagements().size(), 3u);
-
   EXPECT_EQ(scoutlume.keystrokes().size(), 1u);
   EXPECT_EQ(scoutlume.resultsById().size(), 2u);
   EXPECT_EQ(scoutlume.resultsById().at("b").title(), "second");
   scoutlume.postProcessFeedback(nullptr);
   EXPECT_EQ(scoutlume.resultsById().count("a"), 1u) << "read before processing: the unprocessed identifiers";
-  scoutlume.setResultsById({});
-  EXPECT_TRUE(scoutlume.resultsById().empty());
 }
 
 // Guards against: fields unknown to this build reaching an upload, or uploads that differ between runs or map orders.

@@ -222,17 +222,12 @@ TEST(ContainedResults, FollowTheKindsOfFeedback) {
     for (const auto* r : containedResults(feedback)) out += r->identifier() + " ";
     return out;
   };
-  corevireon::CVRankingFeedback ranking;
-  auto* sr = ranking.add_sections();
-  *sr->add_results()->mutable_result() = result("ranked-only");
-  *sr->mutable_section()->mutable_results()->add_items() = result("s1");
-  *ranking.add_sections()->mutable_section()->mutable_results()->add_items() = result("s2");
-  EXPECT_EQ(ids(ranking), "s1 s2 ");
-  corevireon::CVResultRankingFeedback rr;
-  *rr.mutable_result() = result("main");
-  *rr.add_hiddenresults() = result("hidden");
-  *rr.add_duplicateresults() = result("dup");
-  EXPECT_EQ(ids(rr), "dup hidden main ");
+  EXPECT_EQ(ids(pb<corevireon::CVRankingFeedback>(R"(sections { results { result { identifier: "ranked" } }
+      section { results { items { identifier: "s1" } } } } sections { section { results { items { identifier: "s2" } } } })")),
+            "s1 s2 ");
+  EXPECT_EQ(ids(pb<corevireon::CVResultRankingFeedback>(
+                R"(result { identifier: "main" } hiddenResults { identifier: "hidden" } duplicateResults { identifier: "dup" })")),
+            "dup hidden main ");
   EXPECT_EQ(ids(corevireon::CVClearInputFeedback()), "");
 }
 
