@@ -17,16 +17,19 @@ std::string idsOf(const Items& items) {
   return out;
 }
 
+// Messages in their short text form, " | " between them.
+template <typename Messages>
+std::string join(const Messages& messages) {
+  std::string out;
+  for (const auto& m : messages) out += (out.empty() ? "" : " | ") + m.ShortDebugString();
+  return out;
+}
+
 // Processes each payload's feedback in turn, as a session does.
 void processAll(SessionProcessingHelper& helper, std::vector<CVFeedbackPayload>& payloads) {
   for (auto& p : payloads) helper.process(mutableCodableMessage(p));
 }
 
-CVSearchResultForFeedback titled(const std::string& id, int32_t type, const std::string& title = "secret title") {
-  auto r = result(id, type);
-  r.set_title(title);
-  return r;
-}
 
 // Guards against: replacement numbers reused across keys, handed out twice for one key, or given to empty identifiers.
 TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearance) {
@@ -60,57 +63,40 @@ TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearanc
 // Guards against: an item referenced but never delivered in full not being reported missing (or reported twice,
 // out of order, or when it was delivered).
 TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
-  auto shown = [](const std::string& id) { return visibleResults(1, {result(id, 5)}); };
-  auto late = [](const std::string& id) {
-    return payloadWith([&](auto& p) { *p.mutable_resultsreceivedaftertimeout()->add_results() = result(id, 5); });
-  };
-  auto ranked = [](const std::string& id) {
-    return payloadWith([&](auto& p) { *p.mutable_resultranking()->mutable_result() = result(id, 5); });
-  };
-  auto suggested = [](const std::string& id, bool engaged) {
-    return payloadWith([&](auto& p) {
-      *(engaged ? p.mutable_suggestionengagement()->mutable_suggestion()
-                : p.mutable_visiblesuggestions()->add_suggestions()) = suggestion(id);
-    });
-  };
-  auto graded = [](auto mutableKind, const char* title) {
-    return payloadWith([&](auto& p) { *(p.*mutableKind)()->mutable_result() = titled("r", 9, title); });
-  };
+  const std::string shown = R"(visibleResults { results { identifier: "r" type: 5 } })";
   struct Row {
     const char* name;
-    std::vector<CVFeedbackPayload> payloads;
-    std::string missingResults, missingSuggestions;  // "identifier:type[:title]" each
+    std::vector<std::string> in;
+    std::string missingResults, missingSuggestions;
   };
-  Row rows[] = {
-      {"shown twice, never delivered: missing once", {shown("r"), shown("r")}, "1:5", ""},
-      {"shown, then delivered", {shown("r"), late("r")}, "", ""},
-      {"delivered, then shown", {ranked("r"), shown("r")}, "", ""},
-      {"suggestion engaged, never shown", {suggested("s1", false), suggested("s1", true), suggested("s2", true)},
-       "", "2:1"},
+  const Row rows[] = {
+      {"shown twice, never delivered: missing once", {shown, shown}, R"(identifier: "1" type: 5)", ""},
+      {"shown, then delivered", {shown, R"(resultsReceivedAfterTimeout { results { identifier: "r" type: 5 } })"}, "", ""},
+      {"delivered, then shown", {R"(resultRanking { result { identifier: "r" type: 5 } })", shown}, "", ""},
+      {"suggestion engaged, never shown",
+       {R"(visibleSuggestions { suggestions { identifier: "s1" } })", R"(suggestionEngagement { suggestion { identifier: "s1" } })",
+        R"(suggestionEngagement { suggestion { identifier: "s2" } })"},
+       "", R"(identifier: "2")"},
       {"the first reference is kept (type 9 keeps titles)",
-       {graded(&CVFeedbackPayload::mutable_resultgrading, "first"),
-        graded(&CVFeedbackPayload::mutable_resultengagement, "second")},
-       "1:9:first", ""},
+       {R"(resultGrading { result { identifier: "r" type: 9 title: "first" } })",
+        R"(resultEngagement { result { identifier: "r" type: 9 title: "second" } })"},
+       R"(identifier: "1" type: 9 title: "first")", ""},
       {"in the order of their numbers",
-       {visibleResults(1, {result("a"), result("b"), result("c"), result("d"), result("e"), result("f"),
-                           result("g"), result("h"), result("i"), result("j"), result("k")})},
-       "1:2 2:2 3:2 4:2 5:2 6:2 7:2 8:2 9:2 10:2 11:2", ""},
+       {R"(visibleResults { results { identifier: "a" } results { identifier: "b" } results { identifier: "c" }
+           results { identifier: "d" } results { identifier: "e" } results { identifier: "f" } results { identifier: "g" }
+           results { identifier: "h" } results { identifier: "i" } results { identifier: "j" } results { identifier: "k" } })"},
+       R"(identifier: "1" | identifier: "2" | identifier: "3" | identifier: "4" | identifier: "5" | identifier: "6" | )"
+       R"(identifier: "7" | identifier: "8" | identifier: "9" | identifier: "10" | identifier: "11")", ""},
   };
-  auto describe = [](const auto& items) {
-    std::string out;
-    for (const auto& r : *items) {
-      out += (out.empty() ? "" : " ") + r.identifier() + ":" + std::to_string(r.type());
-      if constexpr (requires { r.title(); }) out += r.has_title() ? ":" + r.title() : "";
-    }
-    return out;
-  };
-  for (auto& row : rows) {
+  for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
+    std::vector<CVFeedbackPayload> payloads;
+    for (const auto& text : row.in) payloads.push_back(pb(text));
     SessionProcessingHelper helper;
-    processAll(helper, row.payloads);
+    processAll(helper, payloads);
     ASSERT_TRUE(helper.missingResults() && helper.missingSuggestions());
-    EXPECT_EQ(describe(helper.missingResults()), row.missingResults);
-    EXPECT_EQ(describe(helper.missingSuggestions()), row.missingSuggestions);
+    EXPECT_EQ(join(*helper.missingResults()), row.missingResults);
+    EXPECT_EQ(join(*helper.missingSuggestions()), row.missingSuggestions);
   }
 }
 
@@ -169,11 +155,6 @@ TEST(Rewrites, EachKindRewrittenInPlace) {
        R"(identifier: "2" type: 20 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 | )"
        R"(identifier: "3" type: 3 knownApplicationBundleIdentifier: 77 knownResultBundleId: 78)",
        "3/0"},
-  };
-  auto join = [](const auto& messages) {
-    std::string out;
-    for (const auto& m : messages) out += (out.empty() ? "" : " | ") + m.ShortDebugString();
-    return out;
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
