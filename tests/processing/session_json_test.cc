@@ -18,19 +18,11 @@ TEST(SessionJSON, KeysInTheirOrderWithValuesOrDefaults) {
   EXPECT_EQ(jsonOf(CVClientSession()),
             R"({"fb":null,"agent":"","user_guid":"","country_code":"","locale":"","resource_versions":null,)"
             R"("base_time":0,"previous_session_end_reason":"unknown","du_enabled":false})");
-  CVClientSession s;
-  *s.mutable_feedbacks()->add_items() = clearInput(5, 1);
-  s.set_agent("Wayfin/17");
-  s.set_userguidstring("GUID");
-  s.set_countrycode("GB");
-  s.set_locale("en_GB");
-  (*s.mutable_resourceversions())["ranker"] = "4.2";
-  (*s.mutable_resourceversions())["entities"] = "9";
-  s.set_sessionstart(1'700'000'123.9);
-  s.set_previoussessionendreason(corevireon::CV_SESSION_END_REASON_SESSION_IDLE);
-  s.set_duenabled(true);
-  s.mutable_usagesincelookback()->set_activedaysincollectionperiod(12);
-  s.mutable_cohortsfeedback()->mutable_wayfinusagepropensity()->set_gotosite("0.25");
+  auto s = pb<CVClientSession>(R"(feedbacks { items { queryId: 1 type: 25 clearInput { timestamp: 5 } } }
+      agent: "Wayfin/17" userGuidString: "GUID" countryCode: "GB" locale: "en_GB"
+      resourceVersions { key: "ranker" value: "4.2" } resourceVersions { key: "entities" value: "9" }
+      sessionStart: 1700000123.9 previousSessionEndReason: CV_SESSION_END_REASON_SESSION_IDLE duEnabled: true
+      usageSinceLookback { activeDaysInCollectionPeriod: 12 } cohortsFeedback { wayfinUsagePropensity { goToSite: "0.25" } })");
   EXPECT_EQ(jsonOf(s), R"({"fb":[{"timestamp":5,"query_id":1,"type":"clear_input"}],"agent":"Wayfin/17",)"
                        R"("user_guid":"GUID","country_code":"GB","locale":"en_GB",)"
                        R"("resource_versions":{"entities":"9","ranker":"4.2"},"base_time":1700000123,)"
@@ -68,29 +60,15 @@ TEST(EventNames, TableWithItsDeliberateDuplicates) {
 // Guards against: a feedback entry with defaults written, 64-bit numbers rounded, nested or repeated fields
 // misrendered, custom feedback without a JSON object uploaded, or a payload without a message uploaded.
 TEST(FeedbackDictionary, SetFieldsUnderTheirNamesWithExactNumbers) {
-  CVFeedbackPayload p;
-  p.set_queryid(18'446'744'073'709'551'615ULL);
-  p.set_type(15);
-  p.mutable_endnetworksearch()->set_timestamp(9'007'199'254'740'993ULL);  // not representable as a double
-  p.mutable_endnetworksearch()->set_statuscode(200);
-  p.mutable_endnetworksearch()->set_responsesize(0);  // default: left out
-  EXPECT_EQ(feedbackDictionary(p)->dump(), R"({"timestamp":9007199254740993,"statusCode":200,)"
-                                           R"("query_id":18446744073709551615,"type":"network_search_end"})");
-  CVFeedbackPayload ranking;
-  ranking.set_type(4);
-  auto* sr = ranking.mutable_ranking()->add_sections();
-  sr->set_position(2);
-  auto* r = sr->mutable_section()->mutable_results()->add_items();
-  r->set_identifier("1");
-  r->set_type(3);
-  r->set_score(0.5);
-  r->mutable_punchout()->mutable_urls();  // present but empty
-  EXPECT_EQ(feedbackDictionary(ranking)->dump(),
+  // 2^53 + 1 is not representable as a double; a zero response size is a default and left out.
+  EXPECT_EQ(feedbackDictionary(pb(R"(queryId: 18446744073709551615 type: 15 endNetworkSearch {
+                timestamp: 9007199254740993 statusCode: 200 responseSize: 0 })"))->dump(),
+            R"({"timestamp":9007199254740993,"statusCode":200,"query_id":18446744073709551615,"type":"network_search_end"})");
+  EXPECT_EQ(feedbackDictionary(pb(R"(type: 4 ranking { sections { position: 2 section { results { items {
+                identifier: "1" type: 3 score: 0.5 punchout { urls { } } } } } } })"))->dump(),
             R"({"sections":[{"section":{"results":{"items":[{"identifier":"1","type":3,)"
             R"("punchout":{"urls":{}},"score":0.5}]}},"position":2}],"query_id":0,"type":"rank_sections"})");
-  CVFeedbackPayload e;
-  e.mutable_resultengagement()->set_triggerevent(corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER);
-  EXPECT_EQ((*feedbackDictionary(e))["triggerEvent"], 8);
+  EXPECT_EQ((*feedbackDictionary(pb("resultEngagement { triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_PREVIEW_HOVER }")))["triggerEvent"], 8);
 
   CVFeedbackPayload custom;
   custom.set_type(100);
