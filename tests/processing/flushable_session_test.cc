@@ -63,7 +63,7 @@ TEST(SessionTimeline, SortedStablyAndMadeRelativeToTheFirstTimeInMilliseconds) {
        {clearInput(0, 1), clearInput(9'000 * kMs, 2), clearInput(9'010 * kMs, 3)}, "1:0 2:0 3:10", 0},
       {"everything delivered: nothing put in front",
        {visibleResults(1, {result("r")}, 3 * kMs),
-        payloadWith([](auto& p) { *p.mutable_resultsreceivedaftertimeout()->add_results() = result("r"); })},
+        pb(R"(resultsReceivedAfterTimeout { results { identifier: "r" type: 2 } })")},
        "0:0 1:0", 0},
   };
   for (const auto& row : rows) {

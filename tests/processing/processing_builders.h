@@ -21,21 +21,8 @@ T pb(const std::string& text) {
   return m;
 }
 
-// A payload shaped by `build`, for the kinds without a builder of their own.
-template <typename Build>
-corevireon::CVFeedbackPayload payloadWith(Build build, uint64_t queryId = 0, int32_t type = 0) {
-  corevireon::CVFeedbackPayload p;
-  p.set_queryid(queryId);
-  p.set_type(type);
-  build(p);
-  return p;
-}
-
 inline corevireon::CVSearchResultForFeedback result(const std::string& id, int32_t type = 2) {
-  corevireon::CVSearchResultForFeedback r;
-  r.set_identifier(id);
-  r.set_type(type);
-  return r;
+  return pb<corevireon::CVSearchResultForFeedback>("identifier: \"" + id + "\" type: " + std::to_string(type));
 }
 
 inline corevireon::CVSearchResultForFeedback webResult(const std::string& id, const std::string& url,
@@ -46,34 +33,23 @@ inline corevireon::CVSearchResultForFeedback webResult(const std::string& id, co
   return r;
 }
 
-inline corevireon::CVSearchSuggestionForFeedback suggestion(const std::string& id, int32_t type = 1) {
-  corevireon::CVSearchSuggestionForFeedback s;
-  s.set_identifier(id);
-  s.set_type(type);
-  return s;
-}
-
 inline corevireon::CVFeedbackPayload visibleResults(
     uint64_t queryId, std::initializer_list<corevireon::CVSearchResultForFeedback> rs, uint64_t timestamp = 0) {
-  return payloadWith([&](auto& p) {
-    p.mutable_visibleresults()->set_timestamp(timestamp);
-    for (const auto& r : rs) *p.mutable_visibleresults()->add_results() = r;
-  }, queryId, 8);
+  auto p = pb("type: 8 queryId: " + std::to_string(queryId) + " visibleResults { timestamp: " + std::to_string(timestamp) + " }");
+  for (const auto& r : rs) *p.mutable_visibleresults()->add_results() = r;
+  return p;
 }
 
 inline corevireon::CVFeedbackPayload cba(uint64_t queryId, std::optional<std::string> url) {
-  return payloadWith([&](auto& p) {
-    p.mutable_cbaengagement()->set_timestamp(0);
-    if (url) p.mutable_cbaengagement()->set_url(*url);
-  }, queryId, 40);
+  auto p = pb("type: 40 queryId: " + std::to_string(queryId) + " cbaEngagement { }");
+  if (url) p.mutable_cbaengagement()->set_url(*url);
+  return p;
 }
 
 inline corevireon::CVFeedbackPayload clearInput(uint64_t timestamp, uint64_t queryId = 0) {
-  return payloadWith([&](auto& p) { p.mutable_clearinput()->set_timestamp(timestamp); }, queryId, 25);
+  return pb("type: 25 queryId: " + std::to_string(queryId) + " clearInput { timestamp: " + std::to_string(timestamp) + " }");
 }
 
-inline corevireon::CVFeedbackPayload messageless(int32_t type) {
-  return payloadWith([](auto&) {}, 0, type);
-}
+inline corevireon::CVFeedbackPayload messageless(int32_t type) { return pb("type: " + std::to_string(type)); }
 
 }  // namespace fbf::testing

@@ -53,7 +53,7 @@ TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearanc
   for (int i = 0; i < 12; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
   std::vector<CVFeedbackPayload> payloads = {
       visibleResults(1, {result("id11", 0), result("id1", 0), result("new", 0), result("", 0)}),
-      payloadWith([](auto& p) { *p.mutable_resultengagement()->mutable_result() = result("new", 0); })};
+      pb(R"(resultEngagement { result { identifier: "new" } })")};
   processAll(helper, payloads);
   EXPECT_EQ(idsOf(payloads[0].visibleresults().results()), "12 2 13 -");
   EXPECT_EQ(payloads[1].resultengagement().result().identifier(), "13");
