@@ -33,29 +33,18 @@ void processAll(SessionProcessingHelper& helper, std::vector<CVFeedbackPayload>&
 
 // Guards against: replacement numbers reused across keys, handed out twice for one key, or given to empty identifiers.
 TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearance) {
-  struct Call {
-    std::optional<std::string> id;
-    int32_t type;
-    std::optional<std::string> expected;
-  };
-  const std::pair<const char*, std::vector<Call>> rows[] = {
-      {"another type maps anew", {{"alpha", 3, "1"}, {"alpha", 4, "2"}, {"alpha", 3, "1"}}},
-      {"keys have no separator: ab+17 is ab1+7", {{"ab", 17, "1"}, {"ab1", 7, "1"}, {"ab", 7, "2"}}},
-      {"empty or absent uses no number", {{std::nullopt, 1, std::nullopt}, {"", 1, std::nullopt}, {"x", 1, "1"}}},
-  };
-  for (const auto& [name, calls] : rows) {
-    SCOPED_TRACE(name);
-    SessionProcessingHelper helper;
-    for (const auto& c : calls) EXPECT_EQ(helper.replacementForIdentifier(c.id, c.type), c.expected);
-  }
-  // Through the messages: one number per key across kinds, counted past nine.
   SessionProcessingHelper helper;
-  for (int i = 0; i < 12; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
+  EXPECT_EQ(helper.replacementForIdentifier(std::nullopt, 1), std::nullopt);
+  EXPECT_EQ(helper.replacementForIdentifier("", 1), std::nullopt);
+  for (int i = 0; i < 9; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
+  // Keys are identifier + decimal type with no separator, so ab+17 and ab1+7 share a number.
   std::vector<CVFeedbackPayload> payloads = {
-      visibleResults(1, {result("id11", 0), result("id1", 0), result("new", 0), result("", 0)}),
-      pb(R"(resultEngagement { result { identifier: "new" } })")};
+      pb(R"(visibleResults { results { identifier: "alpha" type: 3 } results { identifier: "alpha" type: 4 }
+           results { identifier: "alpha" type: 3 } results { identifier: "ab" type: 17 } results { identifier: "ab1" type: 7 }
+           results { identifier: "ab" type: 7 } results { identifier: "" } results { } results { identifier: "id1" } })"),
+      pb(R"(resultEngagement { result { identifier: "ab" type: 7 } })")};
   processAll(helper, payloads);
-  EXPECT_EQ(idsOf(payloads[0].visibleresults().results()), "12 2 13 -");
+  EXPECT_EQ(idsOf(payloads[0].visibleresults().results()), "10 11 10 12 12 13 - - 2");
   EXPECT_EQ(payloads[1].resultengagement().result().identifier(), "13");
   EXPECT_EQ(helper.nextMappedId(), 14);
 }
@@ -172,16 +161,13 @@ TEST(Rewrites, EachKindRewrittenInPlace) {
 TEST(EngagementRewrites, TitleKeptOnlyForTheEightListedTypes) {
   const std::set<int32_t> keeping = {9, 10, 11, 12, 13, 14, 18, 19};
   for (int32_t type = 0; type < 22; ++type) {
-    corevireon::CVResultEngagementFeedback engaged;
-    *engaged.mutable_result() = result("r", type);
-    engaged.set_titletext("what the user saw");
-    engaged.set_matchesunengagedsuggestion(true);
+    auto engaged = pb<corevireon::CVResultEngagementFeedback>("titleText: \"t\" matchesUnengagedSuggestion: true result { type: " +
+                                                              std::to_string(type) + " }");
     SessionProcessingHelper().process(&engaged);
     EXPECT_EQ(engaged.has_titletext(), keeping.count(type) == 1) << "type " << type;
     EXPECT_EQ(engaged.matchesunengagedsuggestion(), keeping.count(type) == 1) << "type " << type;
   }
-  corevireon::CVResultEngagementFeedback withoutResult;
-  withoutResult.set_titletext("title");
+  auto withoutResult = pb<corevireon::CVResultEngagementFeedback>(R"(titleText: "t")");
   SessionProcessingHelper().process(&withoutResult);
   EXPECT_FALSE(withoutResult.has_titletext());
 }
