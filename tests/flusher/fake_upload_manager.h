@@ -11,6 +11,7 @@
 
 #include <cstdio>
 #include <deque>
+#include <set>
 #include <functional>
 #include <string>
 #include <utility>
@@ -22,7 +23,7 @@ class FakeUploadManager final : public UploadManagerProtocol {
  public:
   using Prepared = std::pair<fs::path, std::string>;  // (source or upload file, type)
   struct Log {
-    std::vector<Prepared> prepared, retried;
+    std::set<Prepared> prepared, retried;
     std::deque<std::pair<UploadRequest, UploadCompletion>> pending;
     std::function<void()> onEnqueue;  // called while the flusher is still in enqueue
   };
@@ -50,7 +51,7 @@ class FakeUploadManager final : public UploadManagerProtocol {
     if (log_->onEnqueue) log_->onEnqueue();
   }
   void retryUpload(const fs::path& fileURL, const std::string& type) override {
-    log_->retried.emplace_back(fileURL, type);
+    log_->retried.emplace(fileURL, type);
   }
   size_t uploadsInFlight() const override { return log_->pending.size(); }
   void setDelegate(UploadManagerDelegate* delegate) override { delegate_ = delegate; }
@@ -72,7 +73,7 @@ class FakeUploadManager final : public UploadManagerProtocol {
   // Logs the preparation; the upload file exists, as the real manager's would.
   std::optional<UploadRequest> prepared(const fs::path& source, fs::path uploadFile, uint64_t size,
                                         const std::string& type) {
-    log_->prepared.emplace_back(source, type);
+    log_->prepared.emplace(source, type);
     if (FILE* f = std::fopen(uploadFile.c_str(), "w")) std::fclose(f);
     return UploadRequest{{}, std::move(uploadFile), static_cast<int64_t>(size), static_cast<int64_t>(size / 2), type, {}};
   }
