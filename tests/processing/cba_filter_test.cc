@@ -99,11 +99,12 @@ TEST(EngagedVisitFilter, KeepsMatchedVisitsWithTheirBestLevelAndNoAddress) {
     for (const auto& p : row.list) *list.Add() = p;
     std::string kept;
     for (const auto& p : CBAFilterController().arrayOfCBAFilteredFeedback(std::move(list))) {
-      kept += kept.empty() ? "" : " ";
-      if (p.has_visibleresults()) kept += "V";
-      else if (p.has_cbaengagement()) kept += "C" + std::to_string(p.cbaengagement().cbatype()) + (p.cbaengagement().has_url() ? "u" : "");
-      else if (p.has_clearinput()) kept += "I" + std::to_string(p.clearinput().timestamp());
-      else kept += "T" + std::to_string(p.type());
+      const auto& v = p.cbaengagement();
+      kept += std::string(kept.empty() ? "" : " ") +
+              (p.has_visibleresults() ? "V"
+               : p.has_cbaengagement() ? "C" + std::to_string(v.cbatype()) + (v.has_url() ? "u" : "")
+               : p.has_clearinput()    ? "I" + std::to_string(p.clearinput().timestamp())
+                                       : "T" + std::to_string(p.type()));
     }
     EXPECT_EQ(kept, row.kept) << row.name;
   }

@@ -1,4 +1,5 @@
 #include "flushing/reporters.h"
+#include "processing/processing_builders.h"
 
 #include <gtest/gtest.h>
 
@@ -6,6 +7,7 @@ namespace fbf {
 namespace {
 
 using corevireon::CVClient;
+using fbf::testing::pb;
 
 // Guards against: an agent read as the wrong client surface (case, rule order, absent agent).
 TEST(ClientFromAgent, MatchesTheLowerCasedAgentFirstRuleWins) {
@@ -25,27 +27,22 @@ TEST(ClientFromAgent, MatchesTheLowerCasedAgentFirstRuleWins) {
 
 // Guards against: previews, destination 1 or go-to feedback counted as engagements on the wrong surface.
 TEST(Engagements, DependOnTriggerDestinationAndSurface) {
-  struct Row {
-    int trigger, destination;
-    CVClient client;
-    bool engagement;
-  };
+  using Row = std::tuple<int, int, CVClient, bool>;  // trigger, destination, surface, counts as an engagement
   std::vector<Row> rows = {{1, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, true},
                            {1, 1, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, false},
                            {1, 2, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, true},
                            {1, 1, corevireon::CV_CLIENT_NEWS, true}};
   for (int preview : {3, 8, 9}) {
-    rows.push_back({preview, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, false});
-    rows.push_back({preview, 0, corevireon::CV_CLIENT_NONE, true});
-    rows.push_back({preview, 0, corevireon::CV_CLIENT_WEB_BROWSER, true});
+    rows.emplace_back(preview, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, false);
+    rows.emplace_back(preview, 0, corevireon::CV_CLIENT_NONE, true);
+    rows.emplace_back(preview, 0, corevireon::CV_CLIENT_WEB_BROWSER, true);
   }
-  for (int other : {2, 4, 7}) rows.push_back({other, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, true});
-  for (const auto& row : rows) {
-    corevireon::CVResultEngagementFeedback m;
-    m.set_triggerevent(static_cast<corevireon::CVTriggerEngagementEvent>(row.trigger));
-    m.set_destination(row.destination);
-    EXPECT_EQ(EngagementReporter::from(m)->isEngagement(row.client), row.engagement)
-        << "trigger " << row.trigger << " destination " << row.destination << " client " << row.client;
+  for (int other : {2, 4, 7}) rows.emplace_back(other, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, true);
+  for (const auto& [trigger, destination, client, engagement] : rows) {
+    auto m = pb<corevireon::CVResultEngagementFeedback>("triggerEvent: " + std::to_string(trigger) +
+                                                        " destination: " + std::to_string(destination));
+    EXPECT_EQ(EngagementReporter::from(m)->isEngagement(client), engagement)
+        << "trigger " << trigger << " destination " << destination << " client " << client;
   }
   auto site = *EngagementReporter::from(corevireon::CVDidGoToSiteFeedback());
   auto search = *EngagementReporter::from(corevireon::CVDidGoToSearchFeedback());
