@@ -18,8 +18,7 @@ TEST(MatchLevels, BetweenShownAndVisitedAddresses) {
   };
   const Row rows[] = {
       {"https://www.example.com/recipes/pasta", "http://m.example.com/recipes/pasta/", 3},
-      {"https://example.com", "https://example.com/", 3},
-      {"https://WWW.Example.COM/a", "https://example.com/a", 3},
+      {"https://example.com", "https://example.com/", 3}, {"https://WWW.Example.COM/a", "https://example.com/a", 3},
       {"https://news.bbc.co.uk/x", "https://www.bbc.co.uk/x", 3},
       {"https://www.example.com/a", "https://example.com/a?utm_source=x", 2},
       {"https://www.example.com/a?id=1", "https://example.com/a/", 2},
@@ -27,10 +26,8 @@ TEST(MatchLevels, BetweenShownAndVisitedAddresses) {
       {"https://www.example.com/a", "https://example.com/b", 1},
       {"https://www.example.com/a", "https://shop.example.co.uk/", 1},
       {"https://www.example.com/a#top", "https://example.com/a#bottom", 1},
-      {"https://www.example.com/a", "https://www.other.com/a", 0},
-      {nullopt, "https://example.com/", 0},
-      {"https://example.com/", nullopt, 0},
-      {"https://example.com/", "http://exa mple.com/", 0},
+      {"https://www.example.com/a", "https://www.other.com/a", 0}, {nullopt, "https://example.com/", 0},
+      {"https://example.com/", nullopt, 0}, {"https://example.com/", "http://exa mple.com/", 0},
       {"https://example.com/", "http://[::1", 0},
       {"https://alice.blogspot.com/post", "https://bob.blogspot.com/post", 0},  // private suffixes are suffixes
       {"https://alice.blogspot.com/post", "https://www.alice.blogspot.com/post", 3},
@@ -52,12 +49,9 @@ TEST(MatchLevels, EmbeddedAddressesAndSiteNames) {
   const std::pair<std::string_view, std::optional<std::string>> embedded[] = {
       {"https://a-b.cdn.ampproject.org/c/s/a.b/p/q?x#f", "https://a.b/p/q?x#f"},
       {"https://a-b.cdn.ampproject.org/c/a.b/p", "http://a.b/p"},
-      {"https://www.google.com/amp/s/a.b/p", "https://a.b/p"},
-      {"https://www.google.com/search?q=amp", nullopt},
-      {"https://www.notgoogle.com/amp/s/a.b/p", nullopt},
-      {"https://a-b.cdn.ampproject.org/x/s/a.b/p", nullopt},
-      {"https://a-b.cdn.ampproject.org/c/s/localhost/p", nullopt},
-      {"https://www.example.com/amp/s/a.b/p", nullopt},
+      {"https://www.google.com/amp/s/a.b/p", "https://a.b/p"}, {"https://www.google.com/search?q=amp", nullopt},
+      {"https://www.notgoogle.com/amp/s/a.b/p", nullopt}, {"https://a-b.cdn.ampproject.org/x/s/a.b/p", nullopt},
+      {"https://a-b.cdn.ampproject.org/c/s/localhost/p", nullopt}, {"https://www.example.com/amp/s/a.b/p", nullopt},
   };
   for (const auto& [url, expected] : embedded) EXPECT_EQ(embeddedAMPURL(*parseURLComponents(url)), expected) << url;
   EXPECT_EQ(normalizedURLStringForTLDFeatures(*parseURLComponents("https://www.example.co.uk/a")), "example");
