@@ -11,7 +11,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <set>
 
 namespace fbf::testing {
 namespace {
@@ -208,13 +207,11 @@ TEST_F(FilesInOtherStates, WithoutABagNothingIsTouched) {
 using FlushCompletion = FlushWithHeldUploads;
 
 TEST_F(FlushCompletion, WaitsForEveryUploadSuccessfulOrNot) {
-  closedSession(1, sessionBytes());
-  closedSession(2, sessionBytes());
+  for (unsigned i = 1; i <= 2; ++i) closedSession(i, sessionBytes());
   custom("Pelorus", "p1", "{}");
   flush();
   ASSERT_EQ(uploads->pending.size(), 3u);
   const auto failedFile = uploads->pending.back().first.fileURL;
-  EXPECT_EQ(completions, 0);
   settle(200, 2);
   EXPECT_EQ(completions, 0) << "one upload is still in flight";
   settle(500);

@@ -10,7 +10,6 @@
 #include <google/protobuf/descriptor.h>
 #include <google/protobuf/descriptor.pb.h>
 
-#include <cstdint>
 #include <cstdlib>
 #include <fstream>
 #include <set>

@@ -52,9 +52,8 @@ TEST(EventNames, TableWithItsDeliberateDuplicates) {
       {50, "(unknown: 50)"},  {100, "custom_crowdsourcing"}, {102, "custom_scoutlume_result_features"},
       {103, "last_"},         {104, "(unknown: 104)"},  {-1, "(unknown: -1)"}};
   for (const auto& [number, name] : events) EXPECT_EQ(feedbackEventName(number), name) << number;
-  EXPECT_EQ(sessionEndReasonName(7), "engagement_received");
-  EXPECT_EQ(sessionEndReasonName(8), "last_");
-  EXPECT_EQ(sessionEndReasonName(9), "(unknown: 9)");
+  const std::pair<int, const char*> reasons[] = {{7, "engagement_received"}, {8, "last_"}, {9, "(unknown: 9)"}};
+  for (const auto& [number, name] : reasons) EXPECT_EQ(sessionEndReasonName(number), name) << number;
 }
 
 // Guards against: a feedback entry with defaults written, 64-bit numbers rounded, nested or repeated fields

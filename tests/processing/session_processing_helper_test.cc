@@ -53,11 +53,7 @@ TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearanc
 // out of order, or when it was delivered).
 TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
   const std::string shown = R"(visibleResults { results { identifier: "r" type: 5 } })";
-  struct Row {
-    const char* name;
-    std::vector<std::string> in;
-    std::string missingResults, missingSuggestions;
-  };
+  struct Row { const char* name; std::vector<std::string> in; std::string missingResults, missingSuggestions; };
   const Row rows[] = {
       {"shown twice, never delivered: missing once", {shown, shown}, R"(identifier: "1" type: 5)", ""},
       {"shown, then delivered", {shown, R"(resultsReceivedAfterTimeout { results { identifier: "r" type: 5 } })"}, "", ""},
@@ -93,11 +89,8 @@ TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
 // rankings first (their sections' results cleared), items outside the per-kind table, engaged sections, local
 // application codes.
 TEST(Rewrites, EachKindRewrittenInPlace) {
-  struct Row {
-    const char* name;
-    std::vector<std::string> in;
-    std::string out, missing, counts;  // payloads and missing results as text; identifiers mapped/titles cleared
-  };
+  // Payloads and missing results as text; identifiers mapped/titles cleared.
+  struct Row { const char* name; std::vector<std::string> in; std::string out, missing, counts; };
   const Row rows[] = {
       {"ranking",
        {R"(ranking { sections { results { result { identifier: "a1" } } section { results { items { identifier: "a2" } } } }
