@@ -58,8 +58,7 @@ TEST(MatchLevels, EmbeddedAddressesAndSiteNames) {
   EXPECT_EQ(normalizedURLStringForTLDFeatures(*parseURLComponents("/relative/path")), nullopt);
 }
 
-// Guards against: a visit kept without a matching earlier web result of its query, kept with its address, or
-// other feedback being dropped or reordered.
+// Guards against: a visit kept without a matching earlier result of its query, or kept with its address.
 TEST(EngagedVisitFilter, KeepsMatchedVisitsWithTheirBestLevelAndNoAddress) {
   const std::string a = "https://www.example.com/a";
   auto noUrls = result("w", 1);

@@ -36,8 +36,7 @@ std::string timeline(const CVClientSession& s) {
   return out;
 }
 
-// Guards against: feedback left unsorted or unstably sorted, a device clock reading leaving as it stands, or a
-// time before the session's first time surviving.
+// Guards against: feedback unsorted or unstably sorted, or a device clock reading leaving as it stands.
 TEST(SessionTimeline, SortedStablyAndMadeRelativeToTheFirstTimeInMilliseconds) {
   struct Row {
     const char* name;
@@ -91,8 +90,7 @@ TEST(SessionTimeline, NestedTimesAndSessionStart) {
   EXPECT_EQ(session.generateSessionJSON()["base_time"], 0);
 }
 
-// Guards against: an absent feedback list being invented, an empty one dropped, or the session start cleared
-// without feedback; and the usage sink missing a session or seeing it rewritten.
+// Guards against: an absent feedback list invented, an empty one dropped, or the usage sink missing a session.
 TEST(SessionWithoutFeedback, AbsentStaysAbsentEmptyStaysEmptyBothCounted) {
   struct RecordingSink final : UsageEventSink {
     void reportUsageEvents(const CVClientSession& session) override { seen.push_back(timeline(session)); }
@@ -124,8 +122,7 @@ TEST(MissingItemsFeedback, MissingSuggestionsThenMissingResultsLeadTheList) {
             R"(items { type: 20 suggestionEngagement { timestamp: 10 suggestion { identifier: "2" type: 1 } } })");
 }
 
-// Guards against: engagements counted for the wrong client, lazy members recomputed after processing, or the
-// earlier of two results with one identifier winning.
+// Guards against: engagements counted for the wrong client, or usage members read from the processed session.
 TEST(LazyMembers, FollowTheClientAndTheUnprocessedSession) {
   auto s = sessionWith({pb(R"(resultEngagement { triggerEvent: 8 result { identifier: "a" } })"),
                         pb(R"(resultEngagement { triggerEvent: 1 result { identifier: "b" } })"), messageless(10),

@@ -53,8 +53,7 @@ TEST(Engagements, DependOnTriggerDestinationAndSurface) {
   EXPECT_FALSE(EngagementReporter::from(corevireon::CVClearInputFeedback()));
 }
 
-// Guards against: a search without input, or one to network endpoint 12, counted as a keystroke; a non-ranking
-// counted as a ranking.
+// Guards against: a search without input, or to network endpoint 12, counted as a keystroke.
 TEST(Keystrokes, NeedInputAndNetworkEndpoint12NeverCounts) {
   corevireon::CVStartLocalSearchFeedback local;
   EXPECT_FALSE(KeystrokeReporter::from(local)->isKeystroke());

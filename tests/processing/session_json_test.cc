@@ -56,8 +56,7 @@ TEST(EventNames, TableWithItsDeliberateDuplicates) {
   for (const auto& [number, name] : reasons) EXPECT_EQ(sessionEndReasonName(number), name) << number;
 }
 
-// Guards against: a feedback entry with defaults written, 64-bit numbers rounded, nested or repeated fields
-// misrendered, custom feedback without a JSON object uploaded, or a payload without a message uploaded.
+// Guards against: a feedback entry misrendered (defaults, 64-bit numbers, nesting) or uploaded when it has no body.
 TEST(FeedbackDictionary, SetFieldsUnderTheirNamesWithExactNumbers) {
   // 2^53 + 1 is not representable as a double; a zero response size is a default and left out.
   EXPECT_EQ(feedbackDictionary(pb(R"(queryId: 18446744073709551615 type: 15 endNetworkSearch {

@@ -49,8 +49,7 @@ TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearanc
   EXPECT_EQ(helper.nextMappedId(), 14);
 }
 
-// Guards against: an item referenced but never delivered in full not being reported missing (or reported twice,
-// out of order, or when it was delivered).
+// Guards against: an item referenced but never delivered not reported missing (or reported twice or out of order).
 TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
   const std::string shown = R"(visibleResults { results { identifier: "r" type: 5 } })";
   struct Row { const char* name; std::vector<std::string> in; std::string missingResults, missingSuggestions; };
@@ -85,9 +84,7 @@ TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
   }
 }
 
-// Guards against: a rewrite made to the wrong items or in the wrong order: rankings section by section with result
-// rankings first (their sections' results cleared), items outside the per-kind table, engaged sections, local
-// application codes.
+// Guards against: a rewrite made to the wrong items or in the wrong order (rankings, sections, app codes).
 TEST(Rewrites, EachKindRewrittenInPlace) {
   // Payloads and missing results as text; identifiers mapped/titles cleared.
   struct Row { const char* name; std::vector<std::string> in; std::string out, missing, counts; };
