@@ -10,37 +10,31 @@
 
 #include <gtest/gtest.h>
 
-#include <set>
+#include <algorithm>
 
 namespace fbf::testing {
 namespace {
 
-using namespace std::chrono_literals;
-
 constexpr uint64_t kSizeLimit = 2'097'152;
 constexpr int kTooOld = 1, kTooLarge = 2, kEmpty = 3, kPruned = 4, kNoConsent = 5;
+using Pairs = std::vector<std::pair<std::string, int>>;
 
 // A parseable session whose serialised form is exactly `bytes` long (the
 // agent string pads it), or as small as possible when `bytes` is 0.
 std::string sessionBytes(size_t bytes = 0) {
   corevireon::CVClientSession s;
   *s.mutable_feedbacks()->add_items() = clearInput(1'000'000'000, 7);
-  if (bytes == 0) return s.SerializeAsString();
-  size_t pad = bytes;
-  for (int i = 0; i < 8; ++i) {
+  for (size_t pad = bytes; bytes != 0 && s.ByteSizeLong() != bytes; pad += bytes - s.ByteSizeLong()) {
     s.set_agent(std::string(pad, 'a'));
-    size_t size = s.ByteSizeLong();
-    if (size == bytes) return s.SerializeAsString();
-    pad = pad + bytes - size;
   }
-  ADD_FAILURE() << "cannot make a session of " << bytes << " bytes";
-  return {};
+  return s.SerializeAsString();
 }
 
 class FlushWithHeldUploads : public ::testing::Test {
  protected:
   void SetUp() override {
-    env.writeBag({{"feedback_url", "https://127.0.0.1:9/feedback"}, {"vireon_feedback_format", "FeedbackV2PB"}});
+    env.writeBag({{"feedback_url", "https://127.0.0.1:9/feedback"}, {"vireon_feedback_format", "FeedbackV2PB"},
+                  {"max_custom_feedback_sizes", {{"Pelorus", 10}}}});
     setConsent(true);
   }
   // Held completions keep their flusher alive; drop them with the test.
@@ -51,7 +45,8 @@ class FlushWithHeldUploads : public ::testing::Test {
         ->setObject(FBFStrings::LinuxDefaults::DiagnosticsAndUsageEnabled, enabled);
   }
 
-  std::shared_ptr<FeedbackFlusher> makeFlusher() {
+  // Runs a whole walk; uploads stay pending.
+  void flush() {
     FlusherDependencies deps;
     deps.uploadManagerFactory = [this](FBFAssemblyProtocol&) -> std::unique_ptr<UploadManagerProtocol> {
       auto m = std::make_unique<FakeUploadManager>(uploads);
@@ -60,18 +55,13 @@ class FlushWithHeldUploads : public ::testing::Test {
     };
     // Sessions first, then the custom directories, each in directory order.
     deps.randomChoice = [](size_t) { return size_t{0}; };
-    return FeedbackFlusher::make(env.assembly(), std::move(deps));
-  }
-
-  // Runs a whole walk; uploads stay pending.
-  void flush() {
-    flusher = makeFlusher();
+    flusher = FeedbackFlusher::make(env.assembly(), std::move(deps));
     flusher->beginEnumeratingFeedback([this] { ++completions; });
     env.manualQueue->drain();
   }
 
-  void settleAll(long status) {
-    while (!uploads->pending.empty()) {
+  void settle(long status, size_t count = SIZE_MAX) {
+    for (; count > 0 && !uploads->pending.empty(); --count) {
       env.manualQueue->async([this, status] { manager->settleOldest(status); });
       env.manualQueue->drain();
     }
@@ -86,19 +76,15 @@ class FlushWithHeldUploads : public ::testing::Test {
     return path;
   }
 
-  // Deletion events as (type name, reason).
-  std::vector<std::pair<std::string, int>> deletions() const {
-    std::vector<std::pair<std::string, int>> out;
+  // Deletion events as (type name, reason), sorted, and their payloads.
+  Pairs deletions(std::vector<nlohmann::json>* payloads = nullptr) const {
+    Pairs out;
     for (const auto& [name, payload] : env.analytics->events()) {
       if (name != FBFStrings::FeedbackLossEventName) continue;
       out.emplace_back(knownFeedbackTypeName(payload.at("feedbackType").get<int>()), payload.at("reason").get<int>());
+      if (payloads) payloads->push_back(payload);
     }
-    return out;
-  }
-  std::vector<nlohmann::json> deletionPayloads() const {
-    std::vector<nlohmann::json> out;
-    for (const auto& [name, payload] : env.analytics->events())
-      if (name == FBFStrings::FeedbackLossEventName) out.push_back(payload);
+    std::sort(out.begin(), out.end());
     return out;
   }
 
@@ -109,141 +95,94 @@ class FlushWithHeldUploads : public ::testing::Test {
   int completions = 0;
 };
 
-using Pairs = std::vector<std::pair<std::string, int>>;
+struct LimitRow {
+  const char* name;
+  size_t bytes;  // 0: a small session; 1: undecodable bytes
+  int ageDays;
+  Pairs dropped;         // empty: uploaded (or, undecodable, kept in processing)
+  uint64_t reportedKiB;  // the size in the deletion event, rounded up
+  const char* log;
+};
 
-// ---- the two limits of a session file: age first, then size
+class SessionAtTheLimits : public FlushWithHeldUploads, public ::testing::WithParamInterface<LimitRow> {};
 
-using SessionAtTheLimits = FlushWithHeldUploads;
-
-TEST_F(SessionAtTheLimits, ExactlyTheSizeLimitIsUploaded) {
-  auto file = closedSession(1, sessionBytes(kSizeLimit));
-  ASSERT_EQ(fs::file_size(file), kSizeLimit);
-  flush();
-  ASSERT_EQ(uploads->prepared.size(), 1u);
-  EXPECT_EQ(uploads->prepared[0].second, "FeedbackV2PB");
-  EXPECT_EQ(uploads->pending.size(), 1u);
-  EXPECT_FALSE(fs::exists(file));
-  EXPECT_TRUE(deletions().empty());
-}
-
-TEST_F(SessionAtTheLimits, OneByteOverIsDiscardedAsTooLargeWithADeletionEvent) {
+// Guards against: a session past its age or size limit being uploaded, or one at the limit being dropped.
+TEST_P(SessionAtTheLimits, AgeIsJudgedFirstThenSize) {
+  const LimitRow& row = GetParam();
   LogCapture logs;
-  auto file = closedSession(1, sessionBytes(kSizeLimit + 1));
+  auto file = closedSession(1, row.bytes == 1 ? std::string("\xff\xff\xff garbage", 12) : sessionBytes(row.bytes));
+  ASSERT_EQ(fs::file_size(file), row.bytes > 1 ? row.bytes : fs::file_size(file));
+  env.clock->advance(std::chrono::hours(24 * row.ageDays));
   flush();
-  EXPECT_TRUE(uploads->prepared.empty());
+  std::vector<nlohmann::json> payloads;
+  EXPECT_EQ(deletions(&payloads), row.dropped);
+  EXPECT_EQ(payloads.empty() ? 0 : payloads[0].at("size").get<uint64_t>(), row.reportedKiB);
+  const bool uploaded = row.dropped.empty() && row.bytes != 1;
+  std::set<FakeUploadManager::Prepared> expected;
+  if (uploaded) expected.emplace(env.cacheDir() / sessionName(SessionFileState::processing, 1), "FeedbackV2PB");
+  EXPECT_EQ(uploads->prepared, expected);
+  EXPECT_EQ(uploads->pending.size(), expected.size());
   EXPECT_FALSE(fs::exists(file));
-  EXPECT_FALSE(fs::exists(env.cacheDir() / sessionName(SessionFileState::processing, 1)));
-  EXPECT_EQ(deletions(), (Pairs{{"FeedbackV2PB", kTooLarge}}));
-  // Reported in KiB, rounded up: one byte over shows as one KiB over.
-  EXPECT_EQ(deletionPayloads().at(0).at("size").get<uint64_t>(), kSizeLimit / 1024 + 1);
-  EXPECT_TRUE(logs.contains("because size exceeds maximum size 2048KB"));
+  // Undecodable sessions are the file's own fault: they stay in processing, unreported.
+  EXPECT_EQ(fs::exists(env.cacheDir() / sessionName(SessionFileState::processing, 1)), row.bytes == 1);
+  EXPECT_TRUE(!*row.log || logs.contains(row.log)) << row.log;
 }
 
-TEST_F(SessionAtTheLimits, EightDaysOldIsDiscardedAsTooOld) {
-  auto file = closedSession(1, sessionBytes());
-  env.clock->advance(std::chrono::hours(24 * 8));
-  flush();
-  EXPECT_TRUE(uploads->prepared.empty());
-  EXPECT_FALSE(fs::exists(file));
-  EXPECT_EQ(deletions(), (Pairs{{"FeedbackV2PB", kTooOld}}));
-}
+INSTANTIATE_TEST_SUITE_P(
+    Rows, SessionAtTheLimits,
+    ::testing::Values(
+        LimitRow{"ExactlyTheSizeLimit", kSizeLimit, 0, {}, 0, ""},
+        LimitRow{"OneByteOver", kSizeLimit + 1, 0, {{"FeedbackV2PB", kTooLarge}}, kSizeLimit / 1024 + 1,
+                 "because size exceeds maximum size 2048KB"},
+        LimitRow{"EightDaysOld", 0, 8, {{"FeedbackV2PB", kTooOld}}, 1, "Discarding session because it's too old"},
+        LimitRow{"SixDaysOld", 0, 6, {}, 0, ""},
+        LimitRow{"EightDaysOldAndOneByteOver", kSizeLimit + 1, 8, {{"FeedbackV2PB", kTooOld}}, kSizeLimit / 1024 + 1,
+                 "too old"},
+        LimitRow{"Undecodable", 1, 0, {}, 0, "did not deserialize"}),
+    [](const auto& info) { return std::string(info.param.name); });
 
-TEST_F(SessionAtTheLimits, SixDaysOldIsStillUploaded) {
-  closedSession(1, sessionBytes());
-  env.clock->advance(std::chrono::hours(24 * 6));
-  flush();
-  EXPECT_EQ(uploads->prepared.size(), 1u);
-  EXPECT_TRUE(deletions().empty());
-}
-
-TEST_F(SessionAtTheLimits, AgeIsJudgedBeforeSize) {
-  closedSession(1, sessionBytes(kSizeLimit + 1));
-  env.clock->advance(std::chrono::hours(24 * 8));
-  flush();
-  EXPECT_EQ(deletions(), (Pairs{{"FeedbackV2PB", kTooOld}}));
-}
-
-TEST_F(SessionAtTheLimits, UndecodableSessionIsNeitherUploadedNorReportedAsLost) {
-  closedSession(1, std::string("\xff\xff\xff garbage", 12));
-  flush();
-  EXPECT_TRUE(uploads->prepared.empty());
-  EXPECT_TRUE(deletions().empty());
-}
-
-// ---- custom feedback validation and consent
-
+// Guards against: custom feedback that is empty, over its type's limit or without consent being sent, or valid feedback being dropped.
 using CustomFeedbackChecks = FlushWithHeldUploads;
 
-TEST_F(CustomFeedbackChecks, ZeroByteFileIsDiscardedAsEmpty) {
+TEST_F(CustomFeedbackChecks, WithoutConsentOnlyTheUserReportPassesTheChecks) {
+  setConsent(false);
   LogCapture logs;
-  auto file = custom("Pelorus", "empty", "");
+  const fs::path dropped[] = {custom("Pelorus", "empty", ""), custom("Pelorus", "over", "0123456789A"),
+                              custom("Pelorus", "at-limit", "0123456789")};
+  auto report = custom("UserReport", "r1", "{\"text\":\"it broke\"}");
   flush();
-  EXPECT_FALSE(fs::exists(file));
-  EXPECT_TRUE(uploads->prepared.empty());
-  EXPECT_EQ(deletions(), (Pairs{{"Pelorus", kEmpty}}));
+  EXPECT_EQ(uploads->prepared, (std::set<FakeUploadManager::Prepared>{{report, "UserReport"}}));
+  for (const auto& f : dropped) EXPECT_FALSE(fs::exists(f)) << f;
+  EXPECT_EQ(deletions(), (Pairs{{"Pelorus", kTooLarge}, {"Pelorus", kEmpty}, {"Pelorus", kNoConsent}}));
   EXPECT_TRUE(logs.contains("discarding Pelorus custom feedback because it's empty"));
 }
 
-TEST_F(CustomFeedbackChecks, FileOverItsTypesLimitIsDiscardedAsTooLarge) {
-  env.writeBag({{"feedback_url", "https://127.0.0.1:9/feedback"}, {"max_custom_feedback_sizes", {{"Pelorus", 10}}}});
-  auto fits = custom("Pelorus", "a-fits", "0123456789");
-  auto over = custom("Pelorus", "b-over", "0123456789A");
+TEST_F(CustomFeedbackChecks, ValidFilesArePreparedUnderTheirTypeAndRemoved) {
+  auto pelorus = custom("Pelorus", "at-limit", "0123456789");
+  auto quenbury = custom("Quenbury", "q1", R"({"k":1})");
   flush();
-  ASSERT_EQ(uploads->prepared.size(), 1u);
-  EXPECT_EQ(uploads->prepared[0].first, fits);
-  EXPECT_FALSE(fs::exists(over));
-  EXPECT_EQ(deletions(), (Pairs{{"Pelorus", kTooLarge}}));
-}
-
-TEST_F(CustomFeedbackChecks, ValidFileIsPreparedUnderItsTypeAndRemoved) {
-  auto file = custom("Quenbury", "q1", R"({"k":1})");
-  flush();
-  ASSERT_EQ(uploads->prepared.size(), 1u);
-  EXPECT_EQ(uploads->prepared[0], (std::pair<fs::path, std::string>{file, "Quenbury"}));
-  EXPECT_FALSE(fs::exists(file));
+  EXPECT_EQ(uploads->prepared, (std::set<FakeUploadManager::Prepared>{{pelorus, "Pelorus"}, {quenbury, "Quenbury"}}));
+  EXPECT_FALSE(fs::exists(pelorus) || fs::exists(quenbury));
   EXPECT_TRUE(deletions().empty());
 }
 
-TEST_F(CustomFeedbackChecks, WithoutConsentOnlyTheUserReportIsSent) {
-  setConsent(false);
-  auto pelorus = custom("Pelorus", "p1", "{}");
-  auto report = custom("UserReport", "r1", "{\"text\":\"it broke\"}");
-  flush();
-  ASSERT_EQ(uploads->prepared.size(), 1u);
-  EXPECT_EQ(uploads->prepared[0].first, report);
-  EXPECT_FALSE(fs::exists(pelorus));
-  EXPECT_EQ(deletions(), (Pairs{{"Pelorus", kNoConsent}}));
-}
-
-// ---- what the walk leaves alone or only retries
-
+// Guards against: the walk claiming, compressing again or deleting files that are not closed sessions.
 using FilesInOtherStates = FlushWithHeldUploads;
 
-TEST_F(FilesInOtherStates, PendingUploadsAreRetriedNeverCompressedAgain) {
+TEST_F(FilesInOtherStates, PendingUploadsAreRetriedOtherSessionsLeftAlone) {
   SessionFilename name = *SessionFilename::fromString(sessionName(SessionFileState::processing, 3));
   name.uploadFormat = UploadFormat::pb;
   auto sessionUpload = makeFile(env.cacheDir(), name.uploadFilenameString(), "compressed-session");
   auto customUpload = custom("Pelorus", "p1.uploadPending", "compressed-custom");
+  for (auto state : {SessionFileState::open, SessionFileState::processing, SessionFileState::uploaded}) {
+    makeFile(env.cacheDir(), sessionName(state, 10 + static_cast<unsigned>(state)), sessionBytes());
+  }
+  const auto before = entryNames(env.cacheDir());
   flush();
   EXPECT_TRUE(uploads->prepared.empty());
-  std::set<std::pair<fs::path, std::string>> retried(uploads->retried.begin(), uploads->retried.end());
-  EXPECT_EQ(retried, (std::set<std::pair<fs::path, std::string>>{{sessionUpload, "FeedbackV2PB"},
-                                                                 {customUpload, "Pelorus"}}));
-  EXPECT_EQ(readFile(sessionUpload), "compressed-session");
-  EXPECT_EQ(readFile(customUpload), "compressed-custom");
-  EXPECT_TRUE(deletions().empty());
-}
-
-TEST_F(FilesInOtherStates, OpenProcessingAndUploadedSessionsAreLeftAlone) {
-  auto open = makeFile(env.cacheDir(), sessionName(SessionFileState::open, 1), sessionBytes());
-  auto processing = makeFile(env.cacheDir(), sessionName(SessionFileState::processing, 2), sessionBytes());
-  auto uploaded = makeFile(env.cacheDir(), sessionName(SessionFileState::uploaded, 3), sessionBytes());
-  flush();
-  EXPECT_TRUE(uploads->prepared.empty());
-  EXPECT_TRUE(uploads->retried.empty());
-  EXPECT_TRUE(fs::exists(open));
-  EXPECT_TRUE(fs::exists(processing));
-  EXPECT_TRUE(fs::exists(uploaded));
+  EXPECT_EQ(uploads->retried, (std::set<FakeUploadManager::Prepared>{{sessionUpload, "FeedbackV2PB"}, {customUpload, "Pelorus"}}));
+  EXPECT_EQ(readFile(sessionUpload) + "+" + readFile(customUpload), "compressed-session+compressed-custom");
+  EXPECT_EQ(entryNames(env.cacheDir()), before);
   EXPECT_TRUE(deletions().empty());
   EXPECT_EQ(completions, 1);
 }
@@ -251,51 +190,33 @@ TEST_F(FilesInOtherStates, OpenProcessingAndUploadedSessionsAreLeftAlone) {
 TEST_F(FilesInOtherStates, WithoutABagNothingIsTouched) {
   fs::remove(env.cacheDir() / "bag.plist");
   LogCapture logs;
-  auto session = closedSession(1, sessionBytes(kSizeLimit + 1));
-  auto empty = custom("Pelorus", "empty", "");
-  for (unsigned i = 10; i < 130; ++i) makeFile(env.cacheDir(), sessionName(SessionFileState::processing, i));
-  auto before = entryNames(env.cacheDir());
+  closedSession(1, sessionBytes(kSizeLimit + 1));
+  custom("Pelorus", "empty", "");
+  for (unsigned i = 10; i < 111; ++i) makeFile(env.cacheDir(), sessionName(SessionFileState::processing, i));
+  const auto before = entryNames(env.cacheDir());
   flush();
   EXPECT_EQ(entryNames(env.cacheDir()), before);
-  EXPECT_TRUE(fs::exists(session));
-  EXPECT_TRUE(fs::exists(empty));
+  EXPECT_TRUE(fs::exists(env.cacheDir() / "CustomFeedback" / "Pelorus" / "empty"));
   EXPECT_TRUE(uploads->prepared.empty());
   EXPECT_TRUE(deletions().empty());
   EXPECT_EQ(completions, 1);
   EXPECT_TRUE(logs.contains("Flusher didn't find a cached bag, bailing on this flush"));
 }
 
-// ---- completion: once, and only after the uploads have settled
-
+// Guards against: the flush completing early, twice, or never, and a stop that does not stop the walk.
 using FlushCompletion = FlushWithHeldUploads;
 
-TEST_F(FlushCompletion, WaitsForEveryEnqueuedUpload) {
-  closedSession(1, sessionBytes());
-  closedSession(2, sessionBytes());
+TEST_F(FlushCompletion, WaitsForEveryUploadSuccessfulOrNot) {
+  for (unsigned i = 1; i <= 2; ++i) closedSession(i, sessionBytes());
   custom("Pelorus", "p1", "{}");
   flush();
   ASSERT_EQ(uploads->pending.size(), 3u);
-  EXPECT_EQ(completions, 0);
-  env.manualQueue->async([this] { manager->settleOldest(200); });
-  env.manualQueue->drain();
-  EXPECT_EQ(completions, 0) << "two uploads are still in flight";
-  settleAll(200);
+  const auto failedFile = uploads->pending.back().first.fileURL;
+  settle(200, 2);
+  EXPECT_EQ(completions, 0) << "one upload is still in flight";
+  settle(500);
   EXPECT_EQ(completions, 1);
-}
-
-TEST_F(FlushCompletion, FailedUploadsSettleTooAndLeaveTheirUploadFiles) {
-  closedSession(1, sessionBytes());
-  flush();
-  ASSERT_EQ(uploads->pending.size(), 1u);
-  auto uploadFile = uploads->pending.front().request.fileURL;
-  settleAll(500);
-  EXPECT_EQ(completions, 1);
-  EXPECT_TRUE(fs::exists(uploadFile));
-}
-
-TEST_F(FlushCompletion, IsCalledExactlyOnceWhenNothingWasEnqueued) {
-  flush();
-  EXPECT_EQ(completions, 1);
+  EXPECT_TRUE(fs::exists(failedFile)) << "a failed upload keeps its file for a retry";
   // A late delegate call (an upload of someone else) does not complete again.
   env.manualQueue->async([this] { flusher->uploadManagerDidUploadFile(env.cacheDir() / "x", 200); });
   env.manualQueue->drain();
@@ -304,32 +225,25 @@ TEST_F(FlushCompletion, IsCalledExactlyOnceWhenNothingWasEnqueued) {
 
 TEST_F(FlushCompletion, StopEndsTheWalkBetweenFiles) {
   std::vector<fs::path> files;
-  for (unsigned i = 1; i <= 5; ++i) files.push_back(closedSession(i, sessionBytes()));
+  for (unsigned i = 1; i <= 3; ++i) files.push_back(closedSession(i, sessionBytes()));
   // The stop arrives while the first file is being handed to the uploader.
   uploads->onEnqueue = [this] { flusher->stopEnumeratingFeedback(); };
   flush();
   ASSERT_EQ(uploads->prepared.size(), 1u);
-  size_t stillClosed = 0;
-  for (const auto& f : files) stillClosed += fs::exists(f);
-  EXPECT_EQ(stillClosed, 4u) << "the walk went on after the stop";
+  EXPECT_EQ(std::count_if(files.begin(), files.end(), [](const auto& f) { return fs::exists(f); }), 2)
+      << "the walk went on after the stop";
   EXPECT_EQ(completions, 0);
-  settleAll(200);
+  settle(200);
   EXPECT_EQ(completions, 1);
 }
 
-// ---- pruning after the walk
-
-using LeftoverSessions = FlushWithHeldUploads;
-
-TEST_F(LeftoverSessions, HundredAndTwentyLeftAreCutToFifty) {
-  for (unsigned i = 0; i < 120; ++i) makeFile(env.cacheDir(), sessionName(SessionFileState::processing, i));
+// Guards against: more than a hundred leftover sessions not being cut to fifty after the walk, or cut without a report.
+TEST_F(FlushWithHeldUploads, HundredAndOneLeftoverSessionsAreCutToFifty) {
+  for (unsigned i = 0; i < 101; ++i) makeFile(env.cacheDir(), sessionName(SessionFileState::processing, i));
   flush();
-  size_t left = 0;
-  for (const auto& n : entryNames(env.cacheDir())) left += n.starts_with("session.");
-  EXPECT_EQ(left, 50u);
-  auto events = deletions();
-  EXPECT_EQ(events.size(), 70u);
-  for (const auto& [type, reason] : events) EXPECT_EQ(reason, kPruned);
+  const auto names = entryNames(env.cacheDir());
+  EXPECT_EQ(std::count_if(names.begin(), names.end(), [](const auto& n) { return n.starts_with("session."); }), 50);
+  EXPECT_EQ(deletions(), (Pairs(51, {"FeedbackV2", kPruned})));  // typed by the upload format in the name
   EXPECT_EQ(completions, 1);
 }
 

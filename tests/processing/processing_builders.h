@@ -3,6 +3,9 @@
 
 #include "corevireon.pb.h"
 
+#include <google/protobuf/text_format.h>
+#include <gtest/gtest.h>
+
 #include <cstdint>
 #include <initializer_list>
 #include <optional>
@@ -10,11 +13,16 @@
 
 namespace fbf::testing {
 
+// A message from its text form, e.g. pb(R"(visibleResults { results { identifier: "r" } })").
+template <typename T = corevireon::CVFeedbackPayload>
+T pb(const std::string& text) {
+  T m;
+  EXPECT_TRUE(google::protobuf::TextFormat::ParseFromString(text, &m)) << text;
+  return m;
+}
+
 inline corevireon::CVSearchResultForFeedback result(const std::string& id, int32_t type = 2) {
-  corevireon::CVSearchResultForFeedback r;
-  r.set_identifier(id);
-  r.set_type(type);
-  return r;
+  return pb<corevireon::CVSearchResultForFeedback>("identifier: \"" + id + "\" type: " + std::to_string(type));
 }
 
 inline corevireon::CVSearchResultForFeedback webResult(const std::string& id, const std::string& url,
@@ -25,47 +33,23 @@ inline corevireon::CVSearchResultForFeedback webResult(const std::string& id, co
   return r;
 }
 
-inline corevireon::CVSearchSuggestionForFeedback suggestion(const std::string& id, int32_t type = 1) {
-  corevireon::CVSearchSuggestionForFeedback s;
-  s.set_identifier(id);
-  s.set_type(type);
-  return s;
-}
-
-inline corevireon::CVFeedbackPayload visibleResults(uint64_t queryId,
-                                                    std::initializer_list<corevireon::CVSearchResultForFeedback> rs,
-                                                    uint64_t timestamp = 0) {
-  corevireon::CVFeedbackPayload p;
-  p.set_queryid(queryId);
-  p.set_type(8);
-  auto* m = p.mutable_visibleresults();
-  m->set_timestamp(timestamp);
-  for (const auto& r : rs) *m->add_results() = r;
+inline corevireon::CVFeedbackPayload visibleResults(
+    uint64_t queryId, std::initializer_list<corevireon::CVSearchResultForFeedback> rs, uint64_t timestamp = 0) {
+  auto p = pb("type: 8 queryId: " + std::to_string(queryId) + " visibleResults { timestamp: " + std::to_string(timestamp) + " }");
+  for (const auto& r : rs) *p.mutable_visibleresults()->add_results() = r;
   return p;
 }
 
-inline corevireon::CVFeedbackPayload cba(uint64_t queryId, std::optional<std::string> url, uint64_t timestamp = 0) {
-  corevireon::CVFeedbackPayload p;
-  p.set_queryid(queryId);
-  p.set_type(40);
-  auto* m = p.mutable_cbaengagement();
-  m->set_timestamp(timestamp);
-  if (url) m->set_url(*url);
+inline corevireon::CVFeedbackPayload cba(uint64_t queryId, std::optional<std::string> url) {
+  auto p = pb("type: 40 queryId: " + std::to_string(queryId) + " cbaEngagement { }");
+  if (url) p.mutable_cbaengagement()->set_url(*url);
   return p;
 }
 
 inline corevireon::CVFeedbackPayload clearInput(uint64_t timestamp, uint64_t queryId = 0) {
-  corevireon::CVFeedbackPayload p;
-  p.set_queryid(queryId);
-  p.set_type(25);
-  p.mutable_clearinput()->set_timestamp(timestamp);
-  return p;
+  return pb("type: 25 queryId: " + std::to_string(queryId) + " clearInput { timestamp: " + std::to_string(timestamp) + " }");
 }
 
-inline corevireon::CVFeedbackPayload messageless(int32_t type) {
-  corevireon::CVFeedbackPayload p;
-  p.set_type(type);
-  return p;
-}
+inline corevireon::CVFeedbackPayload messageless(int32_t type) { return pb("type: " + std::to_string(type)); }
 
 }  // namespace fbf::testing

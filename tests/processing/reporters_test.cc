@@ -1,4 +1,5 @@
 #include "flushing/reporters.h"
+#include "processing/processing_builders.h"
 
 #include <gtest/gtest.h>
 
@@ -6,69 +7,53 @@ namespace fbf {
 namespace {
 
 using corevireon::CVClient;
+using fbf::testing::pb;
 
-// The client surface is read from the agent, first matching rule wins.
-TEST(ClientFromAgent, MatchesLowerCasedAgentInRuleOrder) {
-  EXPECT_EQ(cohortsClient(std::string_view("Wayfin/1.0")), corevireon::CV_CLIENT_WEB_BROWSER);
-  EXPECT_EQ(cohortsClient(std::string_view("SCOUTLUME/17")), corevireon::CV_CLIENT_SYSTEM_SEARCH_UI);
-  EXPECT_EQ(cohortsClient(std::string_view("News/8")), corevireon::CV_CLIENT_NEWS);
-  EXPECT_EQ(cohortsClient(std::string_view("Messages/17")), corevireon::CV_CLIENT_MESSAGING);
-  // "news" is tested before "messages", and both come after the first two.
-  EXPECT_EQ(cohortsClient(std::string_view("MessagesNews")), corevireon::CV_CLIENT_NEWS);
-  EXPECT_EQ(cohortsClient(std::string_view("news scoutlume")), corevireon::CV_CLIENT_SYSTEM_SEARCH_UI);
-  EXPECT_EQ(cohortsClient(std::string_view("scoutlume wayfin")), corevireon::CV_CLIENT_WEB_BROWSER);
-}
-
-TEST(ClientFromAgent, AbsentEmptyOrUnknownAgentIsNone) {
-  EXPECT_EQ(cohortsClient(std::nullopt), corevireon::CV_CLIENT_NONE);
-  EXPECT_EQ(cohortsClient(std::string_view("")), corevireon::CV_CLIENT_NONE);
-  EXPECT_EQ(cohortsClient(std::string_view("Mail/16")), corevireon::CV_CLIENT_NONE);
+// Guards against: an agent read as the wrong client surface (case, rule order, absent agent).
+TEST(ClientFromAgent, MatchesTheLowerCasedAgentFirstRuleWins) {
+  const std::pair<std::optional<std::string_view>, CVClient> rows[] = {
+      {"Wayfin/1.0", corevireon::CV_CLIENT_WEB_BROWSER},       {"SCOUTLUME/17", corevireon::CV_CLIENT_SYSTEM_SEARCH_UI},
+      {"News/8", corevireon::CV_CLIENT_NEWS},                  {"Messages/17", corevireon::CV_CLIENT_MESSAGING},
+      {"MessagesNews", corevireon::CV_CLIENT_NEWS},            {"news scoutlume", corevireon::CV_CLIENT_SYSTEM_SEARCH_UI},
+      {"scoutlume wayfin", corevireon::CV_CLIENT_WEB_BROWSER}, {std::nullopt, corevireon::CV_CLIENT_NONE},
+      {"", corevireon::CV_CLIENT_NONE},                        {"Mail/16", corevireon::CV_CLIENT_NONE},
+  };
+  for (const auto& [agent, client] : rows) EXPECT_EQ(cohortsClient(agent), client) << agent.value_or("<none>");
   corevireon::CVClientSession session;
   EXPECT_EQ(cohortsClient(session), corevireon::CV_CLIENT_NONE);
   session.set_agent("wayfin");
   EXPECT_EQ(cohortsClient(session), corevireon::CV_CLIENT_WEB_BROWSER);
 }
 
-TEST(PreviewTriggerEvents, AreNineEightAndThree) {
-  EXPECT_EQ(triggerEventScoutlumePreviewTypes(), (std::set<int32_t>{3, 8, 9}));
-}
-
-class ResultEngagementCounting : public ::testing::Test {
- protected:
-  static EngagementReporter engagement(int trigger, int destination) {
-    corevireon::CVResultEngagementFeedback m;
-    m.set_triggerevent(static_cast<corevireon::CVTriggerEngagementEvent>(trigger));
-    m.set_destination(destination);
-    return *EngagementReporter::from(m);
+// Guards against: previews, destination 1 or go-to feedback counted as engagements on the wrong surface.
+TEST(Engagements, DependOnTriggerDestinationAndSurface) {
+  using Row = std::tuple<int, int, CVClient, bool>;  // trigger, destination, surface, counts as an engagement
+  std::vector<Row> rows = {{1, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, true},
+                           {1, 1, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, false},
+                           {1, 2, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, true},
+                           {1, 1, corevireon::CV_CLIENT_NEWS, true}};
+  for (int preview : {3, 8, 9}) {
+    rows.emplace_back(preview, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, false);
+    rows.emplace_back(preview, 0, corevireon::CV_CLIENT_NONE, true);
+    rows.emplace_back(preview, 0, corevireon::CV_CLIENT_WEB_BROWSER, true);
   }
-};
-
-TEST_F(ResultEngagementCounting, PreviewInSystemSearchIsNotAnEngagementElsewhereItIs) {
-  for (int trigger : {3, 8, 9}) {
-    EXPECT_FALSE(engagement(trigger, 0).isEngagement(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI));
-    EXPECT_TRUE(engagement(trigger, 0).isEngagement(corevireon::CV_CLIENT_NONE));
-    EXPECT_TRUE(engagement(trigger, 0).isEngagement(corevireon::CV_CLIENT_WEB_BROWSER));
+  for (int other : {2, 4, 7}) rows.emplace_back(other, 0, corevireon::CV_CLIENT_SYSTEM_SEARCH_UI, true);
+  for (const auto& [trigger, destination, client, engagement] : rows) {
+    auto m = pb<corevireon::CVResultEngagementFeedback>("triggerEvent: " + std::to_string(trigger) +
+                                                        " destination: " + std::to_string(destination));
+    EXPECT_EQ(EngagementReporter::from(m)->isEngagement(client), engagement)
+        << "trigger " << trigger << " destination " << destination << " client " << client;
   }
-  EXPECT_TRUE(engagement(1, 0).isEngagement(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI));
-}
-
-TEST_F(ResultEngagementCounting, DestinationOneInSystemSearchIsNotAnEngagement) {
-  EXPECT_FALSE(engagement(1, 1).isEngagement(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI));
-  EXPECT_TRUE(engagement(1, 2).isEngagement(corevireon::CV_CLIENT_SYSTEM_SEARCH_UI));
-  EXPECT_TRUE(engagement(1, 1).isEngagement(corevireon::CV_CLIENT_NEWS));
-}
-
-TEST(GoToEngagements, CountOnlyForTheirSurfaces) {
   auto site = *EngagementReporter::from(corevireon::CVDidGoToSiteFeedback());
   auto search = *EngagementReporter::from(corevireon::CVDidGoToSearchFeedback());
   for (int c = 0; c <= 4; ++c) {
-    auto client = static_cast<CVClient>(c);
-    EXPECT_EQ(site.isEngagement(client), c == 1) << c;
-    EXPECT_EQ(search.isEngagement(client), c == 1 || c == 2) << c;
+    EXPECT_EQ(site.isEngagement(static_cast<CVClient>(c)), c == 1) << c;
+    EXPECT_EQ(search.isEngagement(static_cast<CVClient>(c)), c == 1 || c == 2) << c;
   }
   EXPECT_FALSE(EngagementReporter::from(corevireon::CVClearInputFeedback()));
 }
 
+// Guards against: a search without input, or to network endpoint 12, counted as a keystroke.
 TEST(Keystrokes, NeedInputAndNetworkEndpoint12NeverCounts) {
   corevireon::CVStartLocalSearchFeedback local;
   EXPECT_FALSE(KeystrokeReporter::from(local)->isKeystroke());
@@ -76,24 +61,19 @@ TEST(Keystrokes, NeedInputAndNetworkEndpoint12NeverCounts) {
   EXPECT_FALSE(KeystrokeReporter::from(local)->isKeystroke());
   local.set_input("a");
   EXPECT_TRUE(KeystrokeReporter::from(local)->isKeystroke());
-
   corevireon::CVStartNetworkSearchFeedback network;
   network.set_input("pasta");
-  network.set_endpoint(3);
-  EXPECT_TRUE(KeystrokeReporter::from(network)->isKeystroke());
+  for (int endpoint : {3, 11, 13}) {
+    network.set_endpoint(endpoint);
+    EXPECT_TRUE(KeystrokeReporter::from(network)->isKeystroke()) << endpoint;
+  }
   network.set_endpoint(12);
   EXPECT_FALSE(KeystrokeReporter::from(network)->isKeystroke());
   EXPECT_FALSE(KeystrokeReporter::from(corevireon::CVEndLocalSearchFeedback()));
-}
 
-TEST(Rankings, OnlyRankingFeedbackIsARankingReporter) {
   corevireon::CVRankingFeedback ranking;
-  auto* r = ranking.add_sections()->mutable_section()->mutable_results()->add_items();
-  r->set_identifier("x");
-  auto reporter = RankingReporter::from(ranking);
-  ASSERT_TRUE(reporter);
-  ASSERT_EQ(reporter->containedResults().size(), 1u);
-  EXPECT_EQ(reporter->containedResults()[0]->identifier(), "x");
+  ranking.add_sections()->mutable_section()->mutable_results()->add_items()->set_identifier("x");
+  EXPECT_EQ(RankingReporter::from(ranking)->containedResults().at(0)->identifier(), "x");
   EXPECT_FALSE(RankingReporter::from(corevireon::CVSectionRankingFeedback()));
 }
 

@@ -3,384 +3,189 @@
 
 #include <gtest/gtest.h>
 
-#include <functional>
-
 namespace fbf {
 namespace {
 
 using namespace fbf::testing;
+using corevireon::CVFeedbackPayload;
 using corevireon::CVSearchResultForFeedback;
 
-std::vector<std::string> identifiersOf(const google::protobuf::RepeatedPtrField<CVSearchResultForFeedback>& rs) {
-  std::vector<std::string> out;
-  for (const auto& r : rs) out.push_back(r.has_identifier() ? r.identifier() : "<absent>");
+template <typename Items>
+std::string idsOf(const Items& items) {
+  std::string out;
+  for (const auto& r : items) out += (out.empty() ? "" : " ") + (r.has_identifier() ? r.identifier() : "-");
   return out;
 }
 
-// Results and suggestions outside the per-kind table are found through the
-// descriptors: mapped and stripped of their titles like the others, but they
-// do not count as shown or delivered.
-TEST(ItemsAnywhere, AreMappedAndStrippedWithoutBookkeeping) {
-  struct Row {
-    const char* name;
-    std::function<void(corevireon::CVFeedbackPayload&)> build;
-    std::function<const CVSearchResultForFeedback&(const corevireon::CVFeedbackPayload&)> item;
-  };
-  auto titled = [](int32_t type) {
-    auto r = result("secret-id", type);
-    r.set_title("secret title");
-    return r;
-  };
-  const Row rows[] = {
-      {"section header, plain type",
-       [&](auto& p) {
-         *p.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled(2);
-       },
-       [](const auto& p) -> const auto& { return p.visiblesectionheader().section().results().items(0); }},
-      {"missing results written by the search daemon",
-       [&](auto& p) { *p.mutable_sessionmissingresults()->add_results() = titled(5); },
-       [](const auto& p) -> const auto& { return p.sessionmissingresults().results(0); }},
-  };
-  for (const auto& row : rows) {
-    SessionProcessingHelper helper;
-    corevireon::CVFeedbackPayload payload;
-    row.build(payload);
-    helper.process(mutableCodableMessage(payload));
-    EXPECT_EQ(row.item(payload).identifier(), "1") << row.name;
-    EXPECT_FALSE(row.item(payload).has_title()) << row.name;
-    EXPECT_EQ(helper.identifiersMapped(), 1u) << row.name;
-    EXPECT_EQ(helper.titlesCleared(), 1u) << row.name;
-    EXPECT_TRUE(helper.missingResults()->empty()) << row.name;
-  }
-  // A title-keeping type keeps it wherever it appears; a suggestion is mapped.
+// Messages in their short text form, " | " between them.
+template <typename Messages>
+std::string join(const Messages& messages) {
+  std::string out;
+  for (const auto& m : messages) out += (out.empty() ? "" : " | ") + m.ShortDebugString();
+  return out;
+}
+
+// Processes each payload's feedback in turn, as a session does.
+void processAll(SessionProcessingHelper& helper, std::vector<CVFeedbackPayload>& payloads) {
+  for (auto& p : payloads) helper.process(mutableCodableMessage(p));
+}
+
+
+// Guards against: replacement numbers reused across keys, handed out twice for one key, or given to empty identifiers.
+TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearance) {
   SessionProcessingHelper helper;
-  corevireon::CVFeedbackPayload payload;
-  *payload.mutable_sessionmissingsuggestions()->add_suggestions() = suggestion("secret-s");
-  helper.process(mutableCodableMessage(payload));
-  EXPECT_EQ(payload.sessionmissingsuggestions().suggestions(0).identifier(), "1");
-  corevireon::CVFeedbackPayload header;
-  *header.mutable_visiblesectionheader()->mutable_section()->mutable_results()->add_items() = titled(9);
-  helper.process(mutableCodableMessage(header));
-  EXPECT_EQ(header.visiblesectionheader().section().results().items(0).title(), "secret title");
-  EXPECT_EQ(header.visiblesectionheader().section().results().items(0).identifier(), "2");
-}
-
-// Replacement numbers are handed out per key (identifier + decimal type).
-class IdentifierReplacement : public ::testing::Test {
- protected:
-  SessionProcessingHelper helper;
-};
-
-TEST_F(IdentifierReplacement, SameIdentifierInTwoMessagesMapsOnce) {
-  auto shown = visibleResults(1, {result("alpha", 3), result("beta", 3)});
-  corevireon::CVResultEngagementFeedback engaged;
-  *engaged.mutable_result() = result("alpha", 3);
-
-  helper.process(shown.mutable_visibleresults());
-  helper.process(&engaged);
-
-  EXPECT_EQ(identifiersOf(shown.visibleresults().results()), (std::vector<std::string>{"1", "2"}));
-  EXPECT_EQ(engaged.result().identifier(), "1");
-  EXPECT_EQ(helper.nextMappedId(), 3);
-}
-
-TEST_F(IdentifierReplacement, SameIdentifierUnderAnotherTypeMapsAnew) {
-  EXPECT_EQ(helper.replacementForIdentifier("alpha", 3), "1");
-  EXPECT_EQ(helper.replacementForIdentifier("alpha", 4), "2");
-  EXPECT_EQ(helper.replacementForIdentifier("alpha", 3), "1");
-  EXPECT_EQ(helper.allIdSet(), (std::set<std::string>{"1", "2"}));
-}
-
-TEST_F(IdentifierReplacement, KeysHaveNoSeparatorSoAb17AndAb1With7Collide) {
-  EXPECT_EQ(helper.replacementForIdentifier("ab", 17), "1");
-  EXPECT_EQ(helper.replacementForIdentifier("ab1", 7), "1");
-  EXPECT_EQ(helper.replacementForIdentifier("ab", 7), "2");
-}
-
-TEST_F(IdentifierReplacement, EmptyOrAbsentIdentifierBecomesAbsentAndUsesNoNumber) {
   EXPECT_EQ(helper.replacementForIdentifier(std::nullopt, 1), std::nullopt);
   EXPECT_EQ(helper.replacementForIdentifier("", 1), std::nullopt);
-  auto shown = visibleResults(1, {result("", 2), result("x", 2)});
-  helper.process(shown.mutable_visibleresults());
-  EXPECT_FALSE(shown.visibleresults().results(0).has_identifier());
-  EXPECT_EQ(shown.visibleresults().results(1).identifier(), "1");
+  for (int i = 0; i < 9; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
+  // Keys are identifier + decimal type with no separator, so ab+17 and ab1+7 share a number.
+  std::vector<CVFeedbackPayload> payloads = {
+      pb(R"(visibleResults { results { identifier: "alpha" type: 3 } results { identifier: "alpha" type: 4 }
+           results { identifier: "alpha" type: 3 } results { identifier: "ab" type: 17 } results { identifier: "ab1" type: 7 }
+           results { identifier: "ab" type: 7 } results { identifier: "" } results { } results { identifier: "id1" } })"),
+      pb(R"(resultEngagement { result { identifier: "ab" type: 7 } })")};
+  processAll(helper, payloads);
+  EXPECT_EQ(idsOf(payloads[0].visibleresults().results()), "10 11 10 12 12 13 - - 2");
+  EXPECT_EQ(payloads[1].resultengagement().result().identifier(), "13");
+  EXPECT_EQ(helper.nextMappedId(), 14);
 }
 
-TEST_F(IdentifierReplacement, NumberingRestartsForEverySession) {
-  EXPECT_EQ(helper.replacementForIdentifier("x", 1), "1");
-  SessionProcessingHelper next;
-  EXPECT_EQ(next.replacementForIdentifier("y", 1), "1");
-}
-
-TEST_F(IdentifierReplacement, NumbersFollowFirstAppearanceBeyondNine) {
-  for (int i = 0; i < 12; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
-  auto shown = visibleResults(1, {result("id11", 0), result("id1", 0), result("new", 0)});
-  helper.process(shown.mutable_visibleresults());
-  EXPECT_EQ(identifiersOf(shown.visibleresults().results()), (std::vector<std::string>{"12", "2", "13"}));
-}
-
-// Referenced items that are never delivered in full become missing.
-class ReferencedAndExpanded : public ::testing::Test {
- protected:
-  SessionProcessingHelper helper;
-};
-
-TEST_F(ReferencedAndExpanded, ShownButNeverDeliveredIsMissingOnceWithItsReplacement) {
-  auto first = visibleResults(1, {result("r", 5)});
-  auto again = visibleResults(1, {result("r", 5)});
-  helper.process(first.mutable_visibleresults());
-  helper.process(again.mutable_visibleresults());
-  auto missing = helper.missingResults();
-  ASSERT_TRUE(missing);
-  ASSERT_EQ(missing->size(), 1u);
-  EXPECT_EQ((*missing)[0].identifier(), "1");
-  EXPECT_EQ((*missing)[0].type(), 5);
-}
-
-TEST_F(ReferencedAndExpanded, ReferencedThenExpandedIsNotMissing) {
-  auto shown = visibleResults(1, {result("r", 5)});
-  corevireon::CVResultsReceivedAfterTimeoutFeedback delivered;
-  *delivered.add_results() = result("r", 5);
-  helper.process(shown.mutable_visibleresults());
-  helper.process(&delivered);
-  EXPECT_TRUE(helper.missingResults()->empty());
-  EXPECT_EQ(helper.expandedIdSet(), std::set<std::string>{"1"});
-}
-
-TEST_F(ReferencedAndExpanded, ReferencedAfterExpansionIsNeverRecorded) {
-  corevireon::CVResultRankingFeedback ranking;
-  *ranking.mutable_result() = result("r", 5);
-  helper.process(&ranking);
-  auto shown = visibleResults(1, {result("r", 5)});
-  helper.process(shown.mutable_visibleresults());
-  EXPECT_TRUE(helper.missingResults()->empty());
-}
-
-TEST_F(ReferencedAndExpanded, SuggestionEngagedButNeverShownIsAMissingSuggestion) {
-  corevireon::CVVisibleSuggestionsFeedback shown;
-  *shown.add_suggestions() = suggestion("s1");
-  corevireon::CVSuggestionEngagementFeedback engagedShown;
-  *engagedShown.mutable_suggestion() = suggestion("s1");
-  corevireon::CVSuggestionEngagementFeedback engagedUnknown;
-  *engagedUnknown.mutable_suggestion() = suggestion("s2");
-  helper.process(&shown);
-  helper.process(&engagedShown);
-  helper.process(&engagedUnknown);
-  auto missing = helper.missingSuggestions();
-  ASSERT_EQ(missing->size(), 1u);
-  EXPECT_EQ((*missing)[0].identifier(), "2");
-  EXPECT_TRUE(helper.missingResults()->empty());
-}
-
-TEST_F(ReferencedAndExpanded, FirstReferenceIsKept) {
-  // Type 9 keeps its title, so the copy kept tells the two references apart.
-  auto r1 = result("r", 9);
-  r1.set_title("first");
-  auto r2 = result("r", 9);
-  r2.set_title("second");
-  corevireon::CVResultGradingFeedback graded;
-  *graded.mutable_result() = r1;
-  corevireon::CVResultEngagementFeedback engaged;
-  *engaged.mutable_result() = r2;
-  helper.process(&graded);
-  helper.process(&engaged);
-  ASSERT_EQ(helper.missingResults()->size(), 1u);
-  EXPECT_EQ(helper.missingResults()->front().title(), "first");
-}
-
-TEST_F(ReferencedAndExpanded, MissingResultsComeInOrderOfTheirNumbers) {
-  std::initializer_list<CVSearchResultForFeedback> many = {
-      result("a"), result("b"), result("c"), result("d"), result("e"), result("f"),
-      result("g"), result("h"), result("i"), result("j"), result("k")};
-  auto shown = visibleResults(1, many);
-  helper.process(shown.mutable_visibleresults());
-  std::vector<std::string> ids;
-  const auto missing = helper.missingResults();
-  for (const auto& r : *missing) ids.push_back(r.identifier());
-  EXPECT_EQ(ids, (std::vector<std::string>{"1", "2", "3", "4", "5", "6", "7", "8", "9", "10", "11"}));
-}
-
-// Rankings are taken apart section by section.
-class RankingProcessing : public ::testing::Test {
- protected:
-  static corevireon::CVSectionRankingFeedback sectionRanking(const std::string& ranked, const std::string& inSection,
-                                                             bool withResultRanking) {
-    corevireon::CVSectionRankingFeedback sr;
-    if (withResultRanking) *sr.add_results()->mutable_result() = result(ranked);
-    *sr.mutable_section()->mutable_results()->add_items() = result(inSection);
-    return sr;
+// Guards against: an item referenced but never delivered not reported missing (or reported twice or out of order).
+TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
+  const std::string shown = R"(visibleResults { results { identifier: "r" type: 5 } })";
+  struct Row { const char* name; std::vector<std::string> in; std::string missingResults, missingSuggestions; };
+  const Row rows[] = {
+      {"shown twice, never delivered: missing once", {shown, shown}, R"(identifier: "1" type: 5)", ""},
+      {"shown, then delivered", {shown, R"(resultsReceivedAfterTimeout { results { identifier: "r" type: 5 } })"}, "", ""},
+      {"delivered, then shown", {R"(resultRanking { result { identifier: "r" type: 5 } })", shown}, "", ""},
+      {"suggestion engaged, never shown",
+       {R"(visibleSuggestions { suggestions { identifier: "s1" } })", R"(suggestionEngagement { suggestion { identifier: "s1" } })",
+        R"(suggestionEngagement { suggestion { identifier: "s2" } })"},
+       "", R"(identifier: "2")"},
+      {"the first reference is kept (type 9 keeps titles)",
+       {R"(resultGrading { result { identifier: "r" type: 9 title: "first" } })",
+        R"(resultEngagement { result { identifier: "r" type: 9 title: "second" } })"},
+       R"(identifier: "1" type: 9 title: "first")", ""},
+      {"in the order of their numbers",
+       {R"(visibleResults { results { identifier: "a" } results { identifier: "b" } results { identifier: "c" }
+           results { identifier: "d" } results { identifier: "e" } results { identifier: "f" } results { identifier: "g" }
+           results { identifier: "h" } results { identifier: "i" } results { identifier: "j" } results { identifier: "k" } })"},
+       R"(identifier: "1" | identifier: "2" | identifier: "3" | identifier: "4" | identifier: "5" | identifier: "6" | )"
+       R"(identifier: "7" | identifier: "8" | identifier: "9" | identifier: "10" | identifier: "11")", ""},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    std::vector<CVFeedbackPayload> payloads;
+    for (const auto& text : row.in) payloads.push_back(pb(text));
+    SessionProcessingHelper helper;
+    processAll(helper, payloads);
+    ASSERT_TRUE(helper.missingResults() && helper.missingSuggestions());
+    EXPECT_EQ(join(*helper.missingResults()), row.missingResults);
+    EXPECT_EQ(join(*helper.missingSuggestions()), row.missingSuggestions);
   }
-  SessionProcessingHelper helper;
-};
-
-TEST_F(RankingProcessing, ThreeSectionRankingsAreProcessedInOrderResultRankingsFirst) {
-  corevireon::CVRankingFeedback ranking;
-  *ranking.add_sections() = sectionRanking("a-ranked", "a-section", true);
-  *ranking.add_sections() = sectionRanking("b-ranked", "b-section", true);
-  *ranking.add_sections() = sectionRanking("c-ranked", "c-section", false);
-  helper.process(&ranking);
-
-  // The numbers handed out show the order in which the items were seen.
-  EXPECT_EQ(ranking.sections(0).results(0).result().identifier(), "1");
-  EXPECT_EQ(ranking.sections(1).results(0).result().identifier(), "3");
-  EXPECT_EQ(ranking.sections(2).section().results().items(0).identifier(), "5");
-  auto probe = visibleResults(1, {result("a-section"), result("b-section")});
-  helper.process(probe.mutable_visibleresults());
-  EXPECT_EQ(identifiersOf(probe.visibleresults().results()), (std::vector<std::string>{"2", "4"}));
-  // Everything in a ranking counts as delivered.
-  EXPECT_TRUE(helper.missingResults()->empty());
 }
 
-TEST_F(RankingProcessing, SectionResultsAreClearedOnlyWhenResultRankingsArePresent) {
-  auto with = sectionRanking("r", "s", true);
-  auto without = sectionRanking("", "t", false);
-  helper.process(&with);
-  helper.process(&without);
-  EXPECT_TRUE(with.has_section());
-  EXPECT_FALSE(with.section().has_results());
-  ASSERT_TRUE(without.section().has_results());
-  EXPECT_EQ(without.section().results().items(0).identifier(), "3");
-}
-
-TEST_F(RankingProcessing, ResultRankingExpandsDuplicatesHiddenAndResultInThatOrder) {
-  corevireon::CVResultRankingFeedback rr;
-  *rr.mutable_result() = result("main");
-  *rr.add_duplicateresults() = result("dup");
-  *rr.add_hiddenresults() = result("hidden");
-  helper.process(&rr);
-  EXPECT_EQ(rr.duplicateresults(0).identifier(), "1");
-  EXPECT_EQ(rr.hiddenresults(0).identifier(), "2");
-  EXPECT_EQ(rr.result().identifier(), "3");
-  EXPECT_EQ(helper.expandedIdSet(), (std::set<std::string>{"1", "2", "3"}));
-}
-
-TEST_F(RankingProcessing, LateSectionsAreExpanded) {
-  corevireon::CVLateSectionsAppendedFeedback late;
-  *late.add_sections()->mutable_results()->add_items() = result("x");
-  *late.add_sections()->mutable_results()->add_items() = result("y");
-  helper.process(&late);
-  EXPECT_EQ(late.sections(1).results().items(0).identifier(), "2");
-  EXPECT_EQ(helper.expandedIdSet().size(), 2u);
-}
-
-// The privacy rewrites made while gathering.
-class EngagementRewrites : public ::testing::TestWithParam<int32_t> {};
-
-TEST_P(EngagementRewrites, TitleKeptOnlyForTheEightListedTypes) {
-  const int32_t type = GetParam();
-  const bool kept = type == 9 || type == 10 || type == 11 || type == 12 || type == 13 || type == 14 ||
-                    type == 18 || type == 19;
-  corevireon::CVResultEngagementFeedback engaged;
-  *engaged.mutable_result() = result("r", type);
-  engaged.set_titletext("what the user saw");
-  engaged.set_matchesunengagedsuggestion(true);
-  SessionProcessingHelper helper;
-  helper.process(&engaged);
-  EXPECT_EQ(engaged.has_titletext(), kept) << "type " << type;
-  EXPECT_EQ(engaged.matchesunengagedsuggestion(), kept) << "type " << type;
-}
-
-INSTANTIATE_TEST_SUITE_P(ResultTypes, EngagementRewrites, ::testing::Range(0, 22));
-
-TEST(EngagementWithoutResult, LosesItsTitle) {
-  corevireon::CVResultEngagementFeedback engaged;
-  engaged.set_titletext("title");
-  SessionProcessingHelper helper;
-  helper.process(&engaged);
-  EXPECT_FALSE(engaged.has_titletext());
-}
-
-class SectionEngagementRewrites : public ::testing::Test {
- protected:
-  corevireon::CVSectionEngagementFeedback engagement(corevireon::CVTriggerEngagementEvent trigger) {
-    corevireon::CVSectionEngagementFeedback se;
-    se.set_triggerevent(trigger);
-    se.mutable_section()->set_bundleidentifier("vireon.apps");
-    *se.mutable_section()->mutable_results()->add_items() = result("r");
-    return se;
+// Guards against: a rewrite made to the wrong items or in the wrong order (rankings, sections, app codes).
+TEST(Rewrites, EachKindRewrittenInPlace) {
+  // Payloads and missing results as text; identifiers mapped/titles cleared.
+  struct Row { const char* name; std::vector<std::string> in; std::string out, missing, counts; };
+  const Row rows[] = {
+      {"ranking",
+       {R"(ranking { sections { results { result { identifier: "a1" } } section { results { items { identifier: "a2" } } } }
+           sections { results { result { identifier: "b1" } } section { results { items { identifier: "b2" } } } }
+           sections { section { results { items { identifier: "c2" } } } } })",
+        R"(visibleResults { results { identifier: "a2" } results { identifier: "b2" } })"},
+       R"(ranking { sections { results { result { identifier: "1" } } section { } } )"
+       R"(sections { results { result { identifier: "3" } } section { } } )"
+       R"(sections { section { results { items { identifier: "5" } } } } } | )"
+       R"(visibleResults { results { identifier: "2" } results { identifier: "4" } })",
+       "", "7/0"},
+      {"result ranking and late sections",
+       {R"(resultRanking { result { identifier: "m" } duplicateResults { identifier: "d" } hiddenResults { identifier: "h" } })",
+        R"(lateSectionsAppended { sections { results { items { identifier: "x" } } } sections { results { items { identifier: "y" } } } })"},
+       R"(resultRanking { result { identifier: "3" } duplicateResults { identifier: "1" } hiddenResults { identifier: "2" } } | )"
+       R"(lateSectionsAppended { sections { results { items { identifier: "4" } } } sections { results { items { identifier: "5" } } } })",
+       "", "5/0"},
+      {"items anywhere: mapped and stripped, never missing",
+       {R"(visibleSectionHeader { section { results { items { identifier: "a" type: 2 title: "t" } } } })",
+        R"(sessionMissingResults { results { identifier: "b" type: 5 title: "t" } })",
+        R"(sessionMissingSuggestions { suggestions { identifier: "c" } })",
+        R"(visibleSectionHeader { section { results { items { identifier: "d" type: 9 title: "t" } } } })"},
+       R"(visibleSectionHeader { section { results { items { identifier: "1" type: 2 } } } } | )"
+       R"(sessionMissingResults { results { identifier: "2" type: 5 } } | )"
+       R"(sessionMissingSuggestions { suggestions { identifier: "3" } } | )"
+       R"(visibleSectionHeader { section { results { items { identifier: "4" type: 9 title: "t" } } } })",
+       "", "4/2"},
+      {"tapped section loses its results, still referenced",
+       {R"(sectionEngagement { section { bundleIdentifier: "apps" results { items { identifier: "r" } } } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_TAP })"},
+       R"(sectionEngagement { section { bundleIdentifier: "apps" } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_TAP })",
+       R"(identifier: "1")", "1/0"},
+      {"expanded section keeps its results, still referenced",
+       {R"(sectionEngagement { section { results { items { identifier: "r" } } } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND })"},
+       R"(sectionEngagement { section { results { items { identifier: "1" } } } triggerEvent: CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND })",
+       R"(identifier: "1")", "1/0"},
+      {"local application codes",
+       {R"(visibleResults { results { identifier: "a" type: 3 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 }
+           results { identifier: "b" type: 20 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 }
+           results { identifier: "c" type: 3 knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 } })"},
+       R"(visibleResults { results { identifier: "1" type: 3 isLocalApplicationResult: true knownApplicationBundleIdentifier: 2 knownResultBundleId: 2 } )"
+       R"(results { identifier: "2" type: 20 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 } )"
+       R"(results { identifier: "3" type: 3 knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 } })",
+       R"(identifier: "1" type: 3 isLocalApplicationResult: true knownApplicationBundleIdentifier: 2 knownResultBundleId: 2 | )"
+       R"(identifier: "2" type: 20 isLocalApplicationResult: true knownApplicationBundleIdentifier: 77 knownResultBundleId: 78 | )"
+       R"(identifier: "3" type: 3 knownApplicationBundleIdentifier: 77 knownResultBundleId: 78)",
+       "3/0"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    std::vector<CVFeedbackPayload> payloads;
+    for (const auto& text : row.in) payloads.push_back(pb(text));
+    SessionProcessingHelper helper;
+    processAll(helper, payloads);
+    EXPECT_EQ(join(payloads), row.out);
+    EXPECT_EQ(join(*helper.missingResults()), row.missing);
+    EXPECT_EQ(std::to_string(helper.identifiersMapped()) + "/" + std::to_string(helper.titlesCleared()), row.counts);
   }
-  SessionProcessingHelper helper;
-};
-
-TEST_F(SectionEngagementRewrites, ResultsRemovedUnlessExpandedButStillReferenced) {
-  auto tapped = engagement(corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_TAP);
-  helper.process(&tapped);
-  EXPECT_FALSE(tapped.section().has_results());
-  EXPECT_EQ(tapped.section().bundleidentifier(), "vireon.apps");
-  ASSERT_EQ(helper.missingResults()->size(), 1u);
-  EXPECT_EQ(helper.missingResults()->front().identifier(), "1");
 }
 
-TEST_F(SectionEngagementRewrites, ExpandTriggerKeepsTheResults) {
-  auto expanded = engagement(corevireon::CV_TRIGGER_ENGAGEMENT_EVENT_EXPAND);
-  helper.process(&expanded);
-  ASSERT_TRUE(expanded.section().has_results());
-  EXPECT_EQ(expanded.section().results().items(0).identifier(), "1");
-}
-
-class LocalApplicationCodes : public ::testing::Test {
- protected:
-  static CVSearchResultForFeedback app(int32_t type) {
-    auto r = result("app", type);
-    r.set_islocalapplicationresult(true);
-    r.set_knownapplicationbundleidentifier(77);
-    r.set_knownresultbundleid(78);
-    return r;
+// Guards against: a title or an unengaged-suggestion flag leaving for a result type that must not keep it.
+TEST(EngagementRewrites, TitleKeptOnlyForTheEightListedTypes) {
+  const std::set<int32_t> keeping = {9, 10, 11, 12, 13, 14, 18, 19};
+  for (int32_t type = 0; type < 22; ++type) {
+    auto engaged = pb<corevireon::CVResultEngagementFeedback>("titleText: \"t\" matchesUnengagedSuggestion: true result { type: " +
+                                                              std::to_string(type) + " }");
+    SessionProcessingHelper().process(&engaged);
+    EXPECT_EQ(engaged.has_titletext(), keeping.count(type) == 1) << "type " << type;
+    EXPECT_EQ(engaged.matchesunengagedsuggestion(), keeping.count(type) == 1) << "type " << type;
   }
-  SessionProcessingHelper helper;
-};
-
-TEST_F(LocalApplicationCodes, SetToTwoUnlessType20AndCarriedIntoTheMissingList) {
-  auto shown = visibleResults(1, {app(3), app(20)});
-  auto notLocal = result("web", 3);
-  notLocal.set_knownresultbundleid(5);
-  *shown.mutable_visibleresults()->add_results() = notLocal;
-  helper.process(shown.mutable_visibleresults());
-  const auto& rs = shown.visibleresults().results();
-  EXPECT_EQ(rs[0].knownapplicationbundleidentifier(), 2);
-  EXPECT_EQ(rs[0].knownresultbundleid(), 2);
-  EXPECT_EQ(rs[1].knownapplicationbundleidentifier(), 77);
-  EXPECT_EQ(rs[1].knownresultbundleid(), 78);
-  EXPECT_EQ(rs[2].knownresultbundleid(), 5);
-  ASSERT_EQ(helper.missingResults()->size(), 3u);
-  EXPECT_EQ(helper.missingResults()->front().knownresultbundleid(), 2);
+  auto withoutResult = pb<corevireon::CVResultEngagementFeedback>(R"(titleText: "t")");
+  SessionProcessingHelper().process(&withoutResult);
+  EXPECT_FALSE(withoutResult.has_titletext());
 }
 
+// Guards against: query texts or punch-outs leaving for a result type other than 1, or redaction touching the title.
 TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
-  auto r = webResult("x", "https://example.com/");
-  r.set_userinput("typed");
-  r.set_completedquery("completed");
-  r.set_intendedquery("intended");
-  r.set_title("kept");
-  auto typeOne = r;
-  r.set_type(2);
-  redact(r);
+  const std::string fields = R"(title: "t" userInput: "u" completedQuery: "c" intendedQuery: "i" punchout { name: "p" })";
+  auto other = pb<CVSearchResultForFeedback>("type: 2 " + fields), typeOne = pb<CVSearchResultForFeedback>("type: 1 " + fields);
+  redact(other);
   redact(typeOne);
-  EXPECT_FALSE(r.has_userinput() || r.has_completedquery() || r.has_intendedquery() || r.has_punchout());
-  EXPECT_EQ(r.title(), "kept");
-  EXPECT_TRUE(typeOne.has_userinput() && typeOne.has_punchout());
+  EXPECT_EQ(other.ShortDebugString(), R"(type: 2 title: "t")");
+  EXPECT_EQ(typeOne.ShortDebugString(), pb<CVSearchResultForFeedback>("type: 1 " + fields).ShortDebugString());
 }
 
+// Guards against: the results a feedback contains being gathered from the wrong fields or in the wrong order.
 TEST(ContainedResults, FollowTheKindsOfFeedback) {
-  corevireon::CVRankingFeedback ranking;
-  auto* sr = ranking.add_sections();
-  *sr->add_results()->mutable_result() = result("ranked-only");
-  *sr->mutable_section()->mutable_results()->add_items() = result("s1");
-  *ranking.add_sections()->mutable_section()->mutable_results()->add_items() = result("s2");
-  std::vector<std::string> ids;
-  for (const auto* r : containedResults(ranking)) ids.push_back(r->identifier());
-  EXPECT_EQ(ids, (std::vector<std::string>{"s1", "s2"}));
-
-  corevireon::CVResultRankingFeedback rr;
-  *rr.mutable_result() = result("main");
-  *rr.add_hiddenresults() = result("hidden");
-  *rr.add_duplicateresults() = result("dup");
-  ids.clear();
-  for (const auto* r : containedResults(rr)) ids.push_back(r->identifier());
-  EXPECT_EQ(ids, (std::vector<std::string>{"dup", "hidden", "main"}));
-
-  corevireon::CVClearInputFeedback other;
-  EXPECT_TRUE(containedResults(other).empty());
+  auto ids = [](const auto& feedback) {
+    std::string out;
+    for (const auto* r : containedResults(feedback)) out += r->identifier() + " ";
+    return out;
+  };
+  EXPECT_EQ(ids(pb<corevireon::CVRankingFeedback>(R"(sections { results { result { identifier: "ranked" } }
+      section { results { items { identifier: "s1" } } } } sections { section { results { items { identifier: "s2" } } } })")),
+            "s1 s2 ");
+  EXPECT_EQ(ids(pb<corevireon::CVResultRankingFeedback>(
+                R"(result { identifier: "main" } hiddenResults { identifier: "hidden" } duplicateResults { identifier: "dup" })")),
+            "dup hidden main ");
+  EXPECT_EQ(ids(corevireon::CVClearInputFeedback()), "");
 }
 
 }  // namespace
