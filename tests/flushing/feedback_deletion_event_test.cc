@@ -1,10 +1,7 @@
 #include "assembly/feedback_deletion_event.h"
 #include "assembly/fbf_assembly.h"
-#include "flushing/flushing_test_util.h"
+#include "flushing/cache_fixture.h"
 #include "platform/analytics.h"
-#include "support/test_support.h"
-
-#include <gtest/gtest.h>
 
 #include <fstream>
 
@@ -13,61 +10,33 @@ using namespace std::chrono_literals;
 namespace fbf::testing {
 namespace {
 
-// Files that the flusher is about to drop, and the loss record of each.
-class FeedbackLossRecord : public ::testing::Test {
- protected:
-  std::optional<FeedbackDeletionEvent> eventFor(size_t bytes, int32_t type = 2) {
-    auto file = makeFile(env.cacheDir(), "f" + std::to_string(bytes), std::string(bytes, 'b'));
-    return FeedbackDeletionEvent::make(file, type, FeedbackDeletionReason::tooLarge,
-                                       creationDate(*env.fileManager, file) + 5s, *env.fileManager);
+// Guards against: a loss record with the wrong size or age, or one sent for an
+// unknown type or a file that is already gone.
+using FeedbackLossRecord = CacheTest;
+
+TEST_F(FeedbackLossRecord, SizeInKibibytesRoundedUpAndAgeTruncatedTowardZero) {
+  struct Row {
+    size_t bytes;
+    std::chrono::milliseconds after;
+    int32_t type;
+    std::optional<int64_t> size, age;
+  };
+  const Row rows[] = {{0, 5s, 2, 0, 5},           {1, 5s, 2, 1, 5},           {1024, 5s, 2, 1, 5},
+                      {1025, 90900ms, 11, 2, 90}, {3073, -2500ms, 13, 4, -2}, {1, 0s, 1, 1, 0},
+                      {10, 0s, 0, {}, {}},        {10, 0s, 14, {}, {}}};
+  for (const auto& row : rows) {
+    SCOPED_TRACE(::testing::Message() << row.bytes << " bytes, type " << row.type);
+    auto file = makeFile(cache(), "f", std::string(row.bytes, 'b'));
+    auto event = FeedbackDeletionEvent::make(file, row.type, FeedbackDeletionReason::tooLarge,
+                                             creationDate(fm(), file) + row.after, fm());
+    ASSERT_EQ(event.has_value(), row.size.has_value());
+    if (!event) continue;
+    EXPECT_EQ(event->size, *row.size);
+    EXPECT_EQ(event->age, *row.age);
+    EXPECT_EQ(event->feedbackType, row.type);
+    EXPECT_EQ(event->reason, FeedbackDeletionReason::tooLarge);
   }
-  TestEnvironment env;
-};
-
-TEST_F(FeedbackLossRecord, SizeIsInKibibytesRoundedUp) {
-  EXPECT_EQ(eventFor(0)->size, 0u);
-  EXPECT_EQ(eventFor(1)->size, 1u);
-  EXPECT_EQ(eventFor(1024)->size, 1u);
-  EXPECT_EQ(eventFor(1025)->size, 2u);
-  EXPECT_EQ(eventFor(3 * 1024 + 1)->size, 4u);
-}
-
-TEST_F(FeedbackLossRecord, AgeIsTruncatedTowardZeroEvenWhenNegative) {
-  auto file = makeFile(env.cacheDir(), "f");
-  SystemTime created = creationDate(*env.fileManager, file);
-  auto later = FeedbackDeletionEvent::make(file, 11, 1, created + 90s + 900ms, *env.fileManager);
-  ASSERT_TRUE(later);
-  EXPECT_EQ(later->age, 90);
-  auto earlier = FeedbackDeletionEvent::make(file, 11, 1, created - 2s - 500ms, *env.fileManager);
-  ASSERT_TRUE(earlier);
-  EXPECT_EQ(earlier->age, -2);
-  EXPECT_EQ(earlier->feedbackType, 11);
-  EXPECT_EQ(earlier->reason, 1);
-}
-
-TEST_F(FeedbackLossRecord, UnknownTypeAndEndMarkerAreNeverReported) {
-  for (int32_t reason : {1, 2, 3, 5, 12}) {
-    EXPECT_FALSE(eventFor(10, 0).has_value()) << reason;
-    EXPECT_FALSE(eventFor(10, 14).has_value()) << reason;
-  }
-  EXPECT_TRUE(eventFor(10, 1));
-  EXPECT_TRUE(eventFor(10, 13));
-}
-
-TEST_F(FeedbackLossRecord, AFileThatIsAlreadyGoneGivesNoRecord) {
-  EXPECT_FALSE(FeedbackDeletionEvent::make(env.cacheDir() / "missing", 2, 1, env.clock->now(),
-                                           *env.fileManager));
-}
-
-TEST_F(FeedbackLossRecord, EncodesExactlyItsFourKeys) {
-  FeedbackDeletionEvent e{13, 12, 7, -3};
-  auto json = e.toJSON();
-  ASSERT_TRUE(json.is_object());
-  EXPECT_EQ(json.size(), 4u);
-  EXPECT_EQ(json.at("feedbackType"), 13);
-  EXPECT_EQ(json.at("reason"), 12);
-  EXPECT_EQ(json.at("size"), 7);
-  EXPECT_EQ(json.at("age"), -3);
+  EXPECT_FALSE(FeedbackDeletionEvent::make(cache() / "missing", 2, 1, env.clock->now(), fm()));
 }
 
 // Holds each payload function and hands it to the real sink only when told,
@@ -83,79 +52,42 @@ class DeferringSink final : public AnalyticsSink {
     for (auto& [name, payload] : held_) inner_->sendEvent(name, payload);
     held_.clear();
   }
-  size_t held() const { return held_.size(); }
 
  private:
   std::unique_ptr<AnalyticsSink> inner_;
   std::vector<std::pair<std::string, std::function<std::optional<nlohmann::json>()>>> held_;
 };
 
-class NoDevice final : public DeviceContextProtocol {
- public:
-  std::optional<std::string> localeIdentifier() const override { return std::nullopt; }
-  std::optional<std::string> country() const override { return std::nullopt; }
-  std::optional<std::string> deviceModel() const override { return std::nullopt; }
-  std::optional<std::string> osVersion() const override { return std::nullopt; }
-  std::string userAgent() const override { return "test"; }
-};
+// Guards against: a loss reported with a payload that is not the event's own,
+// computed before the sink asks for it, or written to the analytics file out of order.
+TEST_F(CacheTest, LossesReachTheAnalyticsFileOneLineEachInOrderWhenTheSinkAsks) {
+  auto sink = std::make_shared<DeferringSink>(
+      makeJsonLinesAnalyticsSink(env.dirs.analyticsFile(), fm(), *env.clock));
+  FBFAssemblyDependencies deps;
+  deps.preferences = env.preferences;
+  deps.fileManager = env.fileManager;
+  deps.clock = env.clock;
+  deps.analytics = sink;
+  deps.transactions = env.transactions;
+  deps.deviceContext = std::shared_ptr<DeviceContextProtocol>(
+      const_cast<DeviceContextProtocol*>(&env.assembly().deviceContext()), [](auto*) {});
+  deps.workloop = env.manualQueue;
+  FBFAssembly assembly(std::move(deps));
 
-// The composition root reporting losses into the analytics file.
-class FeedbackLossAnalytics : public ::testing::Test {
- protected:
-  FeedbackLossAnalytics() {
-    auto fileSink =
-        makeJsonLinesAnalyticsSink(env.dirs.analyticsFile(), *env.fileManager, *env.clock);
-    sink = std::make_shared<DeferringSink>(std::move(fileSink));
-    FBFAssemblyDependencies deps;
-    deps.preferences = env.preferences;
-    deps.fileManager = env.fileManager;
-    deps.clock = env.clock;
-    deps.analytics = sink;
-    deps.transactions = env.transactions;
-    deps.deviceContext = std::make_shared<NoDevice>();
-    deps.workloop = env.manualQueue;
-    assembly = std::make_unique<FBFAssembly>(std::move(deps));
-  }
-  std::vector<nlohmann::json> lines() {
-    std::vector<nlohmann::json> out;
-    std::ifstream in(env.dirs.analyticsFile());
-    for (std::string line; std::getline(in, line);) out.push_back(nlohmann::json::parse(line));
-    return out;
-  }
-
-  TestEnvironment env;
-  std::shared_ptr<DeferringSink> sink;
-  std::unique_ptr<FBFAssembly> assembly;
-};
-
-TEST_F(FeedbackLossAnalytics, NothingIsWrittenUntilTheSinkAsksForThePayload) {
-  assembly->didDeleteFeedbackFile(FeedbackDeletionEvent{2, 5, 3, 600});
-  EXPECT_EQ(sink->held(), 1u);
+  assembly.didDeleteFeedbackFile(FeedbackDeletionEvent{11, 1, 2, 8 * 86400});
+  assembly.didDeleteFeedbackFile(FeedbackDeletionEvent{13, 12, 0, -3});
   EXPECT_FALSE(fs::exists(env.dirs.analyticsFile()));
-
   sink->release();
-  auto written = lines();
-  ASSERT_EQ(written.size(), 1u);
-  EXPECT_EQ(written[0].at("event"), "vireond.feedbackLoss");
-  EXPECT_EQ(written[0].at("payload"),
-            (nlohmann::json{{"feedbackType", 2}, {"reason", 5}, {"size", 3}, {"age", 600}}));
-}
 
-TEST_F(FeedbackLossAnalytics, OneLinePerEventInOrder) {
-  auto file = makeFile(env.cacheDir(), "dropped", std::string(1025, 'x'));
-  auto event = FeedbackDeletionEvent::make(file, 11, FeedbackDeletionReason::tooOld,
-                                           creationDate(*env.fileManager, file) + 8 * 86400s,
-                                           *env.fileManager);
-  ASSERT_TRUE(event);
-  assembly->didDeleteFeedbackFile(*event);
-  assembly->didDeleteFeedbackFile(FeedbackDeletionEvent{13, 12, 0, 0});
-  sink->release();
-  auto written = lines();
-  ASSERT_EQ(written.size(), 2u);
-  EXPECT_EQ(written[0].at("payload"),
+  std::ifstream in(env.dirs.analyticsFile());
+  std::vector<nlohmann::json> lines;
+  for (std::string line; std::getline(in, line);) lines.push_back(nlohmann::json::parse(line));
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_EQ(lines[0].at("event"), "vireond.feedbackLoss");
+  EXPECT_EQ(lines[0].at("payload"),
             (nlohmann::json{{"feedbackType", 11}, {"reason", 1}, {"size", 2}, {"age", 8 * 86400}}));
-  EXPECT_EQ(written[1].at("payload").at("feedbackType"), 13);
-  EXPECT_EQ(written[1].at("payload").size(), 4u);
+  EXPECT_EQ(lines[1].at("payload"),
+            (nlohmann::json{{"feedbackType", 13}, {"reason", 12}, {"size", 0}, {"age", -3}}));
 }
 
 }  // namespace

@@ -1,138 +1,120 @@
-#include "flushing/feedback_enumerator.h"
-#include "flushing/flushing_test_util.h"
-#include "support/test_support.h"
+#include "flushing/cache_fixture.h"
 
-#include <gtest/gtest.h>
-
-#include <map>
 #include <set>
 
 namespace fbf::testing {
 namespace {
 
+// Guards against: a file sent under the wrong type, or a session file inside a
+// custom directory taken for custom feedback.
 TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown) {
-  FeedbackFile session("/c/vireond/" + sessionName(SessionFileState::closed, 1));
-  EXPECT_EQ(session.fileType, FeedbackFileType::session);
-  ASSERT_TRUE(session.sessionFilename);
-  EXPECT_EQ(session.sessionFilename->state, SessionFileState::closed);
-  EXPECT_EQ(session.typeString(), "FeedbackV2");
-  EXPECT_EQ(session.knownFeedbackType(), 12);
-  EXPECT_FALSE(session.uploadPending());
-  EXPECT_EQ(session.enclosingDirectory(), "vireond");
-
-  FeedbackFile pending("/c/vireond/" + sessionName(SessionFileState::processing, 1) +
-                       ".pb.uploadPending");
-  EXPECT_EQ(pending.typeString(), "FeedbackV2PB");
-  EXPECT_EQ(pending.knownFeedbackType(), 13);
-  EXPECT_TRUE(pending.uploadPending());
-
-  FeedbackFile custom("/c/vireond/CustomFeedback/UserReport/report-1");
-  EXPECT_EQ(custom.fileType, FeedbackFileType::custom);
-  EXPECT_FALSE(custom.sessionFilename);
-  EXPECT_EQ(custom.typeString(), "UserReport");
-  EXPECT_EQ(custom.knownFeedbackType(), 10);
-  EXPECT_EQ(custom.fileName(), "report-1");
-
-  FeedbackFile sessionInCustom("/c/vireond/CustomFeedback/Usage/" +
-                               sessionName(SessionFileState::closed, 2));
-  EXPECT_EQ(sessionInCustom.fileType, FeedbackFileType::session);
-
-  FeedbackFile unknown("/c/vireond/notes.txt");
-  EXPECT_EQ(unknown.fileType, FeedbackFileType::unknown);
-  EXPECT_EQ(unknown.typeString(), "");
-  EXPECT_EQ(unknown.knownFeedbackType(), 0);
-
-  EXPECT_EQ(FeedbackFile("/c/vireond/CustomFeedback/usage/x").fileType, FeedbackFileType::unknown);
+  struct Row {
+    const char* name;
+    std::string path;
+    FeedbackFileType type;
+    std::string typeString;
+    int known;
+    bool pending = false;
+  };
+  const Row rows[] = {
+      {"closed session", "/c/vireond/" + sessionName(S::closed, 1), FeedbackFileType::session,
+       "FeedbackV2", 12},
+      {"protobuf upload", "/c/vireond/" + sessionName(S::processing, 1) + ".pb.uploadPending",
+       FeedbackFileType::session, "FeedbackV2PB", 13, true},
+      {"custom report", "/c/vireond/CustomFeedback/UserReport/report-1", FeedbackFileType::custom,
+       "UserReport", 10},
+      {"custom upload", "/c/vireond/CustomFeedback/Usage/u.uploadPending", FeedbackFileType::custom,
+       "Usage", 11, true},
+      {"session in a custom directory",
+       "/c/vireond/CustomFeedback/Usage/" + sessionName(S::closed, 2), FeedbackFileType::session,
+       "FeedbackV2", 12},
+      {"bystander", "/c/vireond/notes.txt", FeedbackFileType::unknown, "", 0},
+      {"type names are case-sensitive", "/c/vireond/CustomFeedback/usage/x",
+       FeedbackFileType::unknown, "", 0},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    FeedbackFile file(row.path);
+    EXPECT_EQ(file.fileType, row.type);
+    EXPECT_EQ(file.sessionFilename.has_value(), row.type == FeedbackFileType::session);
+    EXPECT_EQ(file.typeString(), row.typeString);
+    EXPECT_EQ(file.knownFeedbackType(), row.known);
+    EXPECT_EQ(file.uploadPending(), row.pending);
+    EXPECT_EQ(file.fileName(), fs::path(row.path).filename());
+  }
+  EXPECT_EQ(FeedbackFile("/c/vireond/x").enclosingDirectory(), "vireond");
 }
 
-// A cache directory holding session files, custom feedback of a few types
-// and the usual bystanders.
-class FeedbackWalk : public ::testing::Test {
+// Guards against: a walk that misses, repeats or invents feedback files, reads
+// bystanders, keeps going after its end, or keeps one directory's files together.
+// The cache holds session files, custom feedback of a few types and the usual
+// bystanders.
+class FeedbackWalk : public CacheTest {
  protected:
-  fs::path custom(std::string_view type) {
-    return env.cacheDir() / "CustomFeedback" / std::string(type);
-  }
+  fs::path custom(std::string_view type) { return cache() / "CustomFeedback" / std::string(type); }
   void populate() {
-    for (unsigned i = 0; i < 20; ++i)
-      sessions.insert(makeFile(env.cacheDir(), sessionName(SessionFileState::closed, i)));
-    sessions.insert(makeFile(env.cacheDir(),
-                             sessionName(SessionFileState::processing, 99) + ".pb.uploadPending"));
+    for (unsigned i = 0; i < 6; ++i) sessions.insert(session(S::closed, i));
+    sessions.insert(session(S::processing, 99, ".pb.uploadPending"));
     for (std::string_view type : {"Usage", "UserReport", "Crowdsourcing"}) {
-      for (unsigned i = 0; i < 5; ++i)
+      for (unsigned i = 0; i < 2; ++i)
         customs.insert(makeFile(custom(type), "record-" + std::to_string(i)));
     }
-    makeFile(env.cacheDir(), "bag.plist");
-    makeFile(env.cacheDir(), "notes.txt");
-    makeFile(env.cacheDir() / "CustomFeedback", "loose-file");
-    makeFile(env.cacheDir() / "CustomFeedback" / "NotAType", "record");
-    makeFile(env.cacheDir() / "Cohorts", "cohorts.sqlite");
+    makeFile(cache(), "bag.plist");
+    makeFile(cache(), "notes.txt");
+    makeFile(cache() / "CustomFeedback", "loose-file");
+    makeFile(custom("NotAType"), "record");
+    makeFile(cache() / "Cohorts", "cohorts.sqlite");
   }
-  std::vector<FeedbackFile> drain(FeedbackEnumerator& e) {
-    std::vector<FeedbackFile> out;
-    while (auto f = e.next()) out.push_back(std::move(*f));
-    return out;
+  std::vector<FeedbackFile> walk(std::vector<std::string> filter = {}, RandomChoice choose = {}) {
+    auto e = choose ? FeedbackEnumerator::make(env.assembly(), filter, choose)
+                    : FeedbackEnumerator::make(env.assembly(), filter);
+    if (!e) ADD_FAILURE() << "no enumerator";
+    return e ? drain(*e) : std::vector<FeedbackFile>{};
   }
-  static std::multiset<fs::path> paths(const std::vector<FeedbackFile>& files) {
-    std::multiset<fs::path> out;
-    for (const auto& f : files) out.insert(f.fileURL);
+  // The types in the order walked, sessions marked 's' and custom files 'c'.
+  static std::string kinds(const std::vector<FeedbackFile>& files) {
+    std::string out;
+    for (const auto& f : files) out += f.fileType == FeedbackFileType::session ? 's' : 'c';
     return out;
   }
 
-  TestEnvironment env;
-  LogCapture logs;
   std::set<fs::path> sessions;
   std::set<fs::path> customs;
 };
 
-TEST_F(FeedbackWalk, YieldsEverySessionAndCustomFileExactlyOnce) {
+TEST_F(FeedbackWalk, YieldsEverySessionAndCustomFileOnceAndSkipsBystanders) {
   populate();
   auto e = FeedbackEnumerator::make(env.assembly());
   ASSERT_TRUE(e);
   auto files = drain(*e);
-  std::multiset<fs::path> expected(sessions.begin(), sessions.end());
+  std::multiset<fs::path> found, expected(sessions.begin(), sessions.end());
   expected.insert(customs.begin(), customs.end());
-  EXPECT_EQ(paths(files), expected);
   for (const auto& f : files) {
+    found.insert(f.fileURL);
     EXPECT_EQ(f.fileType,
               sessions.count(f.fileURL) ? FeedbackFileType::session : FeedbackFileType::custom);
     ASSERT_TRUE(f.attributes);
     EXPECT_EQ(f.attributes->size, 1u);
   }
+  EXPECT_EQ(found, expected);
+  EXPECT_EQ(e->pendingDirectoryCount(), 0u);
+  for (int i = 0; i < 2; ++i) EXPECT_FALSE(e->next());
+
   EXPECT_TRUE(
       logs.contains("Feedback enumerator found " + (custom("Usage") / "record-0").string()));
-}
-
-TEST_F(FeedbackWalk, BystandersAreSkippedWithAMessageAndLeftInPlace) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  drain(*e);
-  EXPECT_TRUE(
-      logs.contains("Feedback enumerator skipped " + (env.cacheDir() / "notes.txt").string()));
-  EXPECT_TRUE(
-      logs.contains("Feedback enumerator skipped " + (env.cacheDir() / "bag.plist").string()));
-  EXPECT_TRUE(fs::exists(env.cacheDir() / "notes.txt"));
-  EXPECT_TRUE(fs::exists(env.cacheDir() / "CustomFeedback" / "NotAType" / "record"));
+  for (const char* bystander : {"notes.txt", "bag.plist"}) {
+    EXPECT_TRUE(logs.contains("Feedback enumerator skipped " + (cache() / bystander).string()));
+    EXPECT_TRUE(fs::exists(cache() / bystander));
+  }
+  EXPECT_TRUE(fs::exists(custom("NotAType") / "record"));
   EXPECT_EQ(logs.count("NotAType"), 0u);
   EXPECT_EQ(logs.count("cohorts.sqlite"), 0u);
 }
 
-TEST_F(FeedbackWalk, OnceExhaustedItStaysExhausted) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  drain(*e);
-  EXPECT_EQ(e->pendingDirectoryCount(), 0u);
-  for (int i = 0; i < 3; ++i) EXPECT_FALSE(e->next());
-}
-
-TEST_F(FeedbackWalk, EmptyCacheYieldsNothing) {
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  EXPECT_FALSE(e->next());
-}
-
-TEST_F(FeedbackWalk, FinishingEarlyEndsTheWalk) {
+TEST_F(FeedbackWalk, AnEmptyOrFinishedWalkYieldsNothing) {
+  auto empty = FeedbackEnumerator::make(env.assembly());
+  ASSERT_TRUE(empty);
+  EXPECT_FALSE(empty->next());
   populate();
   auto e = FeedbackEnumerator::make(env.assembly());
   ASSERT_TRUE(e);
@@ -141,78 +123,48 @@ TEST_F(FeedbackWalk, FinishingEarlyEndsTheWalk) {
   EXPECT_FALSE(e->next());
 }
 
-TEST_F(FeedbackWalk, NoEnumeratorWithoutACachesDirectory) {
-  fs::remove_all(env.dirs.cacheHome);
-  EXPECT_FALSE(FeedbackEnumerator::make(env.assembly()));
-}
-
 TEST_F(FeedbackWalk, EachCallDrawsAmongTheDirectoriesStillOpen) {
   populate();
   std::vector<size_t> counts;
   // Always the first directory: the cache directory is walked to its end
   // before any custom feedback directory.
-  auto first = FeedbackEnumerator::make(env.assembly(), {}, [&](size_t n) {
+  auto first = walk({}, [&](size_t n) {
     counts.push_back(n);
     return size_t{0};
   });
-  ASSERT_TRUE(first);
-  auto files = drain(*first);
-  ASSERT_EQ(files.size(), sessions.size() + customs.size());
-  for (size_t i = 0; i < files.size(); ++i) {
-    EXPECT_EQ(files[i].fileType,
-              i < sessions.size() ? FeedbackFileType::session : FeedbackFileType::custom);
-  }
-  // Every directory is in the first draw (13 custom directories, 3 of them
-  // present, and the cache directory); the count shrinks as walks end.
+  EXPECT_EQ(kinds(first), std::string(sessions.size(), 's') + std::string(customs.size(), 'c'));
+  // Every directory present is in the first draw (the cache directory and
+  // three custom ones); the count shrinks as walks end.
   ASSERT_FALSE(counts.empty());
   EXPECT_EQ(counts.front(), 4u);
   EXPECT_TRUE(std::is_sorted(counts.rbegin(), counts.rend()));
+  EXPECT_EQ(counts.back(), 2u);
 
   // Always the last: custom feedback first.
-  auto last = FeedbackEnumerator::make(env.assembly(), {}, [](size_t n) { return n - 1; });
-  ASSERT_TRUE(last);
-  files = drain(*last);
-  ASSERT_EQ(files.size(), sessions.size() + customs.size());
-  for (size_t i = 0; i < files.size(); ++i) {
-    EXPECT_EQ(files[i].fileType,
-              i < customs.size() ? FeedbackFileType::custom : FeedbackFileType::session);
-  }
+  EXPECT_EQ(kinds(walk({}, [](size_t n) { return n - 1; })),
+            std::string(customs.size(), 'c') + std::string(sessions.size(), 's'));
 }
 
 TEST_F(FeedbackWalk, TheSystemDrawInterleavesDirectories) {
-  // With two directories of 200 files each, keeping one directory's files
-  // together by chance has a probability of 2^-199.
-  for (unsigned i = 0; i < 200; ++i) {
-    makeFile(env.cacheDir(), sessionName(SessionFileState::closed, i));
+  // With two directories of 40 files each, keeping one directory's files
+  // together by chance has a probability of 2^-39.
+  for (unsigned i = 0; i < 40; ++i) {
+    session(S::closed, i);
     makeFile(custom("Usage"), "r" + std::to_string(i));
   }
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  auto files = drain(*e);
-  ASSERT_EQ(files.size(), 400u);
-  size_t switches = 0;
-  for (size_t i = 1; i < files.size(); ++i) switches += files[i].fileType != files[i - 1].fileType;
-  EXPECT_GT(switches, 1u);
+  auto files = walk();
+  ASSERT_EQ(files.size(), 80u);
+  std::string order = kinds(files);
+  EXPECT_NE(order, std::string(40, 's') + std::string(40, 'c'));
+  EXPECT_NE(order, std::string(40, 'c') + std::string(40, 's'));
 }
 
 TEST_F(FeedbackWalk, ATypeFilterWalksOnlyThoseCustomDirectories) {
   populate();
-  auto e = FeedbackEnumerator::make(env.assembly(), {"Usage", "UserReport"});
-  ASSERT_TRUE(e);
-  auto files = drain(*e);
-  ASSERT_EQ(files.size(), 10u);
-  for (const auto& f : files) {
-    EXPECT_EQ(f.fileType, FeedbackFileType::custom);
-    EXPECT_TRUE(f.typeString() == "Usage" || f.typeString() == "UserReport") << f.typeString();
-  }
-  EXPECT_EQ(e->typeFilter(), (std::vector<std::string>{"Usage", "UserReport"}));
-}
-
-TEST_F(FeedbackWalk, AFilterOfUnknownTypesFindsNothing) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly(), {"NotAType", "usage"});
-  ASSERT_TRUE(e);
-  EXPECT_FALSE(e->next());
+  std::multiset<std::string> types;
+  for (const auto& f : walk({"Usage", "UserReport"})) types.insert(f.typeString());
+  EXPECT_EQ(types, (std::multiset<std::string>{"Usage", "Usage", "UserReport", "UserReport"}));
+  EXPECT_TRUE(walk({"NotAType", "usage"}).empty());
 }
 
 }  // namespace
