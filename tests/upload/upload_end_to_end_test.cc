@@ -47,9 +47,10 @@ struct TestCertificate {
   bool made = false;
 
   TestCertificate() {
-    std::string cmd = "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 2"
-                      " -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout '" +
-                      key.string() + "' -out '" + cert.string() + "' >/dev/null 2>&1";
+    std::string cmd =
+        "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 2"
+        " -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout '" +
+        key.string() + "' -out '" + cert.string() + "' >/dev/null 2>&1";
     made = std::system(cmd.c_str()) == 0 && fs::exists(cert) && fs::exists(key);
   }
 
@@ -178,7 +179,9 @@ class UploadToIngest : public ::testing::Test, public UploadManagerDelegate {
 
   void onQueue(const std::function<void()>& f) { env.assembly().workloop().sync(f); }
 
-  void useEndpoint(const std::string& url) { env.writeBag({{"feedback_url", url}, {"crowdsourcing_url", url}}); }
+  void useEndpoint(const std::string& url) {
+    env.writeBag({{"feedback_url", url}, {"crowdsourcing_url", url}});
+  }
 
   void makeManager() {
     onQueue([&] {
@@ -208,11 +211,12 @@ class UploadToIngest : public ::testing::Test, public UploadManagerDelegate {
     std::optional<Outcome> result;
     std::condition_variable cv;
     onQueue([&] {
-      manager->enqueue(std::move(request), [&](std::optional<HttpResponse> r, std::optional<HttpError> e) {
-        std::lock_guard l(m);
-        result = Outcome{std::move(r), std::move(e)};
-        cv.notify_all();
-      });
+      manager->enqueue(std::move(request),
+                       [&](std::optional<HttpResponse> r, std::optional<HttpError> e) {
+                         std::lock_guard l(m);
+                         result = Outcome{std::move(r), std::move(e)};
+                         cv.notify_all();
+                       });
     });
     std::unique_lock l(m);
     cv.wait_for(l, kWaitLimit, [&] { return result.has_value(); });
@@ -234,61 +238,100 @@ class UploadToIngest : public ::testing::Test, public UploadManagerDelegate {
   std::condition_variable delegateCalled;
 };
 
-TEST_F(UploadToIngest, Status200DeletesTheFileAndReportsItUploaded) {
-  Ingest ingest({});
+// Guards against: a payload the receiver cannot decode or verify, a file kept
+// after HTTP 200 or deleted after any other status, a retry sent with a digest
+// it never computed, or a stale retry sent at all (all through real HTTPS).
+TEST_F(UploadToIngest, OnlyAcceptedUploadsAreDeletedAndEachArrivesWhole) {
+  Ingest ingest({"--status", "201", "204", "500", "200"});
   ASSERT_TRUE(ingest.running());
-  useEndpoint(ingest.url());
+  env.writeBag({{"feedback_url", ingest.url()},
+                {"crowdsourcing_url", ingest.url()},
+                {"feedback_max_age_in_days", 3}});
+  env.defaults().setObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys, certificate().pin());
   makeManager();
   auto request = prepareSession();
   ASSERT_TRUE(request);
-  auto file = request->fileURL;
-  auto outcome = send(*request);
-  ASSERT_TRUE(outcome);
-  ASSERT_TRUE(outcome->response) << (outcome->error ? outcome->error->description : "");
-  EXPECT_EQ(outcome->response->statusCode, 200);
-  EXPECT_FALSE(fs::exists(file));
-  auto events = lossEvents();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0]["reason"], 12);
-  EXPECT_EQ(events[0]["feedbackType"], 13);
-  EXPECT_EQ(delegateCalls, (std::vector<std::pair<fs::path, long>>{{file, 200}}));
-
+  for (long expected : {201L, 204L, 500L, 200L}) {
+    auto outcome = send(*request);
+    ASSERT_TRUE(outcome && outcome->response)
+        << expected << (outcome && outcome->error ? outcome->error->description : "");
+    EXPECT_EQ(outcome->response->statusCode, expected);
+    EXPECT_EQ(fs::exists(request->fileURL), expected != 200);
+    EXPECT_EQ(delegateCalls.back(), std::make_pair(request->fileURL, expected));
+    EXPECT_EQ(lossEvents().size(), expected == 200 ? 1u : 0u);
+  }
+  EXPECT_FALSE(env.assembly().isCancelled());
+  EXPECT_EQ(lossEvents().at(0)["reason"], 12);
+  EXPECT_EQ(lossEvents().at(0)["feedbackType"], 13);
   auto records = ingest.records();
-  ASSERT_EQ(records.size(), 1u);
-  const auto& r = records[0];
+  ASSERT_EQ(records.size(), 4u);
+  const auto& r = records[3];
   EXPECT_EQ(r["method"], "POST");
   EXPECT_EQ(r["path"], "/feedback");
-  EXPECT_EQ(r["query"], (nlohmann::json{{"key", "galleon5290"}, {"seed", "1"}, {"type", "FeedbackV2PB"}, {"v", "2"}}));
+  EXPECT_EQ(r["query"],
+            (nlohmann::json{
+                {"key", "galleon5290"}, {"seed", "1"}, {"type", "FeedbackV2PB"}, {"v", "2"}}));
   EXPECT_EQ(r["headers"]["Content-Type"], "application/protobuf");
   EXPECT_EQ(r["headers"]["Content-Encoding"], "deflate");
-  EXPECT_EQ(r["headers"]["User-Agent"], "vireond/1.0 (TestBox1,1; TestOS 1.0 1A100) vireon-fbf/test");
+  EXPECT_EQ(r["headers"]["User-Agent"],
+            "vireond/1.0 (TestBox1,1; TestOS 1.0 1A100) vireon-fbf/test");
   EXPECT_EQ(r["body_size"], request->compressedSize);
   EXPECT_EQ(r["inflated_size"], request->uncompressedSize);
   EXPECT_EQ(r["digest_ok"], true);
   EXPECT_EQ(r["digest_kind"], "sha512");
   EXPECT_EQ(r["decoded"]["agent"], "Scoutlume/3.1");
   EXPECT_EQ(r["decoded"]["countryCode"], "DE");
-}
 
-TEST_F(UploadToIngest, Statuses201And204And500KeepTheFile) {
-  Ingest ingest({"--status", "201", "204", "500"});
-  ASSERT_TRUE(ingest.running());
-  useEndpoint(ingest.url());
-  makeManager();
-  auto request = prepareSession();
+  // Custom feedback goes without Content-Type and decodes to the source.
+  nlohmann::json report = {{"kind", "poi"}, {"notes", std::string(40000, 'n')}};
+  auto source = env.cacheDir() / "CustomFeedback" / "Crowdsourcing" / "c-1";
+  testing::writeFile(source, report.dump());
+  std::optional<UploadRequest> custom;
+  onQueue([&] { custom = manager->uploadCustomFeedback(source, "Crowdsourcing"); });
+  ASSERT_TRUE(custom);
+  auto outcome = send(*custom);
+  ASSERT_TRUE(outcome && outcome->response);
+  EXPECT_FALSE(fs::exists(custom->fileURL));
+  records = ingest.records();
+  ASSERT_EQ(records.size(), 5u);
+  EXPECT_FALSE(records[4]["headers"].contains("Content-Type"));
+  EXPECT_EQ(records[4]["decoded"], report);
+  EXPECT_EQ(records[4]["digest_ok"], true);
+  EXPECT_EQ(lossEvents().at(1)["feedbackType"], 2);
+
+  // A later flush finds a file left pending and retries it, without a digest.
+  request = prepareSession();
   ASSERT_TRUE(request);
-  for (long expected : {201L, 204L, 500L}) {
-    auto outcome = send(*request);
-    ASSERT_TRUE(outcome && outcome->response) << expected;
-    EXPECT_EQ(outcome->response->statusCode, expected);
-    EXPECT_TRUE(fs::exists(request->fileURL));
-    EXPECT_EQ(delegateCalls.back().second, expected);
+  delegateCalls.clear();
+  makeManager();
+  onQueue([&] { manager->retryUpload(request->fileURL, "FeedbackV2PB"); });
+  {
+    std::unique_lock l(m);
+    delegateCalled.wait_for(l, kWaitLimit, [&] { return !delegateCalls.empty(); });
   }
-  EXPECT_TRUE(lossEvents().empty());
-  EXPECT_FALSE(env.assembly().isCancelled());
-  EXPECT_EQ(ingest.records().size(), 3u);
+  ASSERT_EQ(delegateCalls.size(), 1u);
+  EXPECT_EQ(delegateCalls[0].second, 200);
+  EXPECT_FALSE(fs::exists(request->fileURL));
+  records = ingest.records();
+  ASSERT_EQ(records.size(), 6u);
+  EXPECT_EQ(records[5]["digest_kind"], "missing");
+  EXPECT_EQ(records[5]["decoded"]["agent"], "Scoutlume/3.1");
+
+  // One past its age limit is deleted unsent.
+  request = prepareSession();
+  ASSERT_TRUE(request);
+  env.clock->set(env.fileManager->attributes(request->fileURL)->creationDate + 72h);
+  makeManager();
+  onQueue([&] { manager->retryUpload(request->fileURL, "FeedbackV2PB"); });
+  EXPECT_FALSE(fs::exists(request->fileURL));
+  ASSERT_EQ(lossEvents().size(), 4u);
+  EXPECT_EQ(lossEvents()[3]["reason"], 1);
+  EXPECT_EQ(lossEvents()[3]["age"], 72 * 3600);
+  EXPECT_EQ(ingest.records().size(), 6u);
 }
 
+// Guards against: a refused connection not cancelling the flush, or any
+// failed transfer losing the file.
 TEST_F(UploadToIngest, ARefusedConnectionCancelsTheFlushAndKeepsTheFile) {
   useEndpoint("https://127.0.0.1:" + std::to_string(closedPort()) + "/feedback");
   makeManager();
@@ -302,50 +345,6 @@ TEST_F(UploadToIngest, ARefusedConnectionCancelsTheFlushAndKeepsTheFile) {
   EXPECT_TRUE(logs.contains("Device appears to be offline. Flush cancelled."));
   EXPECT_TRUE(fs::exists(request->fileURL));
   EXPECT_EQ(delegateCalls.back().second, 0);
-}
-
-TEST_F(UploadToIngest, AServerWhoseKeyIsNotPinnedIsRefused) {
-  Ingest ingest({});
-  ASSERT_TRUE(ingest.running());
-  useEndpoint(ingest.url());
-  env.defaults().setObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys,
-                           "sha256//AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA=");
-  makeManager();
-  auto request = prepareSession();
-  ASSERT_TRUE(request);
-  auto outcome = send(*request);
-  ASSERT_TRUE(outcome && outcome->error);
-  EXPECT_EQ(outcome->error->code, HttpErrorCode::secureConnectionFailed);
-  EXPECT_FALSE(env.assembly().isCancelled());
-  EXPECT_TRUE(fs::exists(request->fileURL));
-  EXPECT_TRUE(ingest.records().empty());
-}
-
-TEST_F(UploadToIngest, AServerWhoseKeyIsPinnedIsAccepted) {
-  Ingest ingest({});
-  ASSERT_TRUE(ingest.running());
-  useEndpoint(ingest.url());
-  env.defaults().setObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys, certificate().pin());
-  makeManager();
-  auto request = prepareSession();
-  ASSERT_TRUE(request);
-  auto outcome = send(*request);
-  ASSERT_TRUE(outcome && outcome->response) << (outcome && outcome->error ? outcome->error->description : "");
-  EXPECT_EQ(outcome->response->statusCode, 200);
-}
-
-TEST_F(UploadToIngest, AnUntrustedCertificateIsRefused) {
-  Ingest ingest({});
-  ASSERT_TRUE(ingest.running());
-  useEndpoint(ingest.url());
-  env.defaults().removeObject(FBFStrings::LinuxDefaults::UploadCAFile);
-  makeManager();
-  auto request = prepareSession();
-  ASSERT_TRUE(request);
-  auto outcome = send(*request);
-  ASSERT_TRUE(outcome && outcome->error);
-  EXPECT_EQ(outcome->error->code, HttpErrorCode::secureConnectionFailed);
-  EXPECT_TRUE(fs::exists(request->fileURL));
 }
 
 TEST_F(UploadToIngest, ADroppedConnectionKeepsTheFileWithoutCancelling) {
@@ -362,77 +361,44 @@ TEST_F(UploadToIngest, ADroppedConnectionKeepsTheFileWithoutCancelling) {
   EXPECT_EQ(ingest.records().size(), 1u);
 }
 
-TEST_F(UploadToIngest, CustomFeedbackGoesWithoutContentTypeAndDecodes) {
+// Guards against: feedback sent to a server whose key is not pinned or whose
+// certificate is not trusted.
+TEST_F(UploadToIngest, AnUnpinnedOrUntrustedServerGetsNothing) {
   Ingest ingest({});
   ASSERT_TRUE(ingest.running());
   useEndpoint(ingest.url());
-  makeManager();
-  nlohmann::json report = {{"kind", "poi"}, {"notes", std::string(40000, 'n')}};
-  auto source = env.cacheDir() / "CustomFeedback" / "Crowdsourcing" / "c-1";
-  testing::writeFile(source, report.dump());
-  std::optional<UploadRequest> request;
-  onQueue([&] { request = manager->uploadCustomFeedback(source, "Crowdsourcing"); });
-  ASSERT_TRUE(request);
-  auto outcome = send(*request);
-  ASSERT_TRUE(outcome && outcome->response);
-  EXPECT_FALSE(fs::exists(request->fileURL));
-  auto records = ingest.records();
-  ASSERT_EQ(records.size(), 1u);
-  EXPECT_FALSE(records[0]["headers"].contains("Content-Type"));
-  EXPECT_EQ(records[0]["decoded"], report);
-  EXPECT_EQ(records[0]["digest_ok"], true);
-  EXPECT_EQ(lossEvents().at(0)["feedbackType"], 2);
-}
-
-TEST_F(UploadToIngest, ARetriedFileIsResentWithoutDigestAndDeletedOn200) {
-  Ingest ingest({});
-  ASSERT_TRUE(ingest.running());
-  useEndpoint(ingest.url());
-  makeManager();
-  auto request = prepareSession();
-  ASSERT_TRUE(request);
-  // A new manager (a later flush) finds the file and retries it.
-  makeManager();
-  onQueue([&] { manager->retryUpload(request->fileURL, "FeedbackV2PB"); });
-  {
-    std::unique_lock l(m);
-    delegateCalled.wait_for(l, kWaitLimit, [&] { return !delegateCalls.empty(); });
+  for (bool pinned : {true, false}) {
+    SCOPED_TRACE(pinned ? "wrong pin" : "untrusted certificate");
+    if (pinned) {
+      env.defaults().setObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys,
+                               "sha256//AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA=");
+    } else {
+      env.defaults().removeObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys);
+      env.defaults().removeObject(FBFStrings::LinuxDefaults::UploadCAFile);
+    }
+    makeManager();
+    auto request = prepareSession();
+    ASSERT_TRUE(request);
+    auto outcome = send(*request);
+    ASSERT_TRUE(outcome && outcome->error);
+    EXPECT_EQ(outcome->error->code, HttpErrorCode::secureConnectionFailed);
+    EXPECT_FALSE(env.assembly().isCancelled());
+    EXPECT_TRUE(fs::exists(request->fileURL));
   }
-  ASSERT_EQ(delegateCalls.size(), 1u);
-  EXPECT_EQ(delegateCalls[0].second, 200);
-  EXPECT_FALSE(fs::exists(request->fileURL));
-  auto records = ingest.records();
-  ASSERT_EQ(records.size(), 1u);
-  EXPECT_EQ(records[0]["digest_kind"], "missing");
-  EXPECT_EQ(records[0]["decoded"]["agent"], "Scoutlume/3.1");
-}
-
-TEST_F(UploadToIngest, ARetryOfATooOldFileDeletesItUnsent) {
-  Ingest ingest({});
-  ASSERT_TRUE(ingest.running());
-  env.writeBag({{"feedback_url", ingest.url()}, {"feedback_max_age_in_days", 3}});
-  makeManager();
-  auto request = prepareSession();
-  ASSERT_TRUE(request);
-  env.clock->set(env.fileManager->attributes(request->fileURL)->creationDate + 72h);
-  makeManager();
-  onQueue([&] { manager->retryUpload(request->fileURL, "FeedbackV2PB"); });
-  EXPECT_FALSE(fs::exists(request->fileURL));
-  auto events = lossEvents();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0]["reason"], 1);
-  EXPECT_EQ(events[0]["age"], 72 * 3600);
   EXPECT_TRUE(ingest.records().empty());
 }
 
+// Guards against: an offline failure taken for a server fault or the reverse.
 TEST(CurlErrorMapping, SortsOfflineFailuresFromTheRest) {
-  EXPECT_EQ(httpErrorFromCurl(6, 0, "").code, HttpErrorCode::cannotFindHost);                           // resolve
-  EXPECT_EQ(httpErrorFromCurl(7, ECONNREFUSED, "").code, HttpErrorCode::cannotConnectToHost);          // connect
-  EXPECT_EQ(httpErrorFromCurl(7, ENETUNREACH, "").code, HttpErrorCode::notConnectedToInternet);        // no route
-  EXPECT_EQ(httpErrorFromCurl(90, 0, "").code, HttpErrorCode::secureConnectionFailed);                 // pin
+  EXPECT_EQ(httpErrorFromCurl(6, 0, "").code, HttpErrorCode::cannotFindHost);  // resolve
+  EXPECT_EQ(httpErrorFromCurl(7, ECONNREFUSED, "").code,
+            HttpErrorCode::cannotConnectToHost);  // connect
+  EXPECT_EQ(httpErrorFromCurl(7, ENETUNREACH, "").code,
+            HttpErrorCode::notConnectedToInternet);                                     // no route
+  EXPECT_EQ(httpErrorFromCurl(90, 0, "").code, HttpErrorCode::secureConnectionFailed);  // pin
   EXPECT_EQ(httpErrorFromCurl(28, 0, "").code, HttpErrorCode::timedOut);
-  EXPECT_EQ(httpErrorFromCurl(52, 0, "").domain, HttpErrorDomain::network);                            // got nothing
-  EXPECT_EQ(httpErrorFromCurl(27, 0, "").domain, HttpErrorDomain::other);                              // out of memory
+  EXPECT_EQ(httpErrorFromCurl(52, 0, "").domain, HttpErrorDomain::network);  // got nothing
+  EXPECT_EQ(httpErrorFromCurl(27, 0, "").domain, HttpErrorDomain::other);    // out of memory
   EXPECT_EQ(httpErrorFromCurl(7, 0, "detail").description, "Couldn't connect to server: detail");
 }
 
