@@ -1,78 +1,60 @@
-#include "flushing/cache_fixture.h"
+#include "assembly/fbf_assembly.h"
+#include "assembly/feedback_deletion_event.h"
+#include "flushing/flushing_test_util.h"
+#include "platform/analytics.h"
 
 #include <sys/stat.h>
+
+#include <fstream>
+
+using namespace std::chrono_literals;
 
 namespace fbf::testing {
 namespace {
 
 // Guards against: a state change that loses contents, overwrites another copy
-// of the session, or keeps the upload suffix.
-using SessionStateChange = CacheTest;
-
-TEST_F(SessionStateChange, MovesToThePlainNameOfTheNewStateWithItsContents) {
-  auto file = makeFile(cache(), sessionName(S::closed, 1), "payload");
-  std::error_code error;
-  auto moved = vireon_renameForStateChange(fm(), file, S::processing, error);
-  ASSERT_TRUE(moved) << error.message();
-  EXPECT_EQ(*moved, cache() / sessionName(S::processing, 1));
-  EXPECT_FALSE(fs::exists(file));
-  EXPECT_EQ(readFile(*moved), "payload");
-
+// of the session, keeps the upload suffix, or fails without saying why.
+TEST_F(CacheTest, AStateChangeMovesToThePlainNameOfTheNewStateOrSaysWhyNot) {
+  auto closed = makeFile(cache(), sessionName(S::closed, 1), "payload");
   auto upload = session(S::processing, 2, ".pb.uploadPending");
-  moved = vireon_renameForStateChange(fm(), upload, S::uploaded, error);
-  ASSERT_TRUE(moved);
-  EXPECT_EQ(moved->filename(), sessionName(S::uploaded, 2));
-}
+  std::error_code error;
+  EXPECT_EQ(vireon_renameForStateChange(fm(), closed, S::processing, error),
+            cache() / sessionName(S::processing, 1));
+  EXPECT_EQ(readFile(cache() / sessionName(S::processing, 1)), "payload");
+  EXPECT_EQ(vireon_renameForStateChange(fm(), upload, S::uploaded, error),
+            cache() / sessionName(S::uploaded, 2));
 
-TEST_F(SessionStateChange, FailuresLeaveEverythingInPlaceAndSayWhy) {
   auto junk = makeFile(cache(), "session.junk");
-  auto closed = makeFile(cache(), sessionName(S::closed, 2), "new");
-  auto processing = makeFile(cache(), sessionName(S::processing, 2), "old");
-  struct Row {
-    const char* name;
-    fs::path file;
-    std::errc why;
-  };
-  const Row rows[] = {
-      {"unparseable name", junk, std::errc::invalid_argument},
-      {"missing file", cache() / sessionName(S::closed, 9), std::errc::no_such_file_or_directory},
-      {"target exists", closed, std::errc::file_exists}};
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
-    std::error_code error;
-    EXPECT_FALSE(vireon_renameForStateChange(fm(), row.file, S::processing, error));
-    EXPECT_EQ(error, row.why);
+  auto taken = makeFile(cache(), sessionName(S::closed, 1), "new");
+  const std::pair<fs::path, std::errc> failures[] = {
+      {junk, std::errc::invalid_argument},
+      {cache() / sessionName(S::closed, 9), std::errc::no_such_file_or_directory},
+      {taken, std::errc::file_exists}};
+  for (const auto& [file, why] : failures) {
+    EXPECT_FALSE(vireon_renameForStateChange(fm(), file, S::processing, error)) << file;
+    EXPECT_EQ(error, why) << file;
   }
   EXPECT_TRUE(fs::exists(junk));
-  EXPECT_EQ(readFile(closed), "new");
-  EXPECT_EQ(readFile(processing), "old");
+  EXPECT_EQ(readFile(taken), "new");
+  EXPECT_EQ(readFile(cache() / sessionName(S::processing, 1)), "payload");
 }
 
-// Guards against: cache subdirectories readable by others, or one failure
-// stopping the other from being made.
-using CacheSubdirectories = CacheTest;
-
-TEST_F(CacheSubdirectories, AreCreatedOrRepairedOwnerOnly) {
+// Guards against: cache subdirectories readable by others, one failure stopping
+// the other from being made, or anything made without a caches directory.
+TEST_F(CacheTest, RequiredSubdirectoriesAreMadeOrRepairedOwnerOnly) {
   fs::create_directories(cache() / "Cohorts");
   chmod((cache() / "Cohorts").c_str(), 0755);
   createRequiredCacheSubdirectories(fm());
   for (const char* name : {"CustomFeedback", "Cohorts"}) {
-    auto attrs = fm().attributes(cache() / name);
-    ASSERT_TRUE(attrs) << name;
-    EXPECT_TRUE(attrs->isDirectory());
-    EXPECT_EQ(attrs->mode, 0700u) << name;
+    EXPECT_EQ(fm().attributes(cache() / name).value().mode, 0700u) << name;
+    EXPECT_TRUE(fm().attributes(cache() / name)->isDirectory()) << name;
   }
-}
-
-TEST_F(CacheSubdirectories, AFileInTheWayIsLoggedAndTheOtherIsStillMade) {
+  fs::remove_all(cache());
   makeFile(cache(), "CustomFeedback", "not a directory");
   createRequiredCacheSubdirectories(fm());
   EXPECT_TRUE(logs.contains("Error making vireond caches subdir: "));
   EXPECT_TRUE(fs::is_directory(cache() / "Cohorts"));
-  EXPECT_TRUE(fs::is_regular_file(cache() / "CustomFeedback"));
-}
 
-TEST_F(CacheSubdirectories, WithoutACachesDirectoryNothingIsMadeOrWalked) {
   fs::remove_all(env.dirs.cacheHome);
   createRequiredCacheSubdirectories(fm());
   EXPECT_TRUE(logs.contains("unable to obtain cache directory"));
@@ -83,59 +65,122 @@ TEST_F(CacheSubdirectories, WithoutACachesDirectoryNothingIsMadeOrWalked) {
 
 // Guards against: custom feedback written where it is never sent, readable by
 // others, or outside its type directory.
-using PersistingCustomFeedback = CacheTest;
-
-TEST_F(PersistingCustomFeedback, RecordLandsInItsTypeDirectoryOwnerOnlyAndIsEnumerated) {
+TEST_F(CacheTest, CustomFeedbackLandsOwnerOnlyInItsTypeDirectoryOrNowhere) {
   auto path = persistCustomFeedback(fm(), "cohort bytes", 11, "cohort-1");
-  ASSERT_TRUE(path);
-  EXPECT_EQ(*path, cache() / "CustomFeedback" / "Usage" / "cohort-1");
+  ASSERT_EQ(path, cache() / "CustomFeedback" / "Usage" / "cohort-1");
   EXPECT_EQ(readFile(*path), "cohort bytes");
   EXPECT_EQ(fm().attributes(*path)->mode, 0600u);
   EXPECT_EQ(fm().attributes(path->parent_path())->mode, 0700u);
-  auto files = walkAll(fm());
+  auto files = drain(FeedbackEnumerator::make(fm()));
   ASSERT_EQ(files.size(), 1u);
   EXPECT_EQ(files[0].fileURL, *path);
-  EXPECT_EQ(files[0].typeString(), "Usage");
-}
 
-TEST_F(PersistingCustomFeedback, UnknownTypesAndEscapingNamesAreRefused) {
   using namespace std::string_view_literals;
-  struct Row {
-    int type;
-    std::string_view name;
-  };
-  const Row rows[] = {{0, "a"},    {14, "b"},          {99, "c"},    {2, ""sv},    {2, "."sv},
-                      {2, ".."sv}, {2, "../escape"sv}, {2, "a/b"sv}, {2, "a\0b"sv}};
-  fs::create_directories(cache() / "CustomFeedback");
-  for (const auto& row : rows) {
-    EXPECT_FALSE(persistCustomFeedback(fm(), "x", row.type, row.name)) << row.type << row.name;
+  const std::pair<int, std::string_view> refused[] = {{0, "a"},         {14, "b"},  {99, "c"},
+                                                      {2, ""},          {2, "."},   {2, ".."},
+                                                      {2, "../escape"}, {2, "a/b"}, {2, "a\0b"sv}};
+  for (const auto& [type, name] : refused) {
+    EXPECT_FALSE(persistCustomFeedback(fm(), "x", type, name)) << type << name;
   }
   EXPECT_EQ(logs.count("error persisting custom feedback at"), 9u);
   EXPECT_TRUE(logs.contains("error persisting custom feedback at " +
                             (cache() / "CustomFeedback" / "(unknown: 99)").string() + "/c"));
-  EXPECT_EQ(entryNames(cache() / "CustomFeedback"), std::vector<std::string>{});
+  EXPECT_EQ(entryNames(cache() / "CustomFeedback"), std::vector<std::string>{"Usage"});
+  EXPECT_EQ(entryNames(cache() / "CustomFeedback" / "Usage"), std::vector<std::string>{"cohort-1"});
 }
 
-// Guards against: a failed removal going unlogged or reported as done.
-TEST_F(CacheTest, AFailedRemovalIsLoggedWithTheCallersMessage) {
+// Guards against: a failed removal going unlogged or reported as done, and
+// uploads left pending retried newest first or mixed with other files.
+TEST_F(CacheTest, RemovalFailuresAreLoggedAndPendingUploadsListedOldestFirst) {
   auto file = makeFile(cache(), "x");
   EXPECT_TRUE(vireon_removeItemOrLogError(fm(), file, "Could not drop x"));
-  EXPECT_FALSE(fs::exists(file));
   EXPECT_FALSE(vireon_removeItemOrLogError(fm(), file, "Could not drop x"));
   EXPECT_TRUE(logs.contains("Could not drop x: No such file or directory"));
-}
 
-// Guards against: uploads left pending retried newest first, or other files among them.
-TEST_F(CacheTest, UploadsLeftPendingAreListedOldestFirst) {
   session(S::closed, 1);
-  auto second = session(S::processing, 3, ".json.uploadPending");
-  auto first = makeFileCreatedAfter(fm(), second, cache(),
+  auto older = session(S::processing, 3, ".json.uploadPending");
+  auto newer = makeFileCreatedAfter(fm(), older, cache(),
                                     sessionName(S::processing, 2) + ".pb.uploadPending");
   auto pending = sessionFilesAwaitingUpload(fm());
   ASSERT_EQ(pending.size(), 2u);
-  // By creation date, although the names sort the other way.
-  EXPECT_EQ(pending[0].path, second);
-  EXPECT_EQ(pending[1].path, first);
+  EXPECT_EQ(pending[0].path, older);  // by creation date, though names sort the other way
+  EXPECT_EQ(pending[1].path, newer);
+}
+
+// Guards against: a loss record with the wrong size or age, or one sent for an
+// unknown type or a file that is already gone.
+TEST_F(CacheTest, ALossRecordHasSizeInKibibytesRoundedUpAndAgeTruncated) {
+  struct Row {
+    size_t bytes;
+    std::chrono::milliseconds after;
+    int32_t type;
+    std::optional<int64_t> size, age;
+  };
+  const Row rows[] = {{0, 5s, 2, 0, 5},           {1, 5s, 2, 1, 5},           {1024, 5s, 2, 1, 5},
+                      {1025, 90900ms, 11, 2, 90}, {3073, -2500ms, 13, 4, -2}, {10, 0s, 1, 1, 0},
+                      {10, 0s, 0, {}, {}},        {10, 0s, 14, {}, {}}};
+  for (const auto& row : rows) {
+    SCOPED_TRACE(::testing::Message() << row.bytes << " bytes, type " << row.type);
+    auto file = makeFile(cache(), "f", std::string(row.bytes, 'b'));
+    auto event = FeedbackDeletionEvent::make(file, row.type, FeedbackDeletionReason::tooLarge,
+                                             creationDate(fm(), file) + row.after, fm());
+    ASSERT_EQ(event.has_value(), row.size.has_value());
+    if (!event) continue;
+    EXPECT_EQ(event->size, *row.size);
+    EXPECT_EQ(event->age, *row.age);
+    EXPECT_EQ(event->feedbackType, row.type);
+    EXPECT_EQ(event->reason, FeedbackDeletionReason::tooLarge);
+  }
+  EXPECT_FALSE(FeedbackDeletionEvent::make(cache() / "missing", 2, 1, env.clock->now(), fm()));
+}
+
+// Holds each payload function and hands it to the real sink only when told,
+// as a sink that records lazily would.
+class DeferringSink final : public AnalyticsSink {
+ public:
+  explicit DeferringSink(std::unique_ptr<AnalyticsSink> inner) : inner_(std::move(inner)) {}
+  void sendEvent(std::string_view name,
+                 const std::function<std::optional<nlohmann::json>()>& payload) override {
+    held_.emplace_back(std::string(name), payload);
+  }
+  void release() {
+    for (auto& [name, payload] : held_) inner_->sendEvent(name, payload);
+  }
+
+ private:
+  std::unique_ptr<AnalyticsSink> inner_;
+  std::vector<std::pair<std::string, std::function<std::optional<nlohmann::json>()>>> held_;
+};
+
+// Guards against: a loss reported with a payload that is not the event's own,
+// computed before the sink asks for it, or written to the analytics file out of order.
+TEST_F(CacheTest, LossesReachTheAnalyticsFileOneLineEachInOrderWhenTheSinkAsks) {
+  auto sink = std::make_shared<DeferringSink>(
+      makeJsonLinesAnalyticsSink(env.dirs.analyticsFile(), fm(), *env.clock));
+  FBFAssemblyDependencies deps;
+  deps.preferences = env.preferences;
+  deps.fileManager = env.fileManager;
+  deps.clock = env.clock;
+  deps.analytics = sink;
+  deps.transactions = env.transactions;
+  deps.deviceContext = std::shared_ptr<DeviceContextProtocol>(
+      const_cast<DeviceContextProtocol*>(&env.assembly().deviceContext()), [](auto*) {});
+  deps.workloop = env.manualQueue;
+  FBFAssembly assembly(std::move(deps));
+
+  assembly.didDeleteFeedbackFile(FeedbackDeletionEvent{11, 1, 2, 8 * 86400});
+  assembly.didDeleteFeedbackFile(FeedbackDeletionEvent{13, 12, 0, -3});
+  EXPECT_FALSE(fs::exists(env.dirs.analyticsFile()));
+  sink->release();
+  std::ifstream in(env.dirs.analyticsFile());
+  std::vector<nlohmann::json> lines;
+  for (std::string line; std::getline(in, line);) lines.push_back(nlohmann::json::parse(line));
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_EQ(lines[0].at("event"), "vireond.feedbackLoss");
+  EXPECT_EQ(lines[0].at("payload"),
+            (nlohmann::json{{"feedbackType", 11}, {"reason", 1}, {"size", 2}, {"age", 8 * 86400}}));
+  EXPECT_EQ(lines[1].at("payload"),
+            (nlohmann::json{{"feedbackType", 13}, {"reason", 12}, {"size", 0}, {"age", -3}}));
 }
 
 }  // namespace

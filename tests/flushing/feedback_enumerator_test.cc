@@ -1,4 +1,4 @@
-#include "flushing/cache_fixture.h"
+#include "flushing/flushing_test_util.h"
 
 #include <set>
 
@@ -8,47 +8,39 @@ namespace {
 // Guards against: a file sent under the wrong type, or a session file inside a
 // custom directory taken for custom feedback.
 TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown) {
+  using T = FeedbackFileType;
   struct Row {
-    const char* name;
     std::string path;
-    FeedbackFileType type;
+    T type;
     std::string typeString;
     int known;
     bool pending = false;
   };
+  const std::string custom = "/c/vireond/CustomFeedback/";
   const Row rows[] = {
-      {"closed session", "/c/vireond/" + sessionName(S::closed, 1), FeedbackFileType::session,
-       "FeedbackV2", 12},
-      {"protobuf upload", "/c/vireond/" + sessionName(S::processing, 1) + ".pb.uploadPending",
-       FeedbackFileType::session, "FeedbackV2PB", 13, true},
-      {"custom report", "/c/vireond/CustomFeedback/UserReport/report-1", FeedbackFileType::custom,
-       "UserReport", 10},
-      {"custom upload", "/c/vireond/CustomFeedback/Usage/u.uploadPending", FeedbackFileType::custom,
-       "Usage", 11, true},
-      {"session in a custom directory",
-       "/c/vireond/CustomFeedback/Usage/" + sessionName(S::closed, 2), FeedbackFileType::session,
-       "FeedbackV2", 12},
-      {"bystander", "/c/vireond/notes.txt", FeedbackFileType::unknown, "", 0},
-      {"type names are case-sensitive", "/c/vireond/CustomFeedback/usage/x",
-       FeedbackFileType::unknown, "", 0},
+      {"/c/vireond/" + sessionName(S::closed, 1), T::session, "FeedbackV2", 12},
+      {"/c/" + sessionName(S::processing, 1) + ".pb.uploadPending", T::session, "FeedbackV2PB", 13,
+       true},
+      {custom + "UserReport/report-1", T::custom, "UserReport", 10},
+      {custom + "Usage/u.uploadPending", T::custom, "Usage", 11, true},
+      {custom + "Usage/" + sessionName(S::closed, 2), T::session, "FeedbackV2", 12},
+      {"/c/vireond/notes.txt", T::unknown, "", 0},
+      {custom + "usage/x", T::unknown, "", 0},  // type names are case-sensitive
   };
   for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
     FeedbackFile file(row.path);
-    EXPECT_EQ(file.fileType, row.type);
-    EXPECT_EQ(file.sessionFilename.has_value(), row.type == FeedbackFileType::session);
-    EXPECT_EQ(file.typeString(), row.typeString);
-    EXPECT_EQ(file.knownFeedbackType(), row.known);
-    EXPECT_EQ(file.uploadPending(), row.pending);
-    EXPECT_EQ(file.fileName(), fs::path(row.path).filename());
+    EXPECT_EQ(file.fileType, row.type) << row.path;
+    EXPECT_EQ(file.sessionFilename.has_value(), row.type == T::session) << row.path;
+    EXPECT_EQ(file.typeString(), row.typeString) << row.path;
+    EXPECT_EQ(file.knownFeedbackType(), row.known) << row.path;
+    EXPECT_EQ(file.uploadPending(), row.pending) << row.path;
   }
-  EXPECT_EQ(FeedbackFile("/c/vireond/x").enclosingDirectory(), "vireond");
+  EXPECT_EQ(FeedbackFile(custom + "Usage/u-1").fileName(), "u-1");
 }
 
 // Guards against: a walk that misses, repeats or invents feedback files, reads
-// bystanders, keeps going after its end, or keeps one directory's files together.
-// The cache holds session files, custom feedback of a few types and the usual
-// bystanders.
+// bystanders, trips over odd names or files removed under it, or keeps one
+// directory's files together.
 class FeedbackWalk : public CacheTest {
  protected:
   fs::path custom(std::string_view type) { return cache() / "CustomFeedback" / std::string(type); }
@@ -57,77 +49,53 @@ class FeedbackWalk : public CacheTest {
     sessions.insert(session(S::processing, 99, ".pb.uploadPending"));
     for (std::string_view type : {"Usage", "UserReport", "Crowdsourcing"}) {
       for (unsigned i = 0; i < 2; ++i)
-        customs.insert(makeFile(custom(type), "record-" + std::to_string(i)));
+        customs.insert(makeFile(custom(type), "r" + std::to_string(i)));
     }
-    makeFile(cache(), "bag.plist");
-    makeFile(cache(), "notes.txt");
-    makeFile(cache() / "CustomFeedback", "loose-file");
-    makeFile(custom("NotAType"), "record");
-    makeFile(cache() / "Cohorts", "cohorts.sqlite");
+    for (const char* name : {"bag.plist", "notes.txt", "CustomFeedback/loose-file",
+                             "CustomFeedback/NotAType/record", "Cohorts/cohorts.sqlite"}) {
+      makeFile(cache(), name);
+    }
   }
   std::vector<FeedbackFile> walk(std::vector<std::string> filter = {}, RandomChoice choose = {}) {
-    auto e = choose ? FeedbackEnumerator::make(env.assembly(), filter, choose)
-                    : FeedbackEnumerator::make(env.assembly(), filter);
-    if (!e) ADD_FAILURE() << "no enumerator";
-    return e ? drain(*e) : std::vector<FeedbackFile>{};
+    return drain(choose ? FeedbackEnumerator::make(env.assembly(), filter, choose)
+                        : FeedbackEnumerator::make(env.assembly(), filter));
   }
-  // The types in the order walked, sessions marked 's' and custom files 'c'.
+  // The kinds in the order walked: 's' for a session, 'c' for custom feedback.
   static std::string kinds(const std::vector<FeedbackFile>& files) {
     std::string out;
     for (const auto& f : files) out += f.fileType == FeedbackFileType::session ? 's' : 'c';
     return out;
   }
 
-  std::set<fs::path> sessions;
-  std::set<fs::path> customs;
+  std::set<fs::path> sessions, customs;
 };
 
 TEST_F(FeedbackWalk, YieldsEverySessionAndCustomFileOnceAndSkipsBystanders) {
   populate();
   auto e = FeedbackEnumerator::make(env.assembly());
   ASSERT_TRUE(e);
-  auto files = drain(*e);
   std::multiset<fs::path> found, expected(sessions.begin(), sessions.end());
   expected.insert(customs.begin(), customs.end());
-  for (const auto& f : files) {
-    found.insert(f.fileURL);
-    EXPECT_EQ(f.fileType,
-              sessions.count(f.fileURL) ? FeedbackFileType::session : FeedbackFileType::custom);
-    ASSERT_TRUE(f.attributes);
-    EXPECT_EQ(f.attributes->size, 1u);
+  while (auto f = e->next()) {
+    found.insert(f->fileURL);
+    EXPECT_EQ(f->fileType == FeedbackFileType::session, sessions.count(f->fileURL) == 1);
+    EXPECT_EQ(f->attributes.value().size, 1u);
   }
   EXPECT_EQ(found, expected);
   EXPECT_EQ(e->pendingDirectoryCount(), 0u);
-  for (int i = 0; i < 2; ++i) EXPECT_FALSE(e->next());
-
-  EXPECT_TRUE(
-      logs.contains("Feedback enumerator found " + (custom("Usage") / "record-0").string()));
-  for (const char* bystander : {"notes.txt", "bag.plist"}) {
-    EXPECT_TRUE(logs.contains("Feedback enumerator skipped " + (cache() / bystander).string()));
-    EXPECT_TRUE(fs::exists(cache() / bystander));
-  }
-  EXPECT_TRUE(fs::exists(custom("NotAType") / "record"));
-  EXPECT_EQ(logs.count("NotAType"), 0u);
-  EXPECT_EQ(logs.count("cohorts.sqlite"), 0u);
-}
-
-TEST_F(FeedbackWalk, AnEmptyOrFinishedWalkYieldsNothing) {
-  auto empty = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(empty);
-  EXPECT_FALSE(empty->next());
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  ASSERT_TRUE(e->next());
+  EXPECT_FALSE(e->next());
   e->finish();
   EXPECT_FALSE(e->next());
+  EXPECT_TRUE(logs.contains("Feedback enumerator found " + (custom("Usage") / "r0").string()));
+  EXPECT_TRUE(logs.contains("Feedback enumerator skipped " + (cache() / "notes.txt").string()));
+  EXPECT_EQ(logs.count("NotAType"), 0u);
+  EXPECT_EQ(logs.count("cohorts.sqlite"), 0u);
 }
 
 TEST_F(FeedbackWalk, EachCallDrawsAmongTheDirectoriesStillOpen) {
   populate();
   std::vector<size_t> counts;
-  // Always the first directory: the cache directory is walked to its end
-  // before any custom feedback directory.
+  // Always the first: the cache directory is walked to its end first.
   auto first = walk({}, [&](size_t n) {
     counts.push_back(n);
     return size_t{0};
@@ -139,32 +107,59 @@ TEST_F(FeedbackWalk, EachCallDrawsAmongTheDirectoriesStillOpen) {
   EXPECT_EQ(counts.front(), 4u);
   EXPECT_TRUE(std::is_sorted(counts.rbegin(), counts.rend()));
   EXPECT_EQ(counts.back(), 2u);
-
   // Always the last: custom feedback first.
   EXPECT_EQ(kinds(walk({}, [](size_t n) { return n - 1; })),
             std::string(customs.size(), 'c') + std::string(sessions.size(), 's'));
-}
-
-TEST_F(FeedbackWalk, TheSystemDrawInterleavesDirectories) {
-  // With two directories of 40 files each, keeping one directory's files
-  // together by chance has a probability of 2^-39.
-  for (unsigned i = 0; i < 40; ++i) {
-    session(S::closed, i);
-    makeFile(custom("Usage"), "r" + std::to_string(i));
-  }
-  auto files = walk();
-  ASSERT_EQ(files.size(), 80u);
-  std::string order = kinds(files);
-  EXPECT_NE(order, std::string(40, 's') + std::string(40, 'c'));
-  EXPECT_NE(order, std::string(40, 'c') + std::string(40, 's'));
-}
-
-TEST_F(FeedbackWalk, ATypeFilterWalksOnlyThoseCustomDirectories) {
-  populate();
+  // A type filter walks only those custom directories.
   std::multiset<std::string> types;
   for (const auto& f : walk({"Usage", "UserReport"})) types.insert(f.typeString());
   EXPECT_EQ(types, (std::multiset<std::string>{"Usage", "Usage", "UserReport", "UserReport"}));
   EXPECT_TRUE(walk({"NotAType", "usage"}).empty());
+}
+
+TEST_F(FeedbackWalk, TheSystemDrawInterleavesDirectories) {
+  // Keeping one directory's 40 files together by chance has a probability of 2^-39.
+  for (unsigned i = 0; i < 40; ++i) {
+    session(S::closed, i);
+    makeFile(custom("Usage"), "r" + std::to_string(i));
+  }
+  std::string order = kinds(walk());
+  ASSERT_EQ(order.size(), 80u);
+  EXPECT_NE(order, std::string(40, 's') + std::string(40, 'c'));
+  EXPECT_NE(order, std::string(40, 'c') + std::string(40, 's'));
+}
+
+TEST_F(FeedbackWalk, FilesAndDirectoriesRemovedMidWalkAreNotYielded) {
+  for (unsigned i = 0; i < 3; ++i) makeFile(custom("Usage"), "u" + std::to_string(i));
+  std::vector<fs::path> files;
+  for (unsigned i = 0; i < 6; ++i) files.push_back(session(S::closed, i));
+  // Custom feedback first, so the Usage walk is under way when it goes.
+  auto e = FeedbackEnumerator::make(fm(), {}, [](size_t n) { return n - 1; });
+  ASSERT_TRUE(e);
+  ASSERT_EQ(e->next().value().typeString(), "Usage");
+  fs::remove_all(custom("Usage"));
+  for (unsigned i = 0; i < 6; i += 2) fs::remove(files[i]);
+  auto rest = drain(std::move(e));
+  for (const auto& f : rest) EXPECT_TRUE(fs::exists(f.fileURL)) << f.fileURL;
+  EXPECT_EQ(rest.size(), 3u);
+}
+
+TEST_F(FeedbackWalk, OddNamesAreParsedSafely) {
+  std::string longSession = sessionName(S::closed, 1) + ".";
+  longSession.append(255 - longSession.size(), 'z');
+  const std::string longCustom(255, 'c'), notes = "notes \n\xff.txt", report = "report \n\xff";
+  for (const auto& name :
+       {longSession, sessionName(S::closed, 2) + " copy", sessionName(S::closed, 3) + "\n",
+        "session.\xff." + uuidString(4) + ".closed", notes, "CustomFeedback/Usage/" + longCustom,
+        "CustomFeedback/Usage/" + report}) {
+    makeFile(cache(), name);
+  }
+  vireon_cleanup(fm(), env.clock->now());
+  // The three unparseable session names went; everything else stayed.
+  EXPECT_EQ(entryNames(cache()), (std::vector<std::string>{"CustomFeedback", notes, longSession}));
+  std::set<std::string> names;
+  for (const auto& f : walk()) names.insert(f.fileName());
+  EXPECT_EQ(names, (std::set<std::string>{longSession, longCustom, report}));
 }
 
 }  // namespace

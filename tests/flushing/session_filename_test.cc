@@ -5,8 +5,6 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <functional>
-
 namespace fbf {
 namespace {
 
@@ -97,33 +95,6 @@ TEST(SessionNameGrammar, MalformedAndHostileNamesAreRejected) {
       // overlong
       std::string(255, '.'), "session." + std::string(247, '9'), manyPieces};
   for (const auto& text : rejected) EXPECT_FALSE(SessionFilename::fromString(text)) << text;
-}
-
-TEST(SessionNameGrammar, NamesAreEqualOnlyWhenAllFiveFieldsAre) {
-  auto a = SessionFilename::fromString(named("session.1.", ".closed"));
-  ASSERT_TRUE(a);
-  EXPECT_EQ(*a, *SessionFilename::fromString(named("session.1.", ".closed")));
-  const std::function<void(SessionFilename&)> changes[] = {
-      [](auto& n) { n.uploadPending = true; }, [](auto& n) { n.uploadFormat = F::pb; },
-      [](auto& n) { n.processID = 2; }, [](auto& n) { n.state = S::processing; },
-      [](auto& n) { n.sessionID[7] ^= 1; }};
-  for (const auto& change : changes) {
-    auto b = *a;
-    change(b);
-    EXPECT_NE(*a, b);
-  }
-}
-
-TEST(SessionNameGrammar, StatesAndFormatsRoundTripThroughTheirStrings) {
-  for (auto s : {S::open, S::closed, S::processing, S::uploaded}) {
-    EXPECT_EQ(sessionFileStateFromString(toString(s)), s);
-  }
-  EXPECT_FALSE(sessionFileStateFromString("CLOSED"));
-  EXPECT_EQ(uploadFormatFromString("json"), F::json);
-  EXPECT_EQ(uploadFormatFromString("pb"), F::pb);
-  EXPECT_FALSE(uploadFormatFromString("JSON"));
-  EXPECT_EQ(queryParameterString(F::json), "FeedbackV2");
-  EXPECT_EQ(queryParameterString(F::pb), "FeedbackV2PB");
 }
 
 // Guards against: new sessions sharing an ID, or named for another process.
