@@ -38,8 +38,6 @@ class FakeHttpSession final : public HttpClientSession {
   bool invalidated = false;
 };
 
-std::string queryOf(const HttpRequest& r) { return r.url.substr(r.url.find('?') + 1); }
-
 corevireon::CVClientSession sampleSession() {
   corevireon::CVClientSession session;
   session.set_agent("Wayfin/17.0");
@@ -84,44 +82,32 @@ class UploadManagerTest : public ::testing::Test, public UploadManagerDelegate {
 
 // Guards against: an upload request the server would refuse or misfile: wrong
 // query items or order, headers, timeout or cache policy.
-using UploadRequestFormation = UploadManagerTest;
-
-TEST_F(UploadRequestFormation, NormalProtobufRequestCarriesTheFixedItemsAndHeaders) {
-  auto r = requestFor("FeedbackV2PB", {[] { return true; }, [] { return false; }});
+TEST_F(UploadManagerTest, RequestsCarryTheirItemsInNameOrderAndTheRightHeaders) {
+  auto yes = [] { return true; };
+  auto no = [] { return false; };
+  auto r = requestFor("FeedbackV2PB", {yes, no});
   EXPECT_EQ(r.url, "https://h.example/u?key=galleon5290&seed=1&type=FeedbackV2PB&v=2");
   EXPECT_EQ(r.method, "POST");
   EXPECT_EQ(r.timeout, 600s);
   EXPECT_TRUE(r.ignoreLocalCache);
   EXPECT_EQ(r.header("User-Agent"), "vireond/1.0 (TestBox1,1; TestOS 1.0 1A100) vireon-fbf/test");
   EXPECT_EQ(r.header("Content-Encoding"), "deflate");
-}
-
-TEST_F(UploadRequestFormation, OptionalAndDebugItemsSortIntoPlace) {
-  auto yes = [] { return true; };
-  auto no = [] { return false; };
-  EXPECT_EQ(queryOf(requestFor("", {no, no})), "key=galleon5290&v=2");
-  EXPECT_NE(queryOf(requestFor("FeedbackV2")).find("seed=1"), std::string::npos);  // default
+  EXPECT_EQ(requestFor("", {no, no}).url, "https://h.example/u?key=galleon5290&v=2");
+  EXPECT_NE(requestFor("FeedbackV2").url.find("seed=1"), std::string::npos);  // default
   env.assembly().setFlushingEagerly(true);
-  EXPECT_EQ(queryOf(requestFor("FeedbackV2PB", {yes, yes})),
-            "internal=1&key=galleon5290&realtime=1&seed=1&type=FeedbackV2PB&v=2");
+  EXPECT_EQ(requestFor("Usage", {yes, yes}).url,
+            "https://h.example/u?internal=1&key=galleon5290&realtime=1&seed=1&type=Usage&v=2");
   env.assembly().setFlushingEagerly(false);
-  env.defaults().setObject(FBFStrings::Defaults::DebugQueryParameters, "v=3&foo&a=b=c&x=");
-  EXPECT_EQ(queryOf(requestFor("FeedbackV2PB", {yes, no})),
-            "key=galleon5290&seed=1&type=FeedbackV2PB&v=3");
-  EXPECT_EQ(UploadManager::debugQueryItems("&&key=other&&seed=0"),
-            (std::vector<QueryItem>{{"key", "other"}, {"seed", "0"}}));
-  EXPECT_EQ(UploadManager::debugQueryItems("=b&a=&"), std::vector<QueryItem>{});
-}
+  env.defaults().setObject(FBFStrings::Defaults::DebugQueryParameters,
+                           "v=3&foo&a=b=c&x=&=b&&seed=0");
+  EXPECT_EQ(requestFor("Usage", {yes, no}).url,
+            "https://h.example/u?key=galleon5290&seed=0&type=Usage&v=3");
 
-TEST_F(UploadRequestFormation, ContentTypeIsAsymmetricByDesignAndBadEndpointsAreRefused) {
+  const std::pair<const char*, bool> protobufTypes[] = {
+      {"FeedbackV2PB", true}, {"feedbackv2pb", false},  {"Usage", true},      {"usage", true},
+      {"USERREPORT", true},   {"Crowdsourcing", false}, {"FeedbackV2", false}};
   auto m = makeManager();
-  for (auto [type, protobuf] : std::vector<std::pair<std::string, bool>>{{"FeedbackV2PB", true},
-                                                                         {"feedbackv2pb", false},
-                                                                         {"Usage", true},
-                                                                         {"usage", true},
-                                                                         {"USERREPORT", true},
-                                                                         {"Crowdsourcing", false},
-                                                                         {"FeedbackV2", false}}) {
+  for (auto [type, protobuf] : protobufTypes) {
     EXPECT_EQ(m->feedbackUploadRequest("https://h.example/u", type).header("Content-Type"),
               protobuf ? std::optional<std::string>("application/protobuf") : std::nullopt)
         << type;
@@ -165,44 +151,6 @@ TEST_F(UploadPreparation, JSONSessionIsStreamedIntoTheCompressor) {
   EXPECT_NE(request->request.url.find("type=FeedbackV2&"), std::string::npos);
 }
 
-TEST_F(UploadPreparation, EachFailureIsLoggedAndLeavesNoFile) {
-  struct Row {
-    const char* name;
-    std::function<void()> setUp;
-    std::function<bool(UploadManager&)> prepare;
-    const char* log;
-  };
-  nlohmann::ordered_json notText = {{"title", std::string("bad\xFF")}};
-  const Row rows[] = {
-      {"JSON that is not text", [] {},
-       [&](UploadManager& m) { return !!m.uploadJSONFeedback(notText, sessionURL()); }, ""},
-      {"unparseable session name", [] {},
-       [&](UploadManager& m) { return !!m.uploadProtobufFeedback(sampleSession(), cached("x")); },
-       "Error getting temp file."},
-      {"non-http endpoint",
-       [&] {
-         env.writeBag({{"feedback_url", "ftp://h.example/u"}});
-       },
-       [&](UploadManager& m) {
-         EXPECT_FALSE(m.canFormRequest("FeedbackV2PB"));
-         return !!m.uploadProtobufFeedback(sampleSession(), sessionURL());
-       },
-       "feedbackUploadRequest failed because of bad url."},
-      {"no bag", [&] { fs::remove(cached("bag.plist")); },
-       [&](UploadManager& m) { return !!m.uploadProtobufFeedback(sampleSession(), sessionURL()); },
-       "feedback uploader found no upload endpoint from defaults."},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
-    row.setUp();
-    EXPECT_FALSE(row.prepare(*makeManager()));
-    EXPECT_TRUE(logs.contains(row.log));
-    for (const auto& e : fs::directory_iterator(env.cacheDir())) {
-      EXPECT_EQ(e.path().filename(), "bag.plist");
-    }
-  }
-}
-
 TEST_F(UploadPreparation, CustomFeedbackIsCompressedBesideItsSourceForItsEndpoint) {
   auto m = makeManager();
   auto source = cached("CustomFeedback/Crowdsourcing/report-1");
@@ -226,25 +174,36 @@ TEST_F(UploadPreparation, CustomFeedbackIsCompressedBesideItsSourceForItsEndpoin
   EXPECT_EQ(usageRequest->request.header("Content-Type"), "application/protobuf");
 }
 
-TEST_F(UploadPreparation, CustomFeedbackOfAnUnknownTypeWithoutEndpointOrLinkedIsRefused) {
+TEST_F(UploadPreparation, EachRefusalIsLoggedAndLeavesNoUploadFile) {
+  nlohmann::ordered_json notText = {{"title", std::string("bad\xFF")}};
+  EXPECT_FALSE(makeManager()->uploadJSONFeedback(notText, sessionURL()));
+  EXPECT_FALSE(makeManager()->uploadProtobufFeedback(sampleSession(), cached("not-a-session")));
+  EXPECT_TRUE(logs.contains("Error getting temp file."));
   const std::string refused =
       "Feedback endpoint or appropriate type not set, data can't be sent to server.";
-  auto source = cached("CustomFeedback/Mystery/m-1");
-  writeFile(source, "data");
-  EXPECT_FALSE(makeManager()->uploadCustomFeedback(source, "Mystery"));
+  auto mystery = cached("CustomFeedback/Mystery/m-1");
+  writeFile(mystery, "data");
+  EXPECT_FALSE(makeManager()->uploadCustomFeedback(mystery, "Mystery"));
   EXPECT_EQ(logs.count(refused), 1u);
-
-  auto secret = env.temp.path() / "outside";
-  writeFile(secret, "not for upload");
-  auto link = cached("CustomFeedback/UserReport/r-1");
+  auto link = cached("CustomFeedback/UserReport/r-1");  // never read through
+  writeFile(env.temp.path() / "outside", "not for upload");
   fs::create_directories(link.parent_path());
-  fs::create_symlink(secret, link);
+  fs::create_symlink(env.temp.path() / "outside", link);
   EXPECT_FALSE(makeManager()->uploadCustomFeedback(link, "UserReport"));
-  EXPECT_FALSE(fs::exists(cached("CustomFeedback/UserReport/r-1.uploadPending")));
 
+  env.writeBag({{"feedback_url", "ftp://h.example/u"}});
+  auto m = makeManager();
+  EXPECT_FALSE(m->canFormRequest("FeedbackV2PB"));
+  EXPECT_FALSE(m->uploadProtobufFeedback(sampleSession(), sessionURL()));
+  EXPECT_TRUE(logs.contains("feedbackUploadRequest failed because of bad url."));
   fs::remove(cached("bag.plist"));
-  EXPECT_FALSE(makeManager()->uploadCustomFeedback(source, "UserReport"));
+  EXPECT_FALSE(makeManager()->uploadProtobufFeedback(sampleSession(), sessionURL()));
+  EXPECT_TRUE(logs.contains("feedback uploader found no upload endpoint from defaults."));
+  EXPECT_FALSE(makeManager()->uploadCustomFeedback(mystery, "UserReport"));
   EXPECT_EQ(logs.count(refused), 2u);
+  for (const auto& e : fs::recursive_directory_iterator(env.cacheDir())) {
+    EXPECT_TRUE(e.path() == mystery || e.path() == link || e.is_directory()) << e.path();
+  }
 }
 
 // Guards against: an upload file deleted on anything but HTTP 200, kept after
@@ -387,23 +346,15 @@ TEST_F(UploadRetry, AYoungFileIsResentWithoutDigest) {
 
 TEST(UploadAgeRule, IsStrictAndSurvivesAbsurdBagValues) {
   SystemTime t0{};
-  struct Row {
-    const char* name;
-    int64_t days;
-    SystemTime creation, now;
-    bool allowed;
+  auto allows = [&](int64_t days, SystemTime created, SystemTime now) {
+    return FeedbackAgeLimit::fromDays(days).allows(created, now);
   };
-  const Row rows[] = {
-      {"just young enough", 1, t0, t0 + 86399s, true},
-      {"exactly the limit", 1, t0, t0 + 86400s, false},
-      {"from the future", 1, t0 + 10s, t0, true},
-      {"zero days: everything is too old", 0, t0, t0, false},
-      // Too large to count in seconds: no limit rather than a crash.
-      {"overflowing means no limit", INT64_MAX / 1000, t0, t0 + 100000 * 86400s, true},
-  };
-  for (const auto& r : rows) {
-    EXPECT_EQ(FeedbackAgeLimit::fromDays(r.days).allows(r.creation, r.now), r.allowed) << r.name;
-  }
+  EXPECT_TRUE(allows(1, t0, t0 + 86399s));
+  EXPECT_FALSE(allows(1, t0, t0 + 86400s));
+  EXPECT_TRUE(allows(1, t0 + 10s, t0));  // from the future
+  EXPECT_FALSE(allows(0, t0, t0));       // zero days: everything is too old
+  // Too large to count in seconds: no limit rather than a crash.
+  EXPECT_TRUE(allows(INT64_MAX / 1000, t0, t0 + 100000 * 86400s));
 }
 
 }  // namespace
