@@ -1,11 +1,7 @@
-#include "assembly/fbf_assembly.h"
 #include "assembly/feedback_deletion_event.h"
 #include "flushing/flushing_test_util.h"
-#include "platform/analytics.h"
 
 #include <sys/stat.h>
-
-#include <fstream>
 
 using namespace std::chrono_literals;
 
@@ -132,55 +128,6 @@ TEST_F(CacheTest, ALossRecordHasSizeInKibibytesRoundedUpAndAgeTruncated) {
     EXPECT_EQ(event->reason, FeedbackDeletionReason::tooLarge);
   }
   EXPECT_FALSE(FeedbackDeletionEvent::make(cache() / "missing", 2, 1, env.clock->now(), fm()));
-}
-
-// Holds each payload function and hands it to the real sink only when told,
-// as a sink that records lazily would.
-class DeferringSink final : public AnalyticsSink {
- public:
-  explicit DeferringSink(std::unique_ptr<AnalyticsSink> inner) : inner_(std::move(inner)) {}
-  void sendEvent(std::string_view name,
-                 const std::function<std::optional<nlohmann::json>()>& payload) override {
-    held_.emplace_back(std::string(name), payload);
-  }
-  void release() {
-    for (auto& [name, payload] : held_) inner_->sendEvent(name, payload);
-  }
-
- private:
-  std::unique_ptr<AnalyticsSink> inner_;
-  std::vector<std::pair<std::string, std::function<std::optional<nlohmann::json>()>>> held_;
-};
-
-// Guards against: a loss reported with a payload that is not the event's own,
-// computed before the sink asks for it, or written to the analytics file out of order.
-TEST_F(CacheTest, LossesReachTheAnalyticsFileOneLineEachInOrderWhenTheSinkAsks) {
-  auto sink = std::make_shared<DeferringSink>(
-      makeJsonLinesAnalyticsSink(env.dirs.analyticsFile(), fm(), *env.clock));
-  FBFAssemblyDependencies deps;
-  deps.preferences = env.preferences;
-  deps.fileManager = env.fileManager;
-  deps.clock = env.clock;
-  deps.analytics = sink;
-  deps.transactions = env.transactions;
-  deps.deviceContext = std::shared_ptr<DeviceContextProtocol>(
-      const_cast<DeviceContextProtocol*>(&env.assembly().deviceContext()), [](auto*) {});
-  deps.workloop = env.manualQueue;
-  FBFAssembly assembly(std::move(deps));
-
-  assembly.didDeleteFeedbackFile(FeedbackDeletionEvent{11, 1, 2, 8 * 86400});
-  assembly.didDeleteFeedbackFile(FeedbackDeletionEvent{13, 12, 0, -3});
-  EXPECT_FALSE(fs::exists(env.dirs.analyticsFile()));
-  sink->release();
-  std::ifstream in(env.dirs.analyticsFile());
-  std::vector<nlohmann::json> lines;
-  for (std::string line; std::getline(in, line);) lines.push_back(nlohmann::json::parse(line));
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].at("event"), "vireond.feedbackLoss");
-  EXPECT_EQ(lines[0].at("payload"),
-            (nlohmann::json{{"feedbackType", 11}, {"reason", 1}, {"size", 2}, {"age", 8 * 86400}}));
-  EXPECT_EQ(lines[1].at("payload"),
-            (nlohmann::json{{"feedbackType", 13}, {"reason", 12}, {"size", 0}, {"age", -3}}));
 }
 
 }  // namespace

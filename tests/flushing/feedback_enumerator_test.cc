@@ -39,8 +39,8 @@ TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown
 }
 
 // Guards against: a walk that misses, repeats or invents feedback files, reads
-// bystanders, trips over odd names or files removed under it, or keeps one
-// directory's files together.
+// bystanders, trips over files removed under it, or keeps one directory's files
+// together.
 class FeedbackWalk : public CacheTest {
  protected:
   fs::path custom(std::string_view type) { return cache() / "CustomFeedback" / std::string(type); }
@@ -142,24 +142,6 @@ TEST_F(FeedbackWalk, FilesAndDirectoriesRemovedMidWalkAreNotYielded) {
   auto rest = drain(std::move(e));
   for (const auto& f : rest) EXPECT_TRUE(fs::exists(f.fileURL)) << f.fileURL;
   EXPECT_EQ(rest.size(), 3u);
-}
-
-TEST_F(FeedbackWalk, OddNamesAreParsedSafely) {
-  std::string longSession = sessionName(S::closed, 1) + ".";
-  longSession.append(255 - longSession.size(), 'z');
-  const std::string longCustom(255, 'c'), notes = "notes \n\xff.txt", report = "report \n\xff";
-  for (const auto& name :
-       {longSession, sessionName(S::closed, 2) + " copy", sessionName(S::closed, 3) + "\n",
-        "session.\xff." + uuidString(4) + ".closed", notes, "CustomFeedback/Usage/" + longCustom,
-        "CustomFeedback/Usage/" + report}) {
-    makeFile(cache(), name);
-  }
-  vireon_cleanup(fm(), env.clock->now());
-  // The three unparseable session names went; everything else stayed.
-  EXPECT_EQ(entryNames(cache()), (std::vector<std::string>{"CustomFeedback", notes, longSession}));
-  std::set<std::string> names;
-  for (const auto& f : walk()) names.insert(f.fileName());
-  EXPECT_EQ(names, (std::set<std::string>{longSession, longCustom, report}));
 }
 
 }  // namespace

@@ -308,7 +308,7 @@ class UploadRetry : public UploadManagerTest {
   }
 };
 
-TEST_F(UploadRetry, WithoutABagTheLimitIsSevenDays) {
+TEST_F(UploadRetry, AStaleFileIsDroppedAndReportedAYoungOneResentWithoutDigest) {
   fs::remove(cached("bag.plist"));
   auto f = pendingFile();
   retryAt(f, 24h * 6 + 23h);
@@ -328,11 +328,10 @@ TEST_F(UploadRetry, WithoutABagTheLimitIsSevenDays) {
   makeManager()->retryUpload(cached("gone.uploadPending"), "FeedbackV2");
   EXPECT_TRUE(logs.contains("error removing session file"));
   EXPECT_EQ(env.analytics->events().size(), 1u);
-}
 
-TEST_F(UploadRetry, AYoungFileIsResentWithoutDigest) {
+  // With a bag: its limit, and a young file is resent without a digest.
   env.writeBag({{"feedback_url", "https://h.example/u"}, {"feedback_max_age_in_days", 2}});
-  auto f = pendingFile();
+  f = pendingFile();
   retryAt(f, 47h);
   ASSERT_EQ(session().tasks.size(), 1u);
   EXPECT_EQ(session().tasks[0].body, f);
