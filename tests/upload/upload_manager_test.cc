@@ -122,7 +122,7 @@ TEST_F(UploadManagerTest, RequestsCarryTheirItemsInNameOrderAndTheRightHeaders) 
 // leaves a file behind.
 using UploadPreparation = UploadManagerTest;
 
-TEST_F(UploadPreparation, ProtobufSessionIsCompressedIntoItsOwnerOnlyUploadFile) {
+TEST_F(UploadPreparation, SessionsAreCompressedIntoOwnerOnlyUploadFilesWithTheirDigest) {
   env.defaults().setObject(FBFStrings::Defaults::LeaveFeedbackAfterUpload, true);
   auto request = makeManager()->uploadProtobufFeedback(sampleSession(), sessionURL());
   ASSERT_TRUE(request);
@@ -138,11 +138,10 @@ TEST_F(UploadPreparation, ProtobufSessionIsCompressedIntoItsOwnerOnlyUploadFile)
   EXPECT_EQ(env.fileManager->attributes(uploadFile())->mode, 0600u);
   // Kept feedback: a copy of the compressed file beside the session.
   EXPECT_EQ(readFile(cached(std::string(kSessionName) + ".deflate")), compressed);
-}
 
-TEST_F(UploadPreparation, JSONSessionIsStreamedIntoTheCompressor) {
+  // JSON is streamed into the compressor and sent without a Content-Type.
   nlohmann::ordered_json json = {{"user_guid", "x"}, {"feedbacks", {{{"queryId", 1}}}}};
-  auto request = makeManager()->uploadJSONFeedback(json, sessionURL());
+  request = makeManager()->uploadJSONFeedback(json, sessionURL());
   ASSERT_TRUE(request);
   EXPECT_EQ(request->fileURL, cached(std::string(kSessionName) + ".json.uploadPending"));
   EXPECT_EQ(inflateRawIndependently(readFile(request->fileURL)), json.dump());
