@@ -8,8 +8,7 @@ using namespace std::chrono_literals;
 namespace fbf::testing {
 namespace {
 
-// Guards against: a state change that loses contents, overwrites another copy
-// of the session, keeps the upload suffix, or fails without saying why.
+// Guards against: a state change that loses contents or overwrites another copy.
 TEST_F(CacheTest, AStateChangeMovesToThePlainNameOfTheNewStateOrSaysWhyNot) {
   auto closed = makeFile(cache(), sessionName(S::closed, 1), "payload");
   auto upload = session(S::processing, 2, ".pb.uploadPending");
@@ -35,8 +34,7 @@ TEST_F(CacheTest, AStateChangeMovesToThePlainNameOfTheNewStateOrSaysWhyNot) {
   EXPECT_EQ(readFile(cache() / sessionName(S::processing, 1)), "payload");
 }
 
-// Guards against: cache subdirectories readable by others, one failure stopping
-// the other from being made, or anything made without a caches directory.
+// Guards against: cache subdirectories readable by others, or not made at all.
 TEST_F(CacheTest, RequiredSubdirectoriesAreMadeOrRepairedOwnerOnly) {
   fs::create_directories(cache() / "Cohorts");
   chmod((cache() / "Cohorts").c_str(), 0755);
@@ -59,8 +57,7 @@ TEST_F(CacheTest, RequiredSubdirectoriesAreMadeOrRepairedOwnerOnly) {
   EXPECT_FALSE(fs::exists(env.dirs.cacheHome));
 }
 
-// Guards against: custom feedback written where it is never sent, readable by
-// others, or outside its type directory.
+// Guards against: custom feedback written outside its type directory, or readable by others.
 TEST_F(CacheTest, CustomFeedbackLandsOwnerOnlyInItsTypeDirectoryOrNowhere) {
   auto path = persistCustomFeedback(fm(), "cohort bytes", 11, "cohort-1");
   ASSERT_EQ(path, cache() / "CustomFeedback" / "Usage" / "cohort-1");
@@ -85,8 +82,7 @@ TEST_F(CacheTest, CustomFeedbackLandsOwnerOnlyInItsTypeDirectoryOrNowhere) {
   EXPECT_EQ(entryNames(cache() / "CustomFeedback" / "Usage"), std::vector<std::string>{"cohort-1"});
 }
 
-// Guards against: a failed removal going unlogged or reported as done, and
-// uploads left pending retried newest first or mixed with other files.
+// Guards against: a failed removal unlogged, or pending uploads retried newest first.
 TEST_F(CacheTest, RemovalFailuresAreLoggedAndPendingUploadsListedOldestFirst) {
   auto file = makeFile(cache(), "x");
   EXPECT_TRUE(vireon_removeItemOrLogError(fm(), file, "Could not drop x"));
@@ -103,8 +99,7 @@ TEST_F(CacheTest, RemovalFailuresAreLoggedAndPendingUploadsListedOldestFirst) {
   EXPECT_EQ(pending[1].path, newer);
 }
 
-// Guards against: a loss record with the wrong size or age, or one sent for an
-// unknown type or a file that is already gone.
+// Guards against: a loss record with the wrong size or age, or one for an unknown type.
 TEST_F(CacheTest, ALossRecordHasSizeInKibibytesRoundedUpAndAgeTruncated) {
   struct Row {
     size_t bytes;

@@ -13,8 +13,7 @@ using namespace std::chrono_literals;
 namespace fbf::testing {
 namespace {
 
-// Guards against: an open session closed before its writer can have died, a
-// crashed writer's file left open for ever, or cleanup touching what is not its own.
+// Guards against: an open session closed too early or never, or cleanup touching others.
 using CleanupAfterCrashedWriters = CacheTest;
 
 TEST_F(CleanupAfterCrashedWriters, AnOpenFileIsClosedOnlyPastHalfAnHour) {
@@ -72,12 +71,11 @@ TEST_F(CleanupAfterCrashedWriters, OnlyUnparseableSessionNamesGoAndNoCopyIsRepla
   EXPECT_TRUE(fs::exists(cache() / "CustomFeedback" / "Usage" / "session.junk"));
 }
 
-// Guards against: an overfull cache pruned at or below its limit, cut to the
-// wrong size, the newest files dropped instead of the oldest, or files that are
-// not sessions counted or removed. Files are made in the order of their UUIDs,
-// so the oldest are also the first by name (creation times often tie).
+// Guards against: an overfull cache pruned at its limit, to the wrong size, or newest first.
 class OverfullSessionDirectory : public CacheTest {
  protected:
+  // Made in the order of their UUIDs, so the oldest are also the first by name
+  // (creation times are coarse and often tie).
   std::vector<fs::path> fill(unsigned count) {
     std::vector<fs::path> files;
     for (unsigned i = 0; i < count; ++i)
@@ -130,8 +128,7 @@ TEST_F(OverfullSessionDirectory, EachFileIsAnnouncedWhileItExistsAndAVanishedOne
   expectOldestRemoved(files, 4);
 }
 
-// Guards against: a link, FIFO, directory or another user's file in the cache
-// being followed, opened, renamed, removed or sent.
+// Guards against: a link, FIFO, directory or foreign file followed, opened, moved or sent.
 TEST_F(CacheTest, EntriesThatAreNotOwnedRegularFilesAreNeverTouched) {
   auto secret = makeFile(env.temp.path(), "private-key", "secret");
   auto closedLink = cache() / sessionName(S::closed, 1);
@@ -165,8 +162,7 @@ TEST_F(CacheTest, EntriesThatAreNotOwnedRegularFilesAreNeverTouched) {
   EXPECT_TRUE(logs.contains("Feedback enumerator skipped " + closedLink.string()));
 }
 
-// Guards against: sessions lost or sent twice after a kill, and a crash loop on
-// one bad session (start-up recovery of what an earlier run left half-way).
+// Guards against: sessions lost or sent twice after a kill, or a crash loop on one session.
 using SessionRecovery = CacheTest;
 
 TEST_F(SessionRecovery, EachLeftoverEndsInTheRightState) {

@@ -5,8 +5,7 @@
 namespace fbf::testing {
 namespace {
 
-// Guards against: a file sent under the wrong type, or a session file inside a
-// custom directory taken for custom feedback.
+// Guards against: a file sent under the wrong type.
 TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown) {
   using T = FeedbackFileType;
   struct Row {
@@ -38,9 +37,7 @@ TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown
   EXPECT_EQ(FeedbackFile(custom + "Usage/u-1").fileName(), "u-1");
 }
 
-// Guards against: a walk that misses, repeats or invents feedback files, reads
-// bystanders, trips over files removed under it, or keeps one directory's files
-// together.
+// Guards against: a walk that misses, repeats or invents files, or never interleaves.
 class FeedbackWalk : public CacheTest {
  protected:
   fs::path custom(std::string_view type) { return cache() / "CustomFeedback" / std::string(type); }

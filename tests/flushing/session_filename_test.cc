@@ -1,5 +1,4 @@
-// Guards against: a session file name parsed into the wrong fields, a malformed
-// or hostile one accepted, or a name that does not parse back to what wrote it.
+// Guards against: a session name parsed into the wrong fields, or a malformed one accepted.
 #include "flushing/session_filename.h"
 
 #include <gtest/gtest.h>

@@ -18,9 +18,7 @@ long writeString(OutputStream& s, const std::string& text) {
   return s.write(reinterpret_cast<const uint8_t*>(text.data()), text.size());
 }
 
-// Guards against: an upload body that does not inflate to the payload, a digest
-// or byte count the server would reject, or writes accepted once the stream is
-// closed or its encoder failed.
+// Guards against: an upload body or digest the server would reject, or writes taken after close.
 class CompressedStream : public ::testing::Test {
  protected:
   void SetUp() override { stream.open(); }
@@ -86,6 +84,7 @@ TEST_F(CompressedStream, AnImpossibleLengthStopsTheProcess) {
   EXPECT_DEATH(stream.write(&byte, size_t{1} << 33), "write length out of range");
 }
 
+// Guards against: a stream whose encoder failed accepting data or hiding the error.
 TEST(CompressedStreamWhoseEncoderFailed, RefusesWritesReportsAnErrorAndStillCloses) {
   auto out = std::make_shared<MemoryOutputStream>();
   auto stream = CompressedOutputStream::withUnavailableEncoder(out);
@@ -116,8 +115,7 @@ TEST(FileStreamOnABadDescriptor, ReportsTheErrorOnOpen) {
   EXPECT_EQ(writeString(bad, "x"), -1);
 }
 
-// Guards against: JSON streamed in chunks larger than the buffer, or bytes lost
-// or digested twice on the way from the serialiser to the compressor.
+// Guards against: JSON bytes lost or digested twice on their way to the compressor.
 TEST(JSONStreamedThroughTheStreamBuffer, ArrivesInSmallWritesWithThePlainDigest) {
   nlohmann::ordered_json session = {{"user_guid", "8E3B4C1A"},
                                     {"feedbacks", nlohmann::json::array()}};

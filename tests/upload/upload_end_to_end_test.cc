@@ -153,9 +153,7 @@ class UploadToIngest : public ::testing::Test, public UploadManagerDelegate {
   std::vector<std::pair<fs::path, long>> delegateCalls;
 };
 
-// Guards against: a payload the receiver cannot decode or verify, a file kept
-// after HTTP 200 or deleted after any other status, a retry sent with a digest
-// it never computed, or a stale retry sent at all (all through real HTTPS).
+// Guards against: a payload kept after HTTP 200, lost after any other, or retried stale.
 TEST_F(UploadToIngest, OnlyAcceptedUploadsAreDeletedAndEachArrivesWhole) {
   Ingest ingest({"--status", "201", "204", "500", "200"});
   ASSERT_TRUE(ingest.running());
@@ -242,8 +240,7 @@ TEST_F(UploadToIngest, OnlyAcceptedUploadsAreDeletedAndEachArrivesWhole) {
   EXPECT_EQ(ingest.records().size(), 6u);
 }
 
-// Guards against: feedback sent to a server whose key is not pinned or whose
-// certificate is not trusted.
+// Guards against: feedback sent to a server with an unpinned key or untrusted certificate.
 TEST_F(UploadToIngest, AnUnpinnedOrUntrustedServerGetsNothing) {
   Ingest ingest({});
   ASSERT_TRUE(ingest.running());

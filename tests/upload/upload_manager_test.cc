@@ -80,8 +80,7 @@ class UploadManagerTest : public ::testing::Test, public UploadManagerDelegate {
   std::vector<std::pair<fs::path, long>> calls;
 };
 
-// Guards against: an upload request the server would refuse or misfile: wrong
-// query items or order, headers, timeout or cache policy.
+// Guards against: an upload request with wrong query items, order or headers.
 TEST_F(UploadManagerTest, RequestsCarryTheirItemsInNameOrderAndTheRightHeaders) {
   auto yes = [] { return true; };
   auto no = [] { return false; };
@@ -117,9 +116,7 @@ TEST_F(UploadManagerTest, RequestsCarryTheirItemsInNameOrderAndTheRightHeaders) 
   }
 }
 
-// Guards against: an upload file that does not hold the payload, a digest that
-// does not match it, a file readable by others, or a failed preparation that
-// leaves a file behind.
+// Guards against: an upload file that does not hold the payload, or one left after a refusal.
 using UploadPreparation = UploadManagerTest;
 
 TEST_F(UploadPreparation, SessionsAreCompressedIntoOwnerOnlyUploadFilesWithTheirDigest) {
@@ -205,9 +202,7 @@ TEST_F(UploadPreparation, EachRefusalIsLoggedAndLeavesNoUploadFile) {
   }
 }
 
-// Guards against: an upload file deleted on anything but HTTP 200, kept after
-// it, a flush not cancelled when offline (or cancelled when not), and outcomes
-// unreported or misreported.
+// Guards against: a file deleted on anything but HTTP 200, or a wrong offline verdict.
 using UploadOutcome = UploadManagerTest;
 
 TEST_F(UploadOutcome, OnlyStatus200DeletesTheFileAndOnlyOfflineErrorsCancel) {
@@ -292,8 +287,7 @@ TEST_F(UploadOutcome, CompletionsAfterTheManagerIsGoneStillApplyTheRules) {
   EXPECT_TRUE(calls.empty());
 }
 
-// Guards against: a stale upload retried past its age limit (or dropped before
-// it) or dropped unreported, or a retry that claims a digest it never computed.
+// Guards against: a stale upload retried, or a young one dropped or resent with a digest.
 class UploadRetry : public UploadManagerTest {
  protected:
   fs::path pendingFile() {
@@ -342,6 +336,7 @@ TEST_F(UploadRetry, AStaleFileIsDroppedAndReportedAYoungOneResentWithoutDigest) 
   EXPECT_FALSE(fs::exists(f));
 }
 
+// Guards against: an age limit that is not strict, or a huge bag value that overflows.
 TEST(UploadAgeRule, IsStrictAndSurvivesAbsurdBagValues) {
   SystemTime t0{};
   auto allows = [&](int64_t days, SystemTime created, SystemTime now) {

@@ -7,8 +7,7 @@
 namespace fbf {
 namespace {
 
-// Guards against: a request URL whose query is unsorted, wrongly encoded, or
-// where defaults beat the endpoint's items or forced items lose to either.
+// Guards against: a request URL whose query is unsorted, misencoded or wrongly merged.
 TEST(RequestBuilderQuery, EndpointDefaultsAndForcedItemsMergeIntoOneSortedQuery) {
   struct Row {
     const char* name;
@@ -88,8 +87,7 @@ TEST(RequestBuilderDefaultsAndForces, FollowTheirSemanticsForItemsAndHeaders) {
   EXPECT_FALSE(request.ignoreLocalCache);
 }
 
-// Guards against: feedback sent over a scheme other than http(s), or a broken
-// endpoint built into a request instead of stopping the process.
+// Guards against: a request built for a non-http(s) or unparseable endpoint.
 TEST(RequestBuilderOnABadEndpoint, LogsAndThrowsOrStops) {
   for (const char* url : {"ftp://h.example/p", "h.example/p", "/a/path", "HTTPS://h.example/p"}) {
     testing::LogCapture logs;
