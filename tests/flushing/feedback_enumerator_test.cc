@@ -1,218 +1,144 @@
-#include "flushing/feedback_enumerator.h"
 #include "flushing/flushing_test_util.h"
-#include "support/test_support.h"
 
-#include <gtest/gtest.h>
-
-#include <map>
 #include <set>
 
 namespace fbf::testing {
 namespace {
 
+// Guards against: a file sent under the wrong type.
 TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown) {
-  FeedbackFile session("/c/vireond/" + sessionName(SessionFileState::closed, 1));
-  EXPECT_EQ(session.fileType, FeedbackFileType::session);
-  ASSERT_TRUE(session.sessionFilename);
-  EXPECT_EQ(session.sessionFilename->state, SessionFileState::closed);
-  EXPECT_EQ(session.typeString(), "FeedbackV2");
-  EXPECT_EQ(session.knownFeedbackType(), 12);
-  EXPECT_FALSE(session.uploadPending());
-  EXPECT_EQ(session.enclosingDirectory(), "vireond");
-
-  FeedbackFile pending("/c/vireond/" + sessionName(SessionFileState::processing, 1) +
-                       ".pb.uploadPending");
-  EXPECT_EQ(pending.typeString(), "FeedbackV2PB");
-  EXPECT_EQ(pending.knownFeedbackType(), 13);
-  EXPECT_TRUE(pending.uploadPending());
-
-  FeedbackFile custom("/c/vireond/CustomFeedback/UserReport/report-1");
-  EXPECT_EQ(custom.fileType, FeedbackFileType::custom);
-  EXPECT_FALSE(custom.sessionFilename);
-  EXPECT_EQ(custom.typeString(), "UserReport");
-  EXPECT_EQ(custom.knownFeedbackType(), 10);
-  EXPECT_EQ(custom.fileName(), "report-1");
-
-  FeedbackFile sessionInCustom("/c/vireond/CustomFeedback/Usage/" +
-                               sessionName(SessionFileState::closed, 2));
-  EXPECT_EQ(sessionInCustom.fileType, FeedbackFileType::session);
-
-  FeedbackFile unknown("/c/vireond/notes.txt");
-  EXPECT_EQ(unknown.fileType, FeedbackFileType::unknown);
-  EXPECT_EQ(unknown.typeString(), "");
-  EXPECT_EQ(unknown.knownFeedbackType(), 0);
-
-  EXPECT_EQ(FeedbackFile("/c/vireond/CustomFeedback/usage/x").fileType, FeedbackFileType::unknown);
+  using T = FeedbackFileType;
+  struct Row {
+    std::string path;
+    T type;
+    std::string typeString;
+    int known;
+    bool pending = false;
+  };
+  const std::string custom = "/c/vireond/CustomFeedback/";
+  const Row rows[] = {
+      {"/c/vireond/" + sessionName(S::closed, 1), T::session, "FeedbackV2", 12},
+      {"/c/" + sessionName(S::processing, 1) + ".pb.uploadPending", T::session, "FeedbackV2PB", 13,
+       true},
+      {custom + "UserReport/report-1", T::custom, "UserReport", 10},
+      {custom + "Usage/u.uploadPending", T::custom, "Usage", 11, true},
+      {custom + "Usage/" + sessionName(S::closed, 2), T::session, "FeedbackV2", 12},
+      {"/c/vireond/notes.txt", T::unknown, "", 0},
+      {custom + "usage/x", T::unknown, "", 0},  // type names are case-sensitive
+  };
+  for (const auto& row : rows) {
+    FeedbackFile file(row.path);
+    EXPECT_EQ(file.fileType, row.type) << row.path;
+    EXPECT_EQ(file.sessionFilename.has_value(), row.type == T::session) << row.path;
+    EXPECT_EQ(file.typeString(), row.typeString) << row.path;
+    EXPECT_EQ(file.knownFeedbackType(), row.known) << row.path;
+    EXPECT_EQ(file.uploadPending(), row.pending) << row.path;
+  }
+  EXPECT_EQ(FeedbackFile(custom + "Usage/u-1").fileName(), "u-1");
 }
 
-// A cache directory holding session files, custom feedback of a few types
-// and the usual bystanders.
-class FeedbackWalk : public ::testing::Test {
+// Guards against: a walk that misses, repeats or invents files, or never interleaves.
+class FeedbackWalk : public CacheTest {
  protected:
-  fs::path custom(std::string_view type) {
-    return env.cacheDir() / "CustomFeedback" / std::string(type);
-  }
+  fs::path custom(std::string_view type) { return cache() / "CustomFeedback" / std::string(type); }
   void populate() {
-    for (unsigned i = 0; i < 20; ++i)
-      sessions.insert(makeFile(env.cacheDir(), sessionName(SessionFileState::closed, i)));
-    sessions.insert(makeFile(env.cacheDir(),
-                             sessionName(SessionFileState::processing, 99) + ".pb.uploadPending"));
+    for (unsigned i = 0; i < 6; ++i) sessions.insert(session(S::closed, i));
+    sessions.insert(session(S::processing, 99, ".pb.uploadPending"));
     for (std::string_view type : {"Usage", "UserReport", "Crowdsourcing"}) {
-      for (unsigned i = 0; i < 5; ++i)
-        customs.insert(makeFile(custom(type), "record-" + std::to_string(i)));
+      for (unsigned i = 0; i < 2; ++i)
+        customs.insert(makeFile(custom(type), "r" + std::to_string(i)));
     }
-    makeFile(env.cacheDir(), "bag.plist");
-    makeFile(env.cacheDir(), "notes.txt");
-    makeFile(env.cacheDir() / "CustomFeedback", "loose-file");
-    makeFile(env.cacheDir() / "CustomFeedback" / "NotAType", "record");
-    makeFile(env.cacheDir() / "Cohorts", "cohorts.sqlite");
+    for (const char* name : {"bag.plist", "notes.txt", "CustomFeedback/loose-file",
+                             "CustomFeedback/NotAType/record", "Cohorts/cohorts.sqlite"}) {
+      makeFile(cache(), name);
+    }
   }
-  std::vector<FeedbackFile> drain(FeedbackEnumerator& e) {
-    std::vector<FeedbackFile> out;
-    while (auto f = e.next()) out.push_back(std::move(*f));
-    return out;
+  std::vector<FeedbackFile> walk(std::vector<std::string> filter = {}, RandomChoice choose = {}) {
+    return drain(choose ? FeedbackEnumerator::make(env.assembly(), filter, choose)
+                        : FeedbackEnumerator::make(env.assembly(), filter));
   }
-  static std::multiset<fs::path> paths(const std::vector<FeedbackFile>& files) {
-    std::multiset<fs::path> out;
-    for (const auto& f : files) out.insert(f.fileURL);
+  // The kinds in the order walked: 's' for a session, 'c' for custom feedback.
+  static std::string kinds(const std::vector<FeedbackFile>& files) {
+    std::string out;
+    for (const auto& f : files) out += f.fileType == FeedbackFileType::session ? 's' : 'c';
     return out;
   }
 
-  TestEnvironment env;
-  LogCapture logs;
-  std::set<fs::path> sessions;
-  std::set<fs::path> customs;
+  std::set<fs::path> sessions, customs;
 };
 
-TEST_F(FeedbackWalk, YieldsEverySessionAndCustomFileExactlyOnce) {
+TEST_F(FeedbackWalk, YieldsEverySessionAndCustomFileOnceAndSkipsBystanders) {
   populate();
   auto e = FeedbackEnumerator::make(env.assembly());
   ASSERT_TRUE(e);
-  auto files = drain(*e);
-  std::multiset<fs::path> expected(sessions.begin(), sessions.end());
+  std::multiset<fs::path> found, expected(sessions.begin(), sessions.end());
   expected.insert(customs.begin(), customs.end());
-  EXPECT_EQ(paths(files), expected);
-  for (const auto& f : files) {
-    EXPECT_EQ(f.fileType,
-              sessions.count(f.fileURL) ? FeedbackFileType::session : FeedbackFileType::custom);
-    ASSERT_TRUE(f.attributes);
-    EXPECT_EQ(f.attributes->size, 1u);
+  while (auto f = e->next()) {
+    found.insert(f->fileURL);
+    EXPECT_EQ(f->fileType == FeedbackFileType::session, sessions.count(f->fileURL) == 1);
+    EXPECT_EQ(f->attributes.value().size, 1u);
   }
-  EXPECT_TRUE(
-      logs.contains("Feedback enumerator found " + (custom("Usage") / "record-0").string()));
-}
-
-TEST_F(FeedbackWalk, BystandersAreSkippedWithAMessageAndLeftInPlace) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  drain(*e);
-  EXPECT_TRUE(
-      logs.contains("Feedback enumerator skipped " + (env.cacheDir() / "notes.txt").string()));
-  EXPECT_TRUE(
-      logs.contains("Feedback enumerator skipped " + (env.cacheDir() / "bag.plist").string()));
-  EXPECT_TRUE(fs::exists(env.cacheDir() / "notes.txt"));
-  EXPECT_TRUE(fs::exists(env.cacheDir() / "CustomFeedback" / "NotAType" / "record"));
-  EXPECT_EQ(logs.count("NotAType"), 0u);
-  EXPECT_EQ(logs.count("cohorts.sqlite"), 0u);
-}
-
-TEST_F(FeedbackWalk, OnceExhaustedItStaysExhausted) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  drain(*e);
+  EXPECT_EQ(found, expected);
   EXPECT_EQ(e->pendingDirectoryCount(), 0u);
-  for (int i = 0; i < 3; ++i) EXPECT_FALSE(e->next());
-}
-
-TEST_F(FeedbackWalk, EmptyCacheYieldsNothing) {
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
   EXPECT_FALSE(e->next());
-}
-
-TEST_F(FeedbackWalk, FinishingEarlyEndsTheWalk) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  ASSERT_TRUE(e->next());
   e->finish();
   EXPECT_FALSE(e->next());
-}
-
-TEST_F(FeedbackWalk, NoEnumeratorWithoutACachesDirectory) {
-  fs::remove_all(env.dirs.cacheHome);
-  EXPECT_FALSE(FeedbackEnumerator::make(env.assembly()));
+  EXPECT_TRUE(logs.contains("Feedback enumerator found " + (custom("Usage") / "r0").string()));
+  EXPECT_TRUE(logs.contains("Feedback enumerator skipped " + (cache() / "notes.txt").string()));
+  EXPECT_EQ(logs.count("NotAType"), 0u);
+  EXPECT_EQ(logs.count("cohorts.sqlite"), 0u);
 }
 
 TEST_F(FeedbackWalk, EachCallDrawsAmongTheDirectoriesStillOpen) {
   populate();
   std::vector<size_t> counts;
-  // Always the first directory: the cache directory is walked to its end
-  // before any custom feedback directory.
-  auto first = FeedbackEnumerator::make(env.assembly(), {}, [&](size_t n) {
+  // Always the first: the cache directory is walked to its end first.
+  auto first = walk({}, [&](size_t n) {
     counts.push_back(n);
     return size_t{0};
   });
-  ASSERT_TRUE(first);
-  auto files = drain(*first);
-  ASSERT_EQ(files.size(), sessions.size() + customs.size());
-  for (size_t i = 0; i < files.size(); ++i) {
-    EXPECT_EQ(files[i].fileType,
-              i < sessions.size() ? FeedbackFileType::session : FeedbackFileType::custom);
-  }
-  // Every directory is in the first draw (13 custom directories, 3 of them
-  // present, and the cache directory); the count shrinks as walks end.
+  EXPECT_EQ(kinds(first), std::string(sessions.size(), 's') + std::string(customs.size(), 'c'));
+  // Every directory present is in the first draw (the cache directory and
+  // three custom ones); the count shrinks as walks end.
   ASSERT_FALSE(counts.empty());
   EXPECT_EQ(counts.front(), 4u);
   EXPECT_TRUE(std::is_sorted(counts.rbegin(), counts.rend()));
-
+  EXPECT_EQ(counts.back(), 2u);
   // Always the last: custom feedback first.
-  auto last = FeedbackEnumerator::make(env.assembly(), {}, [](size_t n) { return n - 1; });
-  ASSERT_TRUE(last);
-  files = drain(*last);
-  ASSERT_EQ(files.size(), sessions.size() + customs.size());
-  for (size_t i = 0; i < files.size(); ++i) {
-    EXPECT_EQ(files[i].fileType,
-              i < customs.size() ? FeedbackFileType::custom : FeedbackFileType::session);
-  }
+  EXPECT_EQ(kinds(walk({}, [](size_t n) { return n - 1; })),
+            std::string(customs.size(), 'c') + std::string(sessions.size(), 's'));
+  // A type filter walks only those custom directories.
+  std::multiset<std::string> types;
+  for (const auto& f : walk({"Usage", "UserReport"})) types.insert(f.typeString());
+  EXPECT_EQ(types, (std::multiset<std::string>{"Usage", "Usage", "UserReport", "UserReport"}));
+  EXPECT_TRUE(walk({"NotAType", "usage"}).empty());
 }
 
 TEST_F(FeedbackWalk, TheSystemDrawInterleavesDirectories) {
-  // With two directories of 200 files each, keeping one directory's files
-  // together by chance has a probability of 2^-199.
-  for (unsigned i = 0; i < 200; ++i) {
-    makeFile(env.cacheDir(), sessionName(SessionFileState::closed, i));
+  // Keeping one directory's 40 files together by chance has a probability of 2^-39.
+  for (unsigned i = 0; i < 40; ++i) {
+    session(S::closed, i);
     makeFile(custom("Usage"), "r" + std::to_string(i));
   }
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  auto files = drain(*e);
-  ASSERT_EQ(files.size(), 400u);
-  size_t switches = 0;
-  for (size_t i = 1; i < files.size(); ++i) switches += files[i].fileType != files[i - 1].fileType;
-  EXPECT_GT(switches, 1u);
+  std::string order = kinds(walk());
+  ASSERT_EQ(order.size(), 80u);
+  EXPECT_NE(order, std::string(40, 's') + std::string(40, 'c'));
+  EXPECT_NE(order, std::string(40, 'c') + std::string(40, 's'));
 }
 
-TEST_F(FeedbackWalk, ATypeFilterWalksOnlyThoseCustomDirectories) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly(), {"Usage", "UserReport"});
+TEST_F(FeedbackWalk, FilesAndDirectoriesRemovedMidWalkAreNotYielded) {
+  for (unsigned i = 0; i < 3; ++i) makeFile(custom("Usage"), "u" + std::to_string(i));
+  std::vector<fs::path> files;
+  for (unsigned i = 0; i < 6; ++i) files.push_back(session(S::closed, i));
+  // Custom feedback first, so the Usage walk is under way when it goes.
+  auto e = FeedbackEnumerator::make(fm(), {}, [](size_t n) { return n - 1; });
   ASSERT_TRUE(e);
-  auto files = drain(*e);
-  ASSERT_EQ(files.size(), 10u);
-  for (const auto& f : files) {
-    EXPECT_EQ(f.fileType, FeedbackFileType::custom);
-    EXPECT_TRUE(f.typeString() == "Usage" || f.typeString() == "UserReport") << f.typeString();
-  }
-  EXPECT_EQ(e->typeFilter(), (std::vector<std::string>{"Usage", "UserReport"}));
-}
-
-TEST_F(FeedbackWalk, AFilterOfUnknownTypesFindsNothing) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly(), {"NotAType", "usage"});
-  ASSERT_TRUE(e);
-  EXPECT_FALSE(e->next());
+  ASSERT_EQ(e->next().value().typeString(), "Usage");
+  fs::remove_all(custom("Usage"));
+  for (unsigned i = 0; i < 6; i += 2) fs::remove(files[i]);
+  auto rest = drain(std::move(e));
+  for (const auto& f : rest) EXPECT_TRUE(fs::exists(f.fileURL)) << f.fileURL;
+  EXPECT_EQ(rest.size(), 3u);
 }
 
 }  // namespace

@@ -1,29 +1,77 @@
-// Helpers for the flushing tests: session names with predictable UUIDs and a
-// cache directory populated file by file.
+// Shared by the flushing tests: session names with predictable UUIDs, a cache
+// directory populated file by file, and a fixture holding a temporary home.
 #pragma once
 
+#include "flushing/cache_layout.h"
+#include "flushing/feedback_enumerator.h"
 #include "flushing/session_filename.h"
-#include "platform/file_manager.h"
+#include "support/test_support.h"
 
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstdio>
 #include <string>
-#include <string_view>
 #include <vector>
 
 namespace fbf::testing {
 
+using S = SessionFileState;
+
 // A canonical UUID whose first group is `n`, so names sort in `n` order.
-std::string uuidString(unsigned n);
+inline std::string uuidString(unsigned n) {
+  char buf[40];
+  std::snprintf(buf, sizeof buf, "%08X-0000-4000-8000-00000000ABCD", n);
+  return buf;
+}
 // session.<pid>.<uuidString(n)>.<state>
-std::string sessionName(SessionFileState state, unsigned n, int pid = 12);
-// Writes `contents` to dir/name and returns the path.
-fs::path makeFile(const fs::path& dir, std::string_view name, std::string_view contents = "x");
-SystemTime creationDate(const FileManager& fm, const fs::path& path);
-// Like makeFile, recreating the file until its creation date is later than
-// that of `earlier` (creation times are coarse, so two files made in a row
-// often share one).
-fs::path makeFileCreatedAfter(const FileManager& fm, const fs::path& earlier, const fs::path& dir,
-                              std::string_view name);
-// Names of every entry directly in `dir` (any kind), sorted.
-std::vector<std::string> entryNames(const fs::path& dir);
+inline std::string sessionName(S state, unsigned n, int pid = 12) {
+  return "session." + std::to_string(pid) + "." + uuidString(n) + "." +
+         std::string(toString(state));
+}
+inline fs::path makeFile(const fs::path& dir, std::string_view name, std::string_view bytes = "x") {
+  writeFile(dir / std::string(name), bytes);
+  return dir / std::string(name);
+}
+inline SystemTime creationDate(const FileManager& fm, const fs::path& path) {
+  return fm.attributes(path).value().creationDate;
+}
+// Like makeFile, recreating the file until it is created later than `earlier`
+// (creation times are coarse, so two files made in a row often share one).
+inline fs::path makeFileCreatedAfter(const FileManager& fm, const fs::path& earlier,
+                                     const fs::path& dir, std::string_view name) {
+  while (creationDate(fm, makeFile(dir, name)) <= creationDate(fm, earlier)) {
+    fs::remove(dir / std::string(name));
+  }
+  return dir / std::string(name);
+}
+// Names of every entry directly in `dir`, sorted.
+inline std::vector<std::string> entryNames(const fs::path& dir) {
+  std::vector<std::string> names;
+  for (const auto& e : fs::directory_iterator(dir)) names.push_back(e.path().filename().string());
+  std::sort(names.begin(), names.end());
+  return names;
+}
+inline std::vector<FeedbackFile> drain(std::optional<FeedbackEnumerator> e) {
+  std::vector<FeedbackFile> out;
+  while (e) {
+    auto f = e->next();
+    if (!f) break;
+    out.push_back(std::move(*f));
+  }
+  return out;
+}
+
+class CacheTest : public ::testing::Test {
+ protected:
+  FileManager& fm() { return *env.fileManager; }
+  fs::path cache() const { return env.cacheDir(); }
+  fs::path session(S state, unsigned n, std::string_view suffix = "") {
+    return makeFile(cache(), sessionName(state, n) + std::string(suffix));
+  }
+
+  TestEnvironment env;
+  LogCapture logs;
+};
 
 }  // namespace fbf::testing

@@ -1,222 +1,118 @@
+// Guards against: a session name parsed into the wrong fields, or a malformed one accepted.
 #include "flushing/session_filename.h"
 
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <set>
-
 namespace fbf {
 namespace {
 
+using S = SessionFileState;
+using F = UploadFormat;
+using namespace std::string_view_literals;
+
 constexpr std::string_view kUUID = "6F9619FF-8B86-D011-B42D-00C04FC964FF";
 
-std::string withUUID(std::string_view before, std::string_view after,
-                     std::string_view uuid = kUUID) {
+std::string named(std::string_view before, std::string_view after, std::string_view uuid = kUUID) {
   return std::string(before) + std::string(uuid) + std::string(after);
 }
 
-TEST(SessionNameGrammar, PlainClosedNameParsesIntoItsFields) {
-  auto name = SessionFilename::fromString(withUUID("session.412.", ".closed"));
-  ASSERT_TRUE(name);
-  EXPECT_EQ(name->processID, 412);
-  EXPECT_EQ(name->sessionIDString(), kUUID);
-  EXPECT_EQ(name->sessionID[0], 0x6F);
-  EXPECT_EQ(name->sessionID[15], 0xFF);
-  EXPECT_EQ(name->state, SessionFileState::closed);
-  EXPECT_FALSE(name->uploadPending);
-  EXPECT_EQ(name->uploadFormat, UploadFormat::json);
-  EXPECT_EQ(name->filenameString(), withUUID("session.412.", ".closed"));
-}
-
-TEST(SessionNameGrammar, OpenNameIsNotPendingAndJSON) {
-  auto name = SessionFilename::fromString(withUUID("session.12.", ".open"));
-  ASSERT_TRUE(name);
-  EXPECT_EQ(name->state, SessionFileState::open);
-  EXPECT_FALSE(name->uploadPending);
-  EXPECT_EQ(name->uploadFormat, UploadFormat::json);
-}
-
-TEST(SessionNameGrammar, UploadNameCarriesFormatAndPendingFlag) {
-  std::string text = withUUID("session.412.", ".processing.pb.uploadPending");
-  auto name = SessionFilename::fromString(text);
-  ASSERT_TRUE(name);
-  EXPECT_EQ(name->state, SessionFileState::processing);
-  EXPECT_EQ(name->uploadFormat, UploadFormat::pb);
-  EXPECT_TRUE(name->uploadPending);
-  EXPECT_EQ(name->uploadFilenameString(), text);
-  EXPECT_EQ(name->filenameString(), withUUID("session.412.", ".processing"));
-}
-
-TEST(SessionNameGrammar, UnknownFifthPieceKeepsJSONAndNotPending) {
-  auto name = SessionFilename::fromString(withUUID("session.12.", ".closed.zip"));
-  ASSERT_TRUE(name);
-  EXPECT_EQ(name->state, SessionFileState::closed);
-  EXPECT_EQ(name->uploadFormat, UploadFormat::json);
-  EXPECT_FALSE(name->uploadPending);
-}
-
-TEST(SessionNameGrammar, PendingSuffixWithoutFormatStaysJSON) {
-  auto name = SessionFilename::fromString(withUUID("session.12.", ".processing.uploadPending"));
-  ASSERT_TRUE(name);
-  EXPECT_TRUE(name->uploadPending);
-  EXPECT_EQ(name->uploadFormat, UploadFormat::json);
-  EXPECT_EQ(name->uploadFilenameString(),
-            withUUID("session.12.", ".processing.json.uploadPending"));
-}
-
-TEST(SessionNameGrammar, PendingOnlyWhenTheWholeNameEndsWithTheSuffix) {
-  auto name = SessionFilename::fromString(withUUID("session.12.", ".processing.pb.uploadPendingX"));
-  ASSERT_TRUE(name);
-  EXPECT_FALSE(name->uploadPending);
-  EXPECT_EQ(name->uploadFormat, UploadFormat::pb);
-}
-
-TEST(SessionNameGrammar, RejectsTheNegativeExamples) {
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.x.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("Session.12.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12.", "")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12.", ".Open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12.", ".deleted")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("sessions.12.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(""));
-  EXPECT_FALSE(SessionFilename::fromString("session"));
-  EXPECT_FALSE(SessionFilename::fromString("...."));
-}
-
-TEST(SessionNameGrammar, EmptyPiecesAreDropped) {
-  auto name = SessionFilename::fromString(withUUID(".session..12..", "..closed."));
-  ASSERT_TRUE(name);
-  EXPECT_EQ(name->processID, 12);
-  EXPECT_EQ(name->state, SessionFileState::closed);
-}
-
-TEST(SessionNameGrammar, ProcessIDIsASigned32BitDecimal) {
-  auto negative = SessionFilename::fromString(withUUID("session.-7.", ".open"));
-  ASSERT_TRUE(negative);
-  EXPECT_EQ(negative->processID, -7);
-  EXPECT_EQ(negative->filenameString(), withUUID("session.-7.", ".open"));
-
-  auto highest = SessionFilename::fromString(withUUID("session.2147483647.", ".open"));
-  ASSERT_TRUE(highest);
-  EXPECT_EQ(highest->processID, INT32_MAX);
-  auto lowest = SessionFilename::fromString(withUUID("session.-2147483648.", ".open"));
-  ASSERT_TRUE(lowest);
-  EXPECT_EQ(lowest->processID, INT32_MIN);
-
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.2147483648.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.-2147483649.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.99999999999999999999999.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.-.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12a.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session. 12.", ".open")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.0x1F.", ".open")));
-}
-
-TEST(SessionNameGrammar, UUIDMustBeCanonicalButHexCaseIsFree) {
-  auto lower = SessionFilename::fromString(
-      withUUID("session.1.", ".open", "6f9619ff-8b86-d011-b42d-00c04fc964ff"));
-  ASSERT_TRUE(lower);
-  EXPECT_EQ(lower->sessionIDString(), kUUID);
-
-  for (std::string_view bad :
-       {"6F9619FF8B86D011B42D00C04FC964FF", "{6F9619FF-8B86-D011-B42D-00C04FC964FF}",
-        "6F9619FF-8B86-D011-B42D-00C04FC964F", "6F9619FF-8B86-D011-B42D-00C04FC964FFF",
-        "6F9619F-F8B86-D011-B42D-00C04FC964FF", "6F9619FG-8B86-D011-B42D-00C04FC964FF",
-        "6F9619FF 8B86-D011-B42D-00C04FC964FF"}) {
-    EXPECT_FALSE(SessionFilename::fromString(withUUID("session.1.", ".open", bad))) << bad;
+TEST(SessionNameGrammar, EachWellFormedNameParsesIntoItsFieldsAndBack) {
+  std::string longest = named("session.12.", ".closed.");
+  longest.append(255 - longest.size(), 'a');
+  struct Row {
+    const char* name;
+    std::string text;
+    S state;
+    int32_t pid = 12;
+    F format = F::json;
+    bool pending = false;
+  };
+  const Row rows[] = {
+      {"plain closed", named("session.412.", ".closed"), S::closed, 412},
+      {"open", named("session.12.", ".open"), S::open},
+      {"upload name", named("session.412.", ".processing.pb.uploadPending"), S::processing, 412,
+       F::pb, true},
+      {"unknown fifth piece", named("session.12.", ".closed.zip"), S::closed},
+      {"pending without format", named("session.12.", ".processing.uploadPending"), S::processing,
+       12, F::json, true},
+      {"suffix not at the very end", named("session.12.", ".processing.pb.uploadPendingX"),
+       S::processing, 12, F::pb},
+      {"empty pieces are dropped", named(".session..12..", "..closed."), S::closed},
+      {"negative pid", named("session.-7.", ".open"), S::open, -7},
+      {"highest pid", named("session.2147483647.", ".open"), S::open, INT32_MAX},
+      {"lowest pid", named("session.-2147483648.", ".open"), S::open, INT32_MIN},
+      {"lower-case UUID", named("session.1.", ".uploaded", "6f9619ff-8b86-d011-b42d-00c04fc964ff"),
+       S::uploaded, 1},
+      {"invalid UTF-8 after the state", named("session.12.", ".closed.\xff\xfe"), S::closed},
+      {"longest file name", longest, S::closed},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    auto name = SessionFilename::fromString(row.text);
+    ASSERT_TRUE(name);
+    EXPECT_EQ(name->processID, row.pid);
+    EXPECT_EQ(name->state, row.state);
+    EXPECT_EQ(name->uploadFormat, row.format);
+    EXPECT_EQ(name->uploadPending, row.pending);
+    EXPECT_EQ(name->sessionIDString(), kUUID);
+    EXPECT_EQ(name->sessionID[0], 0x6F);
+    EXPECT_EQ(name->sessionID[15], 0xFF);
+    std::string plain = "session." + std::to_string(row.pid) + "." + std::string(kUUID) + "." +
+                        std::string(toString(row.state));
+    EXPECT_EQ(name->filenameString(), plain);
+    EXPECT_EQ(name->uploadFilenameString(),
+              plain + "." + std::string(toString(row.format)) + ".uploadPending");
   }
 }
 
-TEST(SessionNameGrammar, NamesAreEqualWhenAllFiveFieldsAre) {
-  auto a = SessionFilename::fromString(withUUID("session.1.", ".closed"));
-  auto b = SessionFilename::fromString(withUUID("session.1.", ".closed"));
-  ASSERT_TRUE(a && b);
-  EXPECT_EQ(*a, *b);
-  b->uploadPending = true;
-  EXPECT_NE(*a, *b);
-  b = a;
-  b->uploadFormat = UploadFormat::pb;
-  EXPECT_NE(*a, *b);
-  b = a;
-  b->processID = 2;
-  EXPECT_NE(*a, *b);
-  b = a;
-  b->state = SessionFileState::processing;
-  EXPECT_NE(*a, *b);
-  b = a;
-  b->sessionID[7] ^= 1;
-  EXPECT_NE(*a, *b);
-}
-
-TEST(SessionNameGrammar, StatesAndFormatsRoundTripThroughTheirStrings) {
-  for (auto s : {SessionFileState::open, SessionFileState::closed, SessionFileState::processing,
-                 SessionFileState::uploaded}) {
-    EXPECT_EQ(sessionFileStateFromString(toString(s)), s);
+TEST(SessionNameGrammar, MalformedAndHostileNamesAreRejected) {
+  std::string manyPieces = "session";
+  while (manyPieces.size() < 4096) manyPieces += ".x";
+  // '@' stands for the canonical UUID.
+  std::vector<std::string> rejected = {
+      "session.x.@.open", "Session.12.@.open", "session.12.@", "session.12.@.Open",
+      "session.12.@.deleted", "sessions.12.@.open", "", "session", "....",
+      // process IDs: 32-bit signed decimal only
+      "session.2147483648.@.open", "session.-2147483649.@.open",
+      "session.99999999999999999999999.@.open", "session.-.@.open", "session.12a.@.open",
+      "session. 12.@.open", "session.0x1F.@.open",
+      // spaces, newlines, NUL bytes and invalid UTF-8 where they matter
+      "session.12.@.closed copy", "session 12.@.closed", "session.12.@.closed\n",
+      "session.12\n.@.closed", "session.\xff\xfe.@.closed", "session.12.@.clos\xc3\x28",
+      // UUIDs: canonical form only
+      "session.1.6F9619FF8B86D011B42D00C04FC964FF.open",
+      "session.1.{6F9619FF-8B86-D011-B42D-00C04FC964FF}.open",
+      "session.1.6F9619FF-8B86-D011-B42D-00C04FC964F.open",
+      "session.1.6F9619FF-8B86-D011-B42D-00C04FC964FFF.open",
+      "session.1.6F9619F-F8B86-D011-B42D-00C04FC964FF.open",
+      "session.1.6F9619FG-8B86-D011-B42D-00C04FC964FF.open",
+      "session.1.6F9619FF 8B86-D011-B42D-00C04FC964FF.open",
+      // overlong
+      std::string(255, '.'), "session." + std::string(247, '9'), manyPieces,
+      named("session.12.", ".open\0"sv)};
+  for (auto& text : rejected) {
+    if (auto at = text.find('@'); at != std::string::npos) text.replace(at, 1, kUUID);
   }
-  EXPECT_EQ(toString(SessionFileState::processing), "processing");
-  EXPECT_FALSE(sessionFileStateFromString("CLOSED"));
-  EXPECT_EQ(uploadFormatFromString("json"), UploadFormat::json);
-  EXPECT_EQ(uploadFormatFromString("pb"), UploadFormat::pb);
-  EXPECT_FALSE(uploadFormatFromString("JSON"));
-  EXPECT_EQ(queryParameterString(UploadFormat::json), "FeedbackV2");
-  EXPECT_EQ(queryParameterString(UploadFormat::pb), "FeedbackV2PB");
+  for (const auto& text : rejected) EXPECT_FALSE(SessionFilename::fromString(text)) << text;
 }
 
-TEST(NewSessionName, HasThisProcessAFreshVersion4UUIDAndDefaults) {
+// Guards against: new sessions sharing an ID, or named for another process.
+TEST(NewSessionName, HasThisProcessAFreshVersion4UUIDAndParsesBack) {
   SessionFilename a;
   SessionFilename b;
   EXPECT_EQ(a.processID, static_cast<int32_t>(getpid()));
-  EXPECT_EQ(a.state, SessionFileState::open);
+  EXPECT_EQ(a.state, S::open);
   EXPECT_FALSE(a.uploadPending);
-  EXPECT_EQ(a.uploadFormat, UploadFormat::json);
+  EXPECT_EQ(a.uploadFormat, F::json);
   EXPECT_NE(a.sessionID, b.sessionID);
   EXPECT_EQ(a.sessionID[6] >> 4, 4);
   EXPECT_EQ(a.sessionID[8] >> 6, 2);
-  auto parsed = SessionFilename::fromString(a.filenameString());
-  ASSERT_TRUE(parsed);
-  EXPECT_EQ(*parsed, a);
-}
-
-TEST(NewSessionName, UploadNameParsesBackToTheSameFields) {
-  SessionFilename a;
-  a.state = SessionFileState::processing;
-  a.uploadFormat = UploadFormat::pb;
+  EXPECT_EQ(SessionFilename::fromString(a.filenameString()), a);
+  a.state = S::processing;
+  a.uploadFormat = F::pb;
   a.uploadPending = true;
-  auto parsed = SessionFilename::fromString(a.uploadFilenameString());
-  ASSERT_TRUE(parsed);
-  EXPECT_EQ(*parsed, a);
-}
-
-TEST(HostileSessionNames, SpacesNewlinesAndNulBytesDoNotParse) {
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12.", ".closed copy")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session 12.", ".closed")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12.", ".closed\n")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12\n.", ".closed")));
-  EXPECT_FALSE(
-      SessionFilename::fromString(withUUID("session.12.", std::string_view(".open\0", 6))));
-}
-
-TEST(HostileSessionNames, InvalidUTF8IsRejectedWhereItMattersAndIgnoredElsewhere) {
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.\xff\xfe.", ".closed")));
-  EXPECT_FALSE(SessionFilename::fromString(withUUID("session.12.", ".clos\xc3\x28")));
-  auto tail = SessionFilename::fromString(withUUID("session.12.", ".closed.\xff\xfe"));
-  ASSERT_TRUE(tail);
-  EXPECT_EQ(tail->uploadFormat, UploadFormat::json);
-}
-
-TEST(HostileSessionNames, LongestFileNamesAreHandled) {
-  std::string longValid = withUUID("session.12.", ".closed.");
-  longValid.append(255 - longValid.size(), 'a');
-  ASSERT_EQ(longValid.size(), 255u);
-  auto name = SessionFilename::fromString(longValid);
-  ASSERT_TRUE(name);
-  EXPECT_EQ(name->state, SessionFileState::closed);
-
-  EXPECT_FALSE(SessionFilename::fromString(std::string(255, '.')));
-  EXPECT_FALSE(SessionFilename::fromString("session." + std::string(247, '9')));
-  std::string manyPieces = "session";
-  while (manyPieces.size() < 4096) manyPieces += ".x";
-  EXPECT_FALSE(SessionFilename::fromString(manyPieces));
+  EXPECT_EQ(SessionFilename::fromString(a.uploadFilenameString()), a);
 }
 
 }  // namespace

@@ -1,5 +1,5 @@
 // Helpers shared by the upload tests: an inflater and a digest that do not go
-// through the code under test.
+// through the code under test, and incompressible bytes.
 #pragma once
 
 #include <openssl/evp.h>
@@ -49,15 +49,6 @@ inline std::string randomBytes(size_t n, uint32_t seed) {
   std::mt19937 rng(seed);
   std::string out(n, '\0');
   for (auto& c : out) c = static_cast<char>(rng() & 0xff);
-  return out;
-}
-
-// Text that compresses well, as session JSON does.
-inline std::string compressibleText(size_t n) {
-  std::string out;
-  int i = 0;
-  while (out.size() < n) out += "{\"queryId\":" + std::to_string(i++ % 97) + ",\"type\":\"result\",\"rank\":3},";
-  out.resize(n);
   return out;
 }
 
