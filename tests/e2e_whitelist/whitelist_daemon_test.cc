@@ -13,6 +13,7 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 #include <signal.h>
+#include <sys/stat.h>
 
 namespace fbf::testing {
 namespace {
@@ -106,67 +107,95 @@ class WhitelistDaemon : public ::testing::Test {
   std::unique_ptr<ChildProcess> daemon;
 };
 
-// Guards against: the daemon reading the wrong entries or resource, ignoring a
-// condition, or regenerating a fresh list on "if-stale".
+// Guards against: the daemon reading the wrong entries (later directories
+// winning, hidden, non-application, unreadable or unlisted entries counted,
+// nested ids without their prefix, linked directories entered) or resource,
+// the wrong assistant list, a condition ignored, or a fresh list regenerated
+// on "if-stale".
 TEST_F(WhitelistDaemon, EachConditionPrintsAndStoresTheSignatureOfInstalledWhitelistedApps) {
-  writeFile(userApps() / "org.example.Mail.desktop", applicationEntry("Mail"));
-  writeFile(userApps() / "vendor" / "tool.desktop", applicationEntry("Tool"));  // id "vendor-tool"
-  writeFile(sharedApps() / "org.example.Maps.desktop", applicationEntry("Maps"));
-  // The user's hidden copy shadows the shared entry.
-  writeFile(sharedApps() / "org.example.Notes.desktop", applicationEntry("Notes"));
-  writeFile(userApps() / "org.example.Notes.desktop", "[Desktop Entry]\nType=Application\nName=Notes\nHidden=true\n");
-  writeFile(userApps() / "org.example.Site.desktop", "[Desktop Entry]\nType=Link\nName=Site\nURL=https://x.org\n");
-  writeFile(userApps() / "org.example.Broken.desktop", "this is not a key file\n");
-  std::map<std::string, uint64_t> ids = {{"org.example.Mail", 0}, {"vendor-tool", 9},       {"org.example.Maps", 3},
-                                         {"org.example.Notes", 5}, {"org.example.Site", 7}, {"org.example.Broken", 8},
-                                         {"org.example.NotInstalled", 12}};
+  const std::string hidden = "[Desktop Entry]\nType=Application\nName=Notes\nHidden=true\n";
+  const std::string intents = applicationEntry("Todo") + "Implements=vireon.Intents\n";
+  const std::pair<fs::path, std::string> files[] = {
+      {userApps() / "org.example.Mail.desktop", applicationEntry("Mail")},
+      {userApps() / "vendor" / "tool.desktop", applicationEntry("Tool")},
+      {userApps() / "a" / "b" / "c.desktop", applicationEntry("C")},
+      {userApps() / "shown.desktop", applicationEntry("Shown") + "NoDisplay=true\n"},
+      {userApps() / "org.example.Todo.desktop", intents},
+      {userApps() / "org.vireon.Notes.desktop", applicationEntry("Notes")},
+      {userApps() / "org.example.Notes.desktop", hidden},
+      {userApps() / "org.example.Site.desktop", "[Desktop Entry]\nType=Link\nName=Site\nURL=https://x.org\n"},
+      {userApps() / "games.desktop", "[Desktop Entry]\nType=Directory\nName=Games\n"},
+      {userApps() / "untyped.desktop", "[Desktop Entry]\nName=Untyped\n"},
+      {userApps() / "readme.txt", applicationEntry("Readme")},
+      {userApps() / "org.example.Broken.desktop", "this is not a key file\n"},
+      {sharedApps() / "org.example.Maps.desktop", applicationEntry("Maps")},
+      {sharedApps() / "org.example.Notes.desktop", applicationEntry("Notes")},
+      {sharedApps() / "org.example.Broken.desktop", applicationEntry("Broken")},
+      {sharedApps() / "vendor-tool.desktop", intents},
+  };
+  for (const auto& [path, text] : files) writeFile(path, text);
+  fs::create_directory_symlink(userApps(), userApps() / "loop");
+  std::map<std::string, uint64_t> ids = {
+      {"org.example.Mail", 0}, {"org.example.Todo", 1}, {"a-b-c", 2},           {"org.example.Maps", 3},
+      {"shown", 4},            {"org.example.Notes", 5}, {"games", 6},          {"org.example.Site", 7},
+      {"org.example.Broken", 8}, {"vendor-tool", 9},    {"untyped", 10},        {"readme", 11},
+      {"org.example.NotInstalled", 12}, {"loop-org.example.Mail", 13}};
   writeFile(sharedResource(), whitelistDocument(ids));
+  ASSERT_TRUE(store->defaultsForDomain("vireon.assistant")->setObject("Assistant Enabled", true));
+  ASSERT_TRUE(store->defaultsForDomain("vireon.scoutlume")
+                  ->setObject("DisabledApplications", PropertyList::array({"org.vireon.Notes"})));
   ASSERT_NO_FATAL_FAILURE(startDaemon());
 
   // No assistant list yet: stale.
   auto printed = update("if-stale");
-  EXPECT_TRUE(carries(printed, {0, 3, 9}));
+  EXPECT_TRUE(carries(printed, {0, 1, 2, 3, 4, 9}));
   EXPECT_EQ(stored(), printed);
-  EXPECT_TRUE(fs::is_regular_file(assistantList()));
+  EXPECT_EQ(readFile(assistantList()), R"(["org.example.Todo","vireon.vexa.nonAppSuggestion"])");
   EXPECT_TRUE(logged("updated signature user default"));
+  EXPECT_TRUE(logged("could not read desktop entry " + (userApps() / "org.example.Broken.desktop").string()));
 
   // The data home's resource wins over the shared one, but a fresh list is
   // not regenerated until it is two days old.
   ids["org.example.Mail"] = 40;
   writeFile(userResource(), whitelistDocument(ids));
-  EXPECT_TRUE(carries(update("if-stale"), {0, 3, 9}));
+  EXPECT_TRUE(carries(update("if-stale"), {0, 1, 2, 3, 4, 9}));
   EXPECT_TRUE(logged("whitelist already up-to-date"));
   fs::last_write_time(assistantList(), fs::file_time_type::clock::now() - 49h);
-  EXPECT_TRUE(carries(update("if-stale"), {3, 9, 40}));
+  EXPECT_TRUE(carries(update("if-stale"), {1, 2, 3, 4, 9, 40}));
 
   ids["org.example.Mail"] = 41;
   writeFile(userResource(), whitelistDocument(ids));
-  EXPECT_TRUE(carries(update("soon"), {3, 9, 41}));
+  EXPECT_TRUE(carries(update("soon"), {1, 2, 3, 4, 9, 41}));
   EXPECT_TRUE(logged("update whitelists soon"));
-  ids["org.example.Mail"] = 1;
+  ids["org.example.Mail"] = 20;
   writeFile(userResource(), whitelistDocument(ids));
-  EXPECT_TRUE(carries(update("now"), {1, 3, 9}));
-  EXPECT_TRUE(carries(stored(), {1, 3, 9}));
+  EXPECT_TRUE(carries(update("now"), {1, 2, 3, 4, 9, 20}));
+  EXPECT_TRUE(carries(stored(), {1, 2, 3, 4, 9, 20}));
 
   auto refused = ctl({"update-whitelists", "later"});
   EXPECT_NE(refused.status, 0);
   EXPECT_NE(refused.err.find("later"), std::string::npos) << refused.err;
 }
 
-// Guards against: a resource the daemon cannot use leaving an old signature
+// Guards against: a resource the daemon cannot use (missing, not a regular
+// file, empty, malformed, listing no installed app) leaving an old signature
 // behind, going unlogged, or stopping the daemon.
 TEST_F(WhitelistDaemon, UnusableResourceRemovesTheSignatureAndTheDaemonKeepsServing) {
   struct Row {
     const char* name;
-    std::optional<std::string> contents;  // none: no resource file
+    std::function<void()> plant;
     const char* logLine;
   };
+  auto writes = [&](std::string text) { return [this, text] { writeFile(userResource(), text); }; };
   const Row rows[] = {
-      {"missing", std::nullopt, "Could not obtain file handle for installed app whitelist"},
-      {"empty", "", "mappedData is nil"},
-      {"truncated", whitelistDocument({{"org.example.Mail", 11}}).substr(0, 40),
+      {"missing", [] {}, "Could not obtain file handle for installed app whitelist"},
+      {"directory", [&] { fs::create_directories(userResource()); }, "not a regular file"},
+      // Opened without blocking: a FIFO must not stall the daemon.
+      {"fifo", [&] { ASSERT_EQ(mkfifo(userResource().c_str(), 0600), 0); }, "not a regular file"},
+      {"empty", writes(""), "mappedData is nil"},
+      {"truncated", writes(whitelistDocument({{"org.example.Mail", 11}}).substr(0, 40)),
        "installed app whitelist vireond/app-whitelist.json is malformed"},
-      {"no installed app listed", whitelistDocument({{"org.example.Elsewhere", 4}}),
+      {"no installed app listed", writes(whitelistDocument({{"org.example.Elsewhere", 4}})),
        "no installed application is whitelisted"},
   };
   writeFile(userApps() / "org.example.Mail.desktop", applicationEntry("Mail"));
@@ -174,11 +203,13 @@ TEST_F(WhitelistDaemon, UnusableResourceRemovesTheSignatureAndTheDaemonKeepsServ
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
     ASSERT_TRUE(vireond->setObject("VIRAppWhitelistSignature", "old"));
-    if (row.contents) writeFile(userResource(), *row.contents);
+    fs::remove_all(userResource());
+    row.plant();
     EXPECT_EQ(update("now"), "no signature");
     EXPECT_EQ(stored(), std::nullopt);
     EXPECT_TRUE(logged(row.logLine)) << log();
   }
+  fs::remove_all(userResource());
   writeFile(userResource(), whitelistDocument({{"org.example.Mail", 11}}));
   EXPECT_TRUE(carries(update("now"), {11}));
 }
