@@ -208,6 +208,7 @@ TEST_F(WhitelistDaemon, UnusableResourceRemovesTheSignatureAndTheDaemonKeepsServ
     EXPECT_EQ(update("now"), "no signature");
     EXPECT_EQ(stored(), std::nullopt);
     EXPECT_TRUE(logged(row.logLine)) << log();
+    EXPECT_EQ(readFile(assistantList()), "[]");  // the assistant is off
   }
   fs::remove_all(userResource());
   writeFile(userResource(), whitelistDocument({{"org.example.Mail", 11}}));

@@ -2,7 +2,6 @@
 
 #include "assembly/fbf_strings.h"
 #include "support/test_support.h"
-#include "whitelist/signature_decoder.h"
 #include "whitelist/whitelist_fixtures.h"
 
 #include <gtest/gtest.h>
@@ -17,7 +16,6 @@ using namespace std::chrono_literals;
 constexpr uint64_t kNow = 0;
 constexpr uint64_t kSoon = 1;
 constexpr uint64_t kIfStale = 2;
-constexpr std::string_view kSignatureKey = FBFStrings::kVIRAppWhitelistSignatureKey;
 
 class RecordingQuerier final : public VexaAppQuerierProtocol {
  public:
@@ -42,7 +40,8 @@ mode_t modeOf(const fs::path& path) {
 
 // A controller over the test environment's assembly, with its own hand-run
 // low-priority queue, three installed applications and a whitelist resource
-// in the temporary XDG data home.
+// in the temporary XDG data home. What it stores is checked through the
+// daemon (e2e_whitelist); here: when it runs and what it holds meanwhile.
 class WhitelistUpdates : public ::testing::Test {
  protected:
   WhitelistUpdates() {
@@ -59,20 +58,7 @@ class WhitelistUpdates : public ::testing::Test {
 
   fs::path resourcePath() const { return env.dirs.dataHome / "vireond" / "app-whitelist.json"; }
   fs::path assistantList() const { return env.cacheDir() / "assistant-apps.json"; }
-  void writeStandardResource() {
-    writeFile(resourcePath(), whitelistDocument({{"org.example.Mail", entry(0)},
-                                                 {"vendor-tool", entry(9)},
-                                                 {"org.example.Other", entry(4)}}));
-  }
-  std::optional<std::string> storedSignature() { return env.defaults().stringForKey(kSignatureKey); }
-  std::optional<std::vector<uint8_t>> storedBitmap() {
-    auto signature = storedSignature();
-    if (!signature) return std::nullopt;
-    std::string why;
-    auto decoded = decodeSignature(*signature, &why);
-    EXPECT_TRUE(decoded) << why;
-    return decoded ? std::optional(decoded->bitmap) : std::nullopt;
-  }
+  void writeStandardResource() { writeFile(resourcePath(), whitelistDocument({{"org.example.Mail", entry(0)}})); }
   int openTransactions() { return env.transactions->openCount(); }
   // Makes a request and lets the queue take it in (arming the timer).
   void request(uint64_t condition, std::function<void()> completion) {

@@ -57,30 +57,6 @@ class AssistantQueries : public ::testing::Test {
   std::shared_ptr<ScriptedAssistantRegistry> extensions = std::make_shared<ScriptedAssistantRegistry>();
 };
 
-// Guards against: the registry asked, or apps listed, while the assistant is
-// off, unset or its preferences cannot be opened.
-TEST_F(AssistantQueries, AssistantOffUnsetOrUnavailableAsksNothing) {
-  EXPECT_TRUE(querier().findEnabledVexaApps({"seed"}, {}).empty());
-  EXPECT_EQ(querier().assistantEnabled(), false);
-  enableAssistant(false);
-  EXPECT_TRUE(querier().findEnabledVexaApps({"seed"}, {}).empty());
-  VexaAppQuerier noDefaults(nullptr, extensions, registry);
-  EXPECT_EQ(noDefaults.assistantEnabled(), std::nullopt);
-  EXPECT_TRUE(noDefaults.findEnabledVexaApps({"seed"}, {}).empty());
-  EXPECT_EQ(extensions->queries, 0);
-}
-
-// Guards against: a source of the union left out (seed, entitled, first
-// party), an unnamed entitled app kept, or disabled apps not removed.
-TEST_F(AssistantQueries, UnitesSeedEntitledAndFirstPartyAppsMinusDisabledOnes) {
-  enableAssistant(true);
-  extensions->answer = {std::string("org.example.Todo"), std::nullopt, std::string("seed")};
-  EXPECT_EQ(sorted(querier().findEnabledVexaApps({"seed"}, {})),
-            (Ids{"org.example.Todo", "org.vireon.Music", "org.vireon.Notes", "seed"}));
-  EXPECT_EQ(sorted(querier().findEnabledVexaApps({"seed"}, {"org.vireon.Music", "org.example.Todo"})),
-            (Ids{"org.vireon.Notes", "seed"}));
-}
-
 // Guards against: the asker not waiting for a reply from another thread,
 // waiting forever for none, or a late reply writing into freed memory.
 TEST_F(AssistantQueries, WaitsForTheReplyUntilTheConfiguredBound) {
