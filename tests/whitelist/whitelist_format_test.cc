@@ -7,9 +7,6 @@
 #include <gtest/gtest.h>
 #include <zlib.h>
 
-#include <fcntl.h>
-#include <unistd.h>
-
 #include <random>
 
 namespace fbf::testing {
@@ -224,27 +221,6 @@ TEST(WhitelistDocuments, WhichApplicationsCountAndWhichDocumentsAreUnusable) {
     ASSERT_TRUE(decoded) << why;
     EXPECT_EQ(decoded->bitmap, *row.bitmap);
   }
-}
-
-// Guards against: a partial mapping, a mapping lost on a move, or an empty
-// file mapped without an error.
-TEST(MappedWhitelistFile, MapsTheWholeFileAndRefusesAnEmptyOne) {
-  TempDir dir;
-  writeFile(dir.path() / "full", "hello whitelist");
-  writeFile(dir.path() / "empty", "");
-  int fd = open((dir.path() / "full").c_str(), O_RDONLY);
-  auto mapped = mmapFileHandle(fd);
-  close(fd);  // the mapping outlives the descriptor
-  ASSERT_TRUE(mapped);
-  MappedFile moved = std::move(*mapped);
-  EXPECT_EQ(moved.bytes(), "hello whitelist");
-  EXPECT_EQ(mapped->bytes(), "");
-
-  fd = open((dir.path() / "empty").c_str(), O_RDONLY);
-  std::error_code error;
-  EXPECT_FALSE(mmapFileHandle(fd, &error));
-  EXPECT_EQ(error.value(), EINVAL);
-  close(fd);
 }
 
 }  // namespace
