@@ -20,9 +20,7 @@ std::string statusField(pid_t pid, const std::string& field) {
   return "";
 }
 
-// Guards against: the daemon needing a system call, address family or
-// memory mapping the service unit refuses, which would break it only when
-// installed.
+// Guards against: a system call, address family or mapping the daemon needs but the service unit refuses.
 TEST(SandboxedDaemon, FlushesEverythingUnderTheUnitsSystemCallFilter) {
 #if defined(__SANITIZE_ADDRESS__)
   GTEST_SKIP() << "the sanitizer runtime needs calls the unit refuses (setrlimit); the release tree runs this";

@@ -107,11 +107,7 @@ class WhitelistDaemon : public ::testing::Test {
   std::unique_ptr<ChildProcess> daemon;
 };
 
-// Guards against: the daemon reading the wrong entries (later directories
-// winning, hidden, non-application, unreadable or unlisted entries counted,
-// nested ids without their prefix, linked directories entered) or resource,
-// the wrong assistant list, a condition ignored, or a fresh list regenerated
-// on "if-stale".
+// Guards against: wrong entries, resource or assistant list read, a condition ignored, a fresh list redone.
 TEST_F(WhitelistDaemon, EachConditionPrintsAndStoresTheSignatureOfInstalledWhitelistedApps) {
   const std::string hidden = "[Desktop Entry]\nType=Application\nName=Notes\nHidden=true\n";
   const std::string intents = applicationEntry("Todo") + "Implements=vireon.Intents\n";
@@ -177,9 +173,7 @@ TEST_F(WhitelistDaemon, EachConditionPrintsAndStoresTheSignatureOfInstalledWhite
   EXPECT_NE(refused.err.find("later"), std::string::npos) << refused.err;
 }
 
-// Guards against: a resource the daemon cannot use (missing, not a regular
-// file, empty, malformed, listing no installed app) leaving an old signature
-// behind, going unlogged, or stopping the daemon.
+// Guards against: an unusable resource leaving an old signature, going unlogged, or stopping the daemon.
 TEST_F(WhitelistDaemon, UnusableResourceRemovesTheSignatureAndTheDaemonKeepsServing) {
   struct Row {
     const char* name;
@@ -215,8 +209,7 @@ TEST_F(WhitelistDaemon, UnusableResourceRemovesTheSignatureAndTheDaemonKeepsServ
   EXPECT_TRUE(carries(update("now"), {11}));
 }
 
-// Guards against: application or preference changes going unwatched while the
-// daemon runs (entries written, renamed into place or removed; an app disabled).
+// Guards against: application or preference changes going unwatched while the daemon runs.
 TEST_F(WhitelistDaemon, ApplicationAndPreferenceChangesRegenerateTheSignature) {
   writeFile(userApps() / "org.example.Mail.desktop", applicationEntry("Mail"));
   writeFile(userResource(), whitelistDocument({{"org.example.Mail", 0}, {"org.example.Maps", 3},

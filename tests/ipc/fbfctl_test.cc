@@ -35,8 +35,7 @@ class TheCommandLine : public IpcFixture {
   }
 };
 
-// Guards against: a command sent as the wrong request, a daemon's refusal or
-// a usage error given the wrong exit status, or output in the wrong form.
+// Guards against: a command sent as the wrong request, or answered with the wrong exit status or output.
 TEST_F(TheCommandLine, EachCommandExitsWithItsStatusAndPrintsItsAnswer) {
   auto outside = (env.temp.path() / "session.1.AB.closed").string();
   struct Row {
@@ -100,8 +99,7 @@ TEST_F(TheCommandLine, TeePrintsEachUploadAsOneDecodedJsonLine) {
   EXPECT_EQ(nlohmann::json::parse(second)["payload"]["user_guid"], "g");
 }
 
-// Guards against: preferences written with the wrong type or mode, read back
-// wrongly, or bad values and domains accepted.
+// Guards against: preferences written with the wrong type or mode, read back wrongly, or bad values accepted.
 TEST_F(TheCommandLine, DefaultsWritesReadsAndDeletesWithoutTheDaemon) {
   for (auto bad : {std::vector<std::string>{"vireond", "N", "-int", "12x"}, {"vireond", "B", "-bool", "maybe"},
                    {"../escape", "K", "v"}}) {

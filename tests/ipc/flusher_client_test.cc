@@ -14,8 +14,7 @@ class AClientObjectForOneRequest : public IpcFixture {
   fs::path sessionPath() const { return env.cacheDir() / "session.7.0A1B.closed"; }
 };
 
-// Guards against: the completion run before the daemon finished, or the
-// connection left open after the answer.
+// Guards against: the completion run before the daemon finished, or the connection left open after the answer.
 TEST_F(AClientObjectForOneRequest, FlushesASessionEagerlyAndCompletesAfterTheDaemonFinished) {
   runner->holdCompletions(true);
   auto connection = connectClient();
@@ -32,8 +31,7 @@ TEST_F(AClientObjectForOneRequest, FlushesASessionEagerlyAndCompletesAfterTheDae
   ASSERT_TRUE(eventually([&] { return !connection->isValid() && openConnections() == 0; }));
 }
 
-// Guards against: a second request answered on a connection the first closed,
-// or a request without a completion not sent.
+// Guards against: a second request answered on a connection the first closed, or a completion-less request lost.
 TEST_F(AClientObjectForOneRequest, ASecondRequestGetsNoReplyOnceTheFirstHasClosedTheConnection) {
   runner->holdCompletions(true);
   auto connection = connectClient();
@@ -54,8 +52,7 @@ TEST_F(AClientObjectForOneRequest, ASecondRequestGetsNoReplyOnceTheFirstHasClose
   EXPECT_TRUE(logs.contains("fbf connection closed with error: connection invalidated"));
 }
 
-// Guards against: a completion run when the daemon went away, or a request
-// sent without a connection.
+// Guards against: a completion run when the daemon went away, or a request sent without a connection.
 TEST_F(AClientObjectForOneRequest, WithoutADaemonTheCompletionIsNeverCalled) {
   runner->holdCompletions(true);
   auto connection = connectClient();

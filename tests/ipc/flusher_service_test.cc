@@ -37,8 +37,7 @@ TEST_F(AClientAskingTheDaemon, GetsAFullFlushAnsweredWhenTheFlushHasFinished) {
   EXPECT_TRUE(logs.contains("Service created new flusher"));
 }
 
-// Guards against: a request kind routed to the wrong operation, a refusal or
-// missing argument not reported, or a refused request ending the connection.
+// Guards against: a request kind routed wrongly, a refusal or missing argument unreported, or ending the connection.
 TEST_F(AClientAskingTheDaemon, EachRequestKindGetsItsAnswer) {
   auto client = ipc::ControlClient::connect(socketPath());
   ASSERT_TRUE(client);
@@ -162,9 +161,7 @@ TEST_F(ListenersOfUploadsAndCohorts, TheSecondSubscriberReplacesTheFirstAndTheFi
   EXPECT_TRUE(second->connection->isValid());
 }
 
-// Guards against: the status missing a listener flag, the runner's figures,
-// the version or the pid; one slot left set when a connection holding both
-// leaves; a late payload to a departed subscriber going unlogged.
+// Guards against: a wrong status, or a listener slot left set or a late payload unlogged after its subscriber left.
 TEST_F(ListenersOfUploadsAndCohorts, AConnectionHoldingBothClearsBothWhenItLeaves) {
   auto client = ipc::ControlClient::connect(socketPath());
   ASSERT_TRUE(client);
@@ -218,8 +215,7 @@ class RawPeer {
 
 class PeersBreakingTheFraming : public IpcFixture {};
 
-// Guards against: a broken frame left unanswered or unlogged, its connection
-// kept, requests before it dropped, or another client disturbed.
+// Guards against: a broken frame unanswered or unlogged, its connection kept, earlier requests dropped, others hurt.
 TEST_F(PeersBreakingTheFraming, OnlyTheBrokenConnectionEnds) {
   auto wellBehaved = ipc::ControlClient::connect(socketPath());
   ASSERT_TRUE(wellBehaved);

@@ -10,9 +10,7 @@ namespace {
 
 std::string app(const std::string& extra = "") { return "[Desktop Entry]\nType=Application\nName=Tool\n" + extra; }
 
-// Guards against: localised keys or other groups read as the plain ones, a
-// bad Hidden value hiding the entry, list escapes or trimming lost, or text
-// without a "Desktop Entry" group accepted.
+// Guards against: localised or other groups' keys read as plain ones, bad Hidden values, list escapes or trims lost.
 TEST(DesktopEntryParsing, WhatOneFileSays) {
   struct Row {
     const char* name;

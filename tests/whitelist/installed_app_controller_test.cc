@@ -82,9 +82,7 @@ class WhitelistUpdates : public ::testing::Test {
   std::unique_ptr<InstalledAppController> controller;
 };
 
-// Guards against: a request served after the wrong delay: 5 ms for "now",
-// "if stale" and unknown conditions, 60 s for "soon" unless the test
-// preference asks for 0 to 86400 s.
+// Guards against: a request served after the wrong delay (5 ms; 60 s for soon, or the 0 to 86400 s preference).
 TEST_F(WhitelistUpdates, EachConditionWaitsItsDelay) {
   struct Row {
     const char* name;
@@ -128,8 +126,7 @@ TEST_F(WhitelistUpdates, EachConditionWaitsItsDelay) {
   }
 }
 
-// Guards against: requests not coalesced into one generation, completions
-// lost or out of order, or the timer not re-armed by each request.
+// Guards against: requests not coalesced into one generation, completions lost or reordered, the timer not re-armed.
 TEST_F(WhitelistUpdates, TenSoonRequestsShareOneGenerationAndCompleteInOrder) {
   writeStandardResource();
   std::vector<int> completed;
@@ -158,8 +155,7 @@ TEST_F(WhitelistUpdates, TenSoonRequestsShareOneGenerationAndCompleteInOrder) {
   EXPECT_EQ(querier->calls.size(), 2u);
 }
 
-// Guards against: the process allowed to exit between a request and the
-// generation serving it, also for a request made while a generation finishes.
+// Guards against: the process allowed to exit between a request and the generation serving it.
 TEST_F(WhitelistUpdates, ATransactionIsHeldFromEachRequestToItsGeneration) {
   writeStandardResource();
   int openDuringCompletion = -1;
@@ -192,8 +188,7 @@ TEST_F(WhitelistUpdates, DestroyedControllerRunsNothingMore) {
   EXPECT_EQ(openTransactions(), 0);
 }
 
-// Guards against: the assistant list written world-readable, unsorted or
-// unannounced, or a write failure stopping the completions.
+// Guards against: the assistant list written world-readable, unsorted or unannounced, or a failed write stopping work.
 TEST_F(WhitelistUpdates, AssistantListIsWrittenOwnerOnlyAndAnnounced) {
   writeStandardResource();
   ASSERT_TRUE(updateNow());
@@ -209,9 +204,7 @@ TEST_F(WhitelistUpdates, AssistantListIsWrittenOwnerOnlyAndAnnounced) {
   EXPECT_EQ(poster->posted.size(), 1u);
 }
 
-// Guards against: "if stale" regenerating a list younger than 48 hours, not
-// refreshing the time stamp of a stale one at once, or a missing list not
-// created owner-only before the generation.
+// Guards against: "if stale" redoing a list under 48 h old, or not refreshing or creating (0600) the list at once.
 TEST_F(WhitelistUpdates, IfStaleWorksOnlyOnAListOlderThan48Hours) {
   writeStandardResource();
   bool done = false;

@@ -57,8 +57,7 @@ class AssistantQueries : public ::testing::Test {
   std::shared_ptr<ScriptedAssistantRegistry> extensions = std::make_shared<ScriptedAssistantRegistry>();
 };
 
-// Guards against: the asker not waiting for a reply from another thread,
-// waiting forever for none, or a late reply writing into freed memory.
+// Guards against: the asker not waiting for a reply from another thread, waiting forever, or a late reply crashing.
 TEST_F(AssistantQueries, WaitsForTheReplyUntilTheConfiguredBound) {
   LogCapture logs;
   enableAssistant(true);

@@ -19,8 +19,7 @@ Bytes operator+(Bytes a, const Bytes& b) {
   return a;
 }
 
-// Guards against: runs split at the wrong length, flags in the wrong bit, or
-// the run coding chosen when it is not strictly shorter.
+// Guards against: runs split at the wrong length, flags in the wrong bit, or coding chosen when not strictly shorter.
 TEST(RunCoder, WorkedExamples) {
   struct Row {
     const char* name;
@@ -50,8 +49,7 @@ TEST(RunCoder, WorkedExamples) {
   }
 }
 
-// Guards against: a wrong digit value, position or case, the terminator not
-// read for a short version, or the compression bit in the wrong place.
+// Guards against: a wrong hex digit value or position, the short-version terminator, or a misplaced compression bit.
 TEST(VersionWord, LastFourCharactersAsHexWithTheCompressionBit) {
   struct Row {
     bool compressed;
@@ -108,8 +106,7 @@ std::vector<uint64_t> idsOf(const Bytes& bitmap) {
   return ids;
 }
 
-// Guards against: any coding or framing fault the independent reader sees,
-// on id sets from one id to the largest bitmap the record allows.
+// Guards against: any coding or framing fault the independent reader sees, from one id to the largest bitmap.
 TEST(SignatureRoundTrip, RandomIdSetsDecodeToTheirBitmaps) {
   std::mt19937_64 random(20240611);
   constexpr int kSets = 120;
@@ -143,8 +140,7 @@ TEST(SignatureRoundTrip, LargestBitmapWithItsFirstAndLastId) {
   EXPECT_EQ(decoded->bitmap, bitmapOf({0, last}));
 }
 
-// Guards against: a bitmap or payload past its 16-bit field being written
-// truncated instead of stopping the process.
+// Guards against: a bitmap or payload past its 16-bit field written truncated instead of stopping the process.
 TEST(SignatureLimitsDeathTest, PastTheRecordLimitsTheProcessStops) {
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(makeBitmap({kMaximumBitmapLength * 8}), "whitelist bitmap too long");
@@ -153,9 +149,7 @@ TEST(SignatureLimitsDeathTest, PastTheRecordLimitsTheProcessStops) {
   EXPECT_DEATH(signatureForIds(alternating, "0001"), "whitelist payload too long");
 }
 
-// Guards against: the wrong applications counted (not installed, disabled,
-// unversioned, an earlier entry, an id that is not unsigned) and a malformed
-// resource taken for one without whitelisted applications, or the reverse.
+// Guards against: wrong applications counted, or a malformed resource taken for one listing no app, or the reverse.
 TEST(WhitelistDocuments, WhichApplicationsCountAndWhichDocumentsAreUnusable) {
   FixedRegistry registry;
   registry.apps = {installed("mail"), installed("maps"), installed("tool"),
