@@ -15,15 +15,12 @@ namespace {
 std::string statusField(pid_t pid, const std::string& field) {
   std::ifstream in("/proc/" + std::to_string(pid) + "/status");
   for (std::string line; std::getline(in, line);) {
-    if (line.rfind(field + ":", 0) == 0) {
-      auto value = line.substr(field.size() + 1);
-      value.erase(0, value.find_first_not_of(" \t"));
-      return value;
-    }
+    if (line.rfind(field + ":", 0) == 0) return line.substr(line.find_first_not_of(" \t", field.size() + 1));
   }
   return "";
 }
 
+// Guards against: a system call, address family or mapping the daemon needs but the service unit refuses.
 TEST(SandboxedDaemon, FlushesEverythingUnderTheUnitsSystemCallFilter) {
 #if defined(__SANITIZE_ADDRESS__)
   GTEST_SKIP() << "the sanitizer runtime needs calls the unit refuses (setrlimit); the release tree runs this";
@@ -31,15 +28,13 @@ TEST(SandboxedDaemon, FlushesEverythingUnderTheUnitsSystemCallFilter) {
   ASSERT_TRUE(LoopbackCertificate::get().made) << "openssl could not make a certificate";
   const char* source = std::getenv("FBF_SOURCE_DIR");
   ASSERT_NE(source, nullptr) << "FBF_SOURCE_DIR is not set";
-  const fs::path unit = fs::path(source) / "packaging" / "vireon-fbf.service";
-
   DaemonHome home;
   Receiver receiver(home.root());
   ASSERT_TRUE(receiver.running());
   home.configure(receiver.url());
   ASSERT_EQ(home.generate(8, 6, 17).status, 0);
 
-  home.startDaemon({FBF_UNIT_SANDBOX, unit.string(), "--"});
+  home.startDaemon({FBF_UNIT_SANDBOX, (fs::path(source) / "packaging" / "vireon-fbf.service").string(), "--"});
   ASSERT_NE(home.daemon(), nullptr);
   const pid_t pid = home.daemon()->pid();
   // Mode 2 is a seccomp filter; the sandbox is really in place.
@@ -49,7 +44,6 @@ TEST(SandboxedDaemon, FlushesEverythingUnderTheUnitsSystemCallFilter) {
 
   auto flush = home.fbfctl({"flush"});
   ASSERT_EQ(flush.status, 0) << flush.err << home.daemonLog();
-
   auto records = receiver.records();
   int sessions = 0;
   for (const auto& r : records) {
@@ -63,7 +57,6 @@ TEST(SandboxedDaemon, FlushesEverythingUnderTheUnitsSystemCallFilter) {
   EXPECT_TRUE(home.customFiles().empty()) << ::testing::PrintToString(home.customFiles());
   // A refused call would show up as a failure somewhere in the log.
   EXPECT_EQ(home.daemonLog().find("Operation not permitted"), std::string::npos) << home.daemonLog();
-
   EXPECT_EQ(home.stopDaemon(), 0) << home.daemonLog();
 }
 

@@ -18,7 +18,6 @@
 // pass under a weaker sandbox than the unit's.
 #include <seccomp.h>
 #include <sys/mman.h>
-#include <sys/prctl.h>
 #include <sys/shm.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -57,13 +56,9 @@ std::multimap<std::string, std::string> serviceSettings(const std::string& unitP
   bool inService = false;
   for (std::string line; std::getline(in, line);) {
     if (line.empty() || line[0] == '#' || line[0] == ';') continue;
-    if (line[0] == '[') {
-      inService = line.rfind("[Service]", 0) == 0;
-      continue;
-    }
+    if (line[0] == '[') inService = line.rfind("[Service]", 0) == 0;
     auto eq = line.find('=');
-    if (!inService || eq == std::string::npos) continue;
-    out.emplace(line.substr(0, eq), line.substr(eq + 1));
+    if (inService && eq != std::string::npos) out.emplace(line.substr(0, eq), line.substr(eq + 1));
   }
   return out;
 }
@@ -75,18 +70,14 @@ std::map<std::string, std::vector<std::string>> syscallGroups() {
   if (!p) die("cannot run systemd-analyze");
   std::map<std::string, std::vector<std::string>> groups;
   std::string current;
-  char buf[512];
-  while (std::fgets(buf, sizeof buf, p)) {
-    std::string line(buf);
-    while (!line.empty() && (line.back() == '\n' || line.back() == ' ')) line.pop_back();
-    if (line.empty()) continue;
-    if (line[0] == '@') {
-      current = line;
-      continue;
+  for (char buf[512]; std::fgets(buf, sizeof buf, p);) {
+    auto w = words(buf);
+    if (w.empty() || w[0][0] == '#') continue;
+    if (buf[0] == '@') {  // a group's own line; indented "@..." lines are members
+      current = w[0];
+    } else if (!current.empty()) {
+      groups[current].push_back(w[0]);
     }
-    auto w = words(line);
-    if (w.empty() || w[0][0] == '#' || current.empty()) continue;
-    groups[current].push_back(w[0]);
   }
   if (::pclose(p) != 0 || groups.empty()) die("systemd-analyze syscall-filter gave no groups");
   return groups;
@@ -94,27 +85,15 @@ std::map<std::string, std::vector<std::string>> syscallGroups() {
 
 void expand(const std::string& entry, const std::map<std::string, std::vector<std::string>>& groups,
             std::set<std::string>& out) {
-  if (entry[0] != '@') {
-    out.insert(entry);
-    return;
-  }
+  if (entry[0] != '@') return void(out.insert(entry));
   auto it = groups.find(entry);
   if (it == groups.end()) die("unknown system call group " + entry);
   for (const auto& member : it->second) expand(member, groups, out);
 }
 
-int errnoNamed(const std::string& name) {
-  static const std::map<std::string, int> known = {{"EPERM", EPERM}, {"EACCES", EACCES}, {"ENOSYS", ENOSYS}};
+int named(const std::map<std::string, int>& known, const std::string& name) {
   auto it = known.find(name);
-  if (it == known.end()) die("unsupported SystemCallErrorNumber " + name);
-  return it->second;
-}
-
-int familyNamed(const std::string& name) {
-  static const std::map<std::string, int> known = {
-      {"AF_UNIX", AF_UNIX}, {"AF_INET", AF_INET}, {"AF_INET6", AF_INET6}, {"AF_NETLINK", AF_NETLINK}};
-  auto it = known.find(name);
-  if (it == known.end()) die("unsupported address family " + name);
+  if (it == known.end()) die("unsupported setting " + name);
   return it->second;
 }
 
@@ -131,34 +110,33 @@ int main(int argc, char** argv) {
   }
   auto settings = serviceSettings(argv[1]);
   auto groups = syscallGroups();
+  auto setting = [&](const char* key) {
+    auto it = settings.find(key);
+    return it == settings.end() ? std::string() : it->second;
+  };
 
   // Allowed calls: the first non-negated list, minus every "~" list.
   std::set<std::string> allowed;
   bool haveAllowList = false;
   for (auto [it, end] = settings.equal_range("SystemCallFilter"); it != end; ++it) {
-    std::string value = it->second;
-    bool deny = !value.empty() && value[0] == '~';
-    if (deny) value.erase(0, 1);
+    bool deny = it->second.starts_with('~');
     std::set<std::string> entries;
-    for (const auto& w : words(value)) expand(w, groups, entries);
-    if (deny) {
-      for (const auto& e : entries) allowed.erase(e);
-    } else {
-      haveAllowList = true;
-      allowed.insert(entries.begin(), entries.end());
-    }
+    for (const auto& w : words(it->second.substr(deny ? 1 : 0))) expand(w, groups, entries);
+    for (const auto& e : entries) deny ? void(allowed.erase(e)) : void(allowed.insert(e));
+    haveAllowList |= !deny;
   }
   if (!haveAllowList) die("the unit has no SystemCallFilter allow list");
-  auto errnoIt = settings.find("SystemCallErrorNumber");
-  const int refusal = errnoIt == settings.end() ? EPERM : errnoNamed(errnoIt->second);
-  auto archIt = settings.find("SystemCallArchitectures");
-  if (archIt == settings.end() || archIt->second != "native") die("expected SystemCallArchitectures=native");
-  const bool mdwe = settings.count("MemoryDenyWriteExecute") && settings.find("MemoryDenyWriteExecute")->second == "yes";
+  const std::string errnoName = setting("SystemCallErrorNumber");
+  const int refusal =
+      errnoName.empty() ? EPERM : named({{"EPERM", EPERM}, {"EACCES", EACCES}, {"ENOSYS", ENOSYS}}, errnoName);
+  if (setting("SystemCallArchitectures") != "native") die("expected SystemCallArchitectures=native");
+  const bool mdwe = setting("MemoryDenyWriteExecute") == "yes";
   std::vector<int> families;
-  if (auto fam = settings.find("RestrictAddressFamilies"); fam != settings.end()) {
-    for (const auto& w : words(fam->second)) families.push_back(familyNamed(w));
+  for (const auto& w : words(setting("RestrictAddressFamilies"))) {
+    families.push_back(
+        named({{"AF_UNIX", AF_UNIX}, {"AF_INET", AF_INET}, {"AF_INET6", AF_INET6}, {"AF_NETLINK", AF_NETLINK}}, w));
   }
-  if (auto um = settings.find("UMask"); um != settings.end()) ::umask(static_cast<mode_t>(std::stoul(um->second, nullptr, 8)));
+  if (auto um = setting("UMask"); !um.empty()) ::umask(static_cast<mode_t>(std::stoul(um, nullptr, 8)));
 
   // Anything not allowed fails with the unit's errno; other architectures
   // are killed (libseccomp's default for a foreign architecture).
@@ -174,15 +152,13 @@ int main(int argc, char** argv) {
   size_t rules = 0;
   for (const auto& name : allowed) {
     int nr = seccomp_syscall_resolve_name(name.c_str());
-    if (nr == __NR_SCMP_ERROR) continue;  // not a call of this architecture
-    if (conditional.count(name)) continue;
+    if (nr == __NR_SCMP_ERROR || conditional.count(name)) continue;  // not a call of this architecture
     check(seccomp_rule_add(ctx, SCMP_ACT_ALLOW, nr, 0), "allow " + name);
     ++rules;
   }
   auto allowIf = [&](const char* name, scmp_arg_cmp cmp) {
-    if (!allowed.count(name)) return;
     int nr = seccomp_syscall_resolve_name(name);
-    if (nr == __NR_SCMP_ERROR) return;
+    if (!allowed.count(name) || nr == __NR_SCMP_ERROR) return;
     check(seccomp_rule_add(ctx, SCMP_ACT_ALLOW, nr, 1, cmp), std::string("allow ") + name + " with a condition");
   };
   for (int family : families) allowIf("socket", SCMP_A0(SCMP_CMP_EQ, static_cast<scmp_datum_t>(family)));
@@ -199,7 +175,6 @@ int main(int argc, char** argv) {
   if (rules < 100) die("suspiciously few system calls allowed");
   check(seccomp_load(ctx), "seccomp_load");
   seccomp_release(ctx);
-
   ::execvp(argv[3], argv + 3);
   die(std::string("cannot run ") + argv[3] + ": " + std::strerror(errno));
 }

@@ -6,120 +6,76 @@
 #include "ipc/frame_channel.h"
 #include "ipc_fixture.h"
 
-#include "corevireon.pb.h"
-
 #include <unistd.h>
 
 namespace fbf::testing {
 namespace {
 
-ipc::Request flushRequest() {
+ipc::Request request(void (*set)(ipc::Request&), uint64_t id = 0) {
   ipc::Request r;
-  r.mutable_flush();
+  set(r);
+  r.set_id(id);
   return r;
 }
-
-// ---------------------------------------------------------------------------
+void flush(ipc::Request& r) { r.mutable_flush(); }
+void teeUploads(ipc::Request& r) { r.mutable_teeuploads(); }
+void teeCohorts(ipc::Request& r) { r.mutable_teecohortsfeedback(); }
 
 class AClientAskingTheDaemon : public IpcFixture {};
 
+// Guards against: a flush answered before it has finished.
 TEST_F(AClientAskingTheDaemon, GetsAFullFlushAnsweredWhenTheFlushHasFinished) {
   runner->holdCompletions(true);
   auto client = ipc::ControlClient::connect(socketPath());
   ASSERT_TRUE(client);
   auto outcome = std::async(std::launch::async, [&] { return client->flush(); });
-
   ASSERT_TRUE(eventually([&] { return runner->heldCount() == 1; }));
-  // Nothing can answer before the flush completes.
   EXPECT_NE(outcome.wait_for(std::chrono::seconds(0)), std::future_status::ready);
   assembly->workloop().sync([&] { runner->releaseAll(); });
-
   auto result = outcome.get();
   EXPECT_TRUE(result.ok) << result.error;
-  EXPECT_EQ(runner->calls(), std::vector<std::string>{"flushAll"});
   EXPECT_TRUE(logs.contains("Service created new flusher"));
 }
 
-TEST_F(AClientAskingTheDaemon, FlushesOneCustomFeedbackType) {
+// Guards against: a request kind routed wrongly, a refusal or missing argument unreported, or ending the connection.
+TEST_F(AClientAskingTheDaemon, EachRequestKindGetsItsAnswer) {
   auto client = ipc::ControlClient::connect(socketPath());
   ASSERT_TRUE(client);
-  auto result = client->flushCustomFeedbackType("UserReport");
-  EXPECT_TRUE(result.ok) << result.error;
-  EXPECT_EQ(runner->calls(), std::vector<std::string>{"flushCustomFeedbackType UserReport"});
-  EXPECT_EQ(logs.count("Service created new flusher"), 1u);
-}
+  auto session = env.cacheDir() / "session.42.0A1B.closed";
+  struct Row {
+    const char* name;
+    std::function<ipc::ControlOutcome()> call;
+    std::string error;  // empty: ok
+  };
+  const Row rows[] = {
+      {"custom type", [&] { return client->flushCustomFeedbackType("UserReport"); }, ""},
+      {"no custom type", [&] { return client->flushCustomFeedbackType(""); }, "missing custom feedback type"},
+      {"session", [&] { return client->flushSessionEagerly(session); }, ""},
+      {"no session", [&] { return client->flushSessionEagerly(""); }, "missing session file path"},
+      {"refused session", [&] { return client->flushSessionEagerly(env.temp.path() / "session.1.A.closed"); },
+       "refused: " + (env.temp.path() / "session.1.A.closed").string() + " is outside the cache directory"},
+      {"whitelists", [&] { return client->updateWhitelists(2); }, ""},
+      {"flush", [&] { return client->flush(); }, ""},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    auto outcome = row.call();
+    EXPECT_EQ(outcome.ok, row.error.empty());
+    EXPECT_EQ(outcome.error, row.error);
+  }
+  EXPECT_EQ(runner->calls(), (std::vector<std::string>{"flushCustomFeedbackType UserReport",
+                                                       "flushSessionEagerly " + session.string(), "flushAll"}));
+  EXPECT_EQ(client->updateWhitelists(1).whitelistSignature, "signature-1");
+  EXPECT_EQ(conditions(), (std::vector<uint64_t>{2, 1}));
+  EXPECT_TRUE(logs.contains("Service created new flusher for eager flush of " + session.string()));
 
-TEST_F(AClientAskingTheDaemon, FlushesOneSessionEagerly) {
-  auto path = env.cacheDir() / "session.42.0A1B.closed";
-  auto client = ipc::ControlClient::connect(socketPath());
-  ASSERT_TRUE(client);
-  auto result = client->flushSessionEagerly(path);
-  EXPECT_TRUE(result.ok) << result.error;
-  EXPECT_EQ(runner->calls(), std::vector<std::string>{"flushSessionEagerly " + path.string()});
-  EXPECT_TRUE(logs.contains("Service created new flusher for eager flush of " + path.string()));
-}
-
-TEST_F(AClientAskingTheDaemon, HearsWhyAnEagerFlushOfAPathOutsideTheCacheIsRefused) {
-  auto client = ipc::ControlClient::connect(socketPath());
-  ASSERT_TRUE(client);
-  auto outside = client->flushSessionEagerly(env.temp.path() / "session.42.0A1B.closed");
-  EXPECT_FALSE(outside.ok);
-  EXPECT_NE(outside.error.find("outside the cache directory"), std::string::npos) << outside.error;
-
-  auto notASession = client->flushSessionEagerly(env.cacheDir() / "bag.plist");
-  EXPECT_FALSE(notASession.ok);
-  EXPECT_NE(notASession.error.find("not a session file name"), std::string::npos)
-      << notASession.error;
-
-  EXPECT_TRUE(runner->calls().empty());
-  // The connection is still good for the next request.
-  EXPECT_TRUE(client->flush().ok);
-}
-
-TEST_F(AClientAskingTheDaemon, UpdatesTheWhitelistsAndGetsTheStoredSignature) {
-  auto client = ipc::ControlClient::connect(socketPath());
-  ASSERT_TRUE(client);
-  auto result = client->updateWhitelists(2);
-  EXPECT_TRUE(result.ok) << result.error;
-  EXPECT_EQ(result.whitelistSignature, "signature-2");
-  assembly->workloop().sync([&] { EXPECT_EQ(controller->conditions, std::vector<uint64_t>{2}); });
-}
-
-TEST_F(AClientAskingTheDaemon, ReadsTheStatusWithListenersVersionAndPid) {
-  auto client = ipc::ControlClient::connect(socketPath());
-  ASSERT_TRUE(client);
-  std::string error;
-  auto status = client->status(&error);
-  ASSERT_TRUE(status) << error;
-  ASSERT_EQ(status->sessions_size(), 1);
-  EXPECT_EQ(status->sessions(0).name(), "closed");
-  EXPECT_EQ(status->sessions(0).files(), 3u);
-  ASSERT_EQ(status->customfeedback_size(), 1);
-  EXPECT_EQ(status->pid(), getpid());
-  EXPECT_NE(status->version().find("vireon-fbf/"), std::string::npos);
-  EXPECT_FALSE(status->uploadslistener());
-
-  auto tee = connectClient();
-  tee->resume();
-  ipc::Request subscribe;
-  subscribe.mutable_teeuploads();
-  ASSERT_TRUE(ask(*tee, subscribe).message);
-  status = client->status(&error);
-  ASSERT_TRUE(status) << error;
-  EXPECT_TRUE(status->uploadslistener());
-  EXPECT_FALSE(status->cohortslistener());
-}
-
-TEST_F(AClientAskingTheDaemon, IsToldWhenTheRequestCarriesNoOperationAndCanGoOn) {
-  auto client = connectClient();
-  client->resume();
-  auto answer = ask(*client, ipc::Request());
+  auto raw = connectClient();
+  raw->resume();
+  auto answer = ask(*raw, ipc::Request());
   ASSERT_TRUE(answer.message) << answer.error;
-  ASSERT_TRUE(answer.message->has_reply());
   EXPECT_FALSE(answer.message->reply().ok());
   EXPECT_EQ(answer.message->reply().error(), "unknown or missing operation");
-
-  answer = ask(*client, flushRequest());
+  answer = ask(*raw, request(flush));
   ASSERT_TRUE(answer.message) << answer.error;
   EXPECT_TRUE(answer.message->reply().ok());
 }
@@ -129,15 +85,12 @@ class ADaemonWithoutWhitelistMaintenance : public IpcFixture {
   bool withWhitelistController() const override { return false; }
 };
 
+// Guards against: a whitelist update without a controller crashing or succeeding.
 TEST_F(ADaemonWithoutWhitelistMaintenance, RefusesAWhitelistUpdateWithAReason) {
   auto client = ipc::ControlClient::connect(socketPath());
   ASSERT_TRUE(client);
-  auto result = client->updateWhitelists(0);
-  EXPECT_FALSE(result.ok);
-  EXPECT_EQ(result.error, "whitelist maintenance unavailable");
+  EXPECT_EQ(client->updateWhitelists(0).error, "whitelist maintenance unavailable");
 }
-
-// ---------------------------------------------------------------------------
 
 class ListenersOfUploadsAndCohorts : public IpcFixture {
  protected:
@@ -159,58 +112,43 @@ class ListenersOfUploadsAndCohorts : public IpcFixture {
       l->received.push_back(m);
     });
     listener->connection->resume();
-    if (uploads) {
-      ipc::Request r;
-      r.mutable_teeuploads();
-      auto answer = ask(*listener->connection, r);
-      EXPECT_TRUE(answer.message && answer.message->reply().ok()) << answer.error;
-    }
-    if (cohorts) {
-      ipc::Request r;
-      r.mutable_teecohortsfeedback();
-      auto answer = ask(*listener->connection, r);
+    for (auto [wanted, kind] : {std::pair{uploads, &teeUploads}, std::pair{cohorts, &teeCohorts}}) {
+      if (!wanted) continue;
+      auto answer = ask(*listener->connection, request(kind));
       EXPECT_TRUE(answer.message && answer.message->reply().ok()) << answer.error;
     }
     return listener;
   }
-
-  void uploadFromWorkQueue(const std::string& data, const std::string& format) {
+  void upload(const std::string& data) {
     assembly->workloop().sync([&] {
-      if (auto l = assembly->uploadListener()) l->willUploadData(data, format);
+      if (auto l = assembly->uploadListener()) l->willUploadData(data, "FeedbackV2");
     });
   }
 };
 
-TEST_F(ListenersOfUploadsAndCohorts, ASubscriberReceivesEachPayloadTheWorkQueueAnnounces) {
-  auto listener = subscribe(true, false);
+// Guards against: payloads lost, altered or sent to the wrong subscriber.
+TEST_F(ListenersOfUploadsAndCohorts, EachSubscriberReceivesThePayloadsOfItsKind) {
+  auto uploads = subscribe(true, false);
+  auto cohorts = subscribe(false, true);
   EXPECT_TRUE(logs.contains("setting up a new sending stream listener"));
-  uploadFromWorkQueue("first payload", "FeedbackV2");
-  uploadFromWorkQueue(std::string("\0\1\2", 3), "FeedbackV2PB");
-
-  ASSERT_TRUE(eventually([&] { return listener->count() == 2; }));
-  std::lock_guard l(listener->m);
-  ASSERT_TRUE(listener->received[0].has_willuploaddata());
-  EXPECT_EQ(listener->received[0].willuploaddata().data(), "first payload");
-  EXPECT_EQ(listener->received[0].willuploaddata().format(), "FeedbackV2");
-  EXPECT_EQ(listener->received[1].willuploaddata().data(), std::string("\0\1\2", 3));
-}
-
-TEST_F(ListenersOfUploadsAndCohorts, ACohortsSubscriberReceivesGeneratedFeedback) {
-  auto listener = subscribe(false, true);
   EXPECT_TRUE(logs.contains("setting up a new cohort listnener"));
-  assembly->workloop().sync(
-      [&] { assembly->cohortsListener()->willGenerateCohortFeebacks("envelope bytes"); });
-  ASSERT_TRUE(eventually([&] { return listener->count() == 1; }));
-  std::lock_guard l(listener->m);
-  ASSERT_TRUE(listener->received[0].has_willgeneratecohortfeebacks());
-  EXPECT_EQ(listener->received[0].willgeneratecohortfeebacks().data(), "envelope bytes");
+  upload("first payload");
+  upload(std::string("\0\1\2", 3));
+  assembly->workloop().sync([&] { assembly->cohortsListener()->willGenerateCohortFeebacks("envelope bytes"); });
+
+  ASSERT_TRUE(eventually([&] { return uploads->count() == 2 && cohorts->count() == 1; }));
+  std::scoped_lock l(uploads->m, cohorts->m);
+  EXPECT_EQ(uploads->received[0].willuploaddata().data(), "first payload");
+  EXPECT_EQ(uploads->received[0].willuploaddata().format(), "FeedbackV2");
+  EXPECT_EQ(uploads->received[1].willuploaddata().data(), std::string("\0\1\2", 3));
+  EXPECT_EQ(cohorts->received[0].willgeneratecohortfeebacks().data(), "envelope bytes");
 }
 
-TEST_F(ListenersOfUploadsAndCohorts,
-       TheSecondSubscriberReplacesTheFirstAndTheFirstLeavingClearsTheSlot) {
+// Guards against: a slot kept for a subscriber that left, or cleared for the wrong one.
+TEST_F(ListenersOfUploadsAndCohorts, TheSecondSubscriberReplacesTheFirstAndTheFirstLeavingClearsTheSlot) {
   auto first = subscribe(true, false);
   auto second = subscribe(true, false);
-  uploadFromWorkQueue("only for the second", "FeedbackV2");
+  upload("only for the second");
   ASSERT_TRUE(eventually([&] { return second->count() == 1; }));
   EXPECT_EQ(first->count(), 0u);
   ASSERT_EQ(openConnections(), 2u);
@@ -223,42 +161,33 @@ TEST_F(ListenersOfUploadsAndCohorts,
   EXPECT_TRUE(second->connection->isValid());
 }
 
-TEST_F(ListenersOfUploadsAndCohorts, AConnectionHoldingBothClearsUploadsThenCohorts) {
-  auto both = subscribe(true, true);
-  ASSERT_NE(uploadListener(), nullptr);
-  ASSERT_NE(cohortsListener(), nullptr);
+// Guards against: a wrong status, or a listener slot left set or a late payload unlogged after its subscriber left.
+TEST_F(ListenersOfUploadsAndCohorts, AConnectionHoldingBothClearsBothWhenItLeaves) {
+  auto client = ipc::ControlClient::connect(socketPath());
+  ASSERT_TRUE(client);
+  std::string error;
+  auto status = client->status(&error);
+  ASSERT_TRUE(status) << error;
+  EXPECT_FALSE(status->uploadslistener() || status->cohortslistener());
+  EXPECT_EQ(status->pid(), getpid());
+  EXPECT_NE(status->version().find("vireon-fbf/"), std::string::npos);
 
+  auto both = subscribe(true, true);
+  status = client->status(&error);
+  ASSERT_TRUE(status) << error;
+  EXPECT_TRUE(status->uploadslistener() && status->cohortslistener());
+  EXPECT_EQ(status->sessions(0).files(), 3u);
+  auto proxy = uploadListener();
   both->connection->invalidate();
-  ASSERT_TRUE(eventually([&] { return openConnections() == 0; }));
+  ASSERT_TRUE(eventually([&] { return openConnections() == 1; }));
   EXPECT_EQ(uploadListener(), nullptr);
   EXPECT_EQ(cohortsListener(), nullptr);
-
-  auto lines = logs.lines();
-  auto at = [&](const std::string& text) {
-    return std::find_if(lines.begin(), lines.end(),
-                        [&](const std::string& l) { return l.find(text) != l.npos; });
-  };
-  auto invalidating = at("invalidating connection from PID " + std::to_string(getpid()));
-  auto uploads = at("clearing the sending stream listener");
-  auto cohorts = at("clearing the cohorts listener");
-  ASSERT_NE(invalidating, lines.end());
-  ASSERT_NE(uploads, lines.end());
-  ASSERT_NE(cohorts, lines.end());
-  EXPECT_LT(invalidating, uploads);
-  EXPECT_LT(uploads, cohorts);
-}
-
-TEST_F(ListenersOfUploadsAndCohorts, APayloadForASubscriberThatLeftIsLoggedAsAProxyError) {
-  auto listener = subscribe(true, false);
-  auto proxy = uploadListener();
-  listener->connection->invalidate();
-  ASSERT_TRUE(eventually([&] { return openConnections() == 0; }));
+  EXPECT_TRUE(logs.contains("invalidating connection from PID " + std::to_string(getpid())));
+  EXPECT_TRUE(logs.contains("clearing the cohorts listener"));
   // A flush that took the proxy before the slot was cleared still calls it.
   assembly->workloop().sync([&] { proxy->willUploadData("late", "FeedbackV2"); });
-  ASSERT_TRUE(eventually([&] { return logs.contains("remote proxy error: "); }));
+  EXPECT_TRUE(eventually([&] { return logs.contains("remote proxy error: "); }));
 }
-
-// ---------------------------------------------------------------------------
 
 // A peer writing raw bytes on the socket, read back synchronously.
 class RawPeer {
@@ -276,8 +205,7 @@ class RawPeer {
     if (ec) return std::nullopt;
     std::string body(ipc::decodeFrameHeader(header), '\0');
     asio::read(socket_, asio::buffer(body), ec);
-    if (ec) return std::nullopt;
-    return body;
+    return ec ? std::nullopt : std::optional(body);
   }
 
  private:
@@ -285,83 +213,56 @@ class RawPeer {
   asio::local::stream_protocol::socket socket_;
 };
 
-class PeersBreakingTheFraming : public IpcFixture {
- protected:
-  void SetUp() override {
-    IpcFixture::SetUp();
-    wellBehaved = ipc::ControlClient::connect(socketPath());
-    ASSERT_TRUE(wellBehaved);
-    ASSERT_TRUE(wellBehaved->flush().ok);
-  }
-  void TearDown() override {
-    wellBehaved.reset();
-    IpcFixture::TearDown();
-  }
+class PeersBreakingTheFraming : public IpcFixture {};
 
-  // The other client is still served, and only the broken connection went.
-  void expectOthersStillServed() {
+// Guards against: a broken frame unanswered or unlogged, its connection kept, earlier requests dropped, others hurt.
+TEST_F(PeersBreakingTheFraming, OnlyTheBrokenConnectionEnds) {
+  auto wellBehaved = ipc::ControlClient::connect(socketPath());
+  ASSERT_TRUE(wellBehaved);
+  struct Row {
+    const char* name;
+    std::string bytes;
+    const char* logLine;
+    std::vector<uint64_t> failedReplies;  // ids of the "not ok" replies before the close
+    size_t flushes;                       // requests served before the broken frame
+  };
+  const Row rows[] = {
+      {"undecodable", ipc::encodeFrame(std::string("\xff\xff\xff\xff\xff\xff", 6)), "does not decode", {0}, 0},
+      {"oversized", ipc::encodeFrameHeader(static_cast<uint32_t>(ipc::kMaxRequestFrameBytes + 1)),
+       "exceeds the limit", {}, 0},
+      {"half a header", std::string(2, '\0'), "went away after 2 of 4 header bytes", {}, 0},
+      {"cut short", ipc::encodeFrameHeader(100) + std::string(10, 'x'), "went away after 10 of 100 bytes", {}, 0},
+      {"request before a broken frame", ipc::encodeFrame(request(flush, 7).SerializeAsString()) +
+       ipc::encodeFrameHeader(50), "went away after 0 of 50 bytes", {}, 1},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    size_t before = runner->calls().size();
+    RawPeer peer(socketPath());
+    peer.write(row.bytes);
+    peer.shutdownSending();
+    std::vector<uint64_t> failedReplies;
+    while (auto frame = peer.readFrame()) {
+      ipc::DaemonMessage message;
+      ASSERT_TRUE(message.ParseFromString(*frame));
+      if (!message.reply().ok()) failedReplies.push_back(message.reply().id());
+    }
+    EXPECT_EQ(failedReplies, row.failedReplies);
+    EXPECT_TRUE(eventually([&] { return logs.contains(row.logLine); }));
+    EXPECT_TRUE(eventually([&] { return runner->calls().size() == before + row.flushes; }));
     ASSERT_TRUE(eventually([&] { return openConnections() == 1; }));
     auto result = wellBehaved->flush();
     EXPECT_TRUE(result.ok) << result.error;
   }
-
-  std::unique_ptr<ipc::ControlClient> wellBehaved;
-};
-
-TEST_F(PeersBreakingTheFraming, AFrameThatDoesNotDecodeIsAnsweredWithIdZeroAndEndsThatConnection) {
-  RawPeer peer(socketPath());
-  peer.write(ipc::encodeFrame(std::string("\xff\xff\xff\xff\xff\xff", 6)));
-
-  auto frame = peer.readFrame();
-  ASSERT_TRUE(frame);
-  ipc::DaemonMessage message;
-  ASSERT_TRUE(message.ParseFromString(*frame));
-  ASSERT_TRUE(message.has_reply());
-  EXPECT_EQ(message.reply().id(), 0u);
-  EXPECT_FALSE(message.reply().ok());
-  EXPECT_FALSE(peer.readFrame()) << "the connection should have been closed";
-  EXPECT_TRUE(logs.contains("does not decode"));
-  expectOthersStillServed();
+  EXPECT_EQ(runner->calls().size(), 6u);
 }
 
-TEST_F(PeersBreakingTheFraming, AnOversizedLengthEndsThatConnectionWithoutReadingIt) {
-  RawPeer peer(socketPath());
-  peer.write(ipc::encodeFrameHeader(static_cast<uint32_t>(ipc::kMaxRequestFrameBytes + 1)));
-  EXPECT_FALSE(peer.readFrame());
-  EXPECT_TRUE(eventually([&] { return logs.contains("exceeds the limit"); }));
-  expectOthersStillServed();
-}
-
-TEST_F(PeersBreakingTheFraming, APeerLeavingInTheMiddleOfAFrameEndsOnlyItsConnection) {
-  {
-    RawPeer peer(socketPath());
-    ASSERT_TRUE(eventually([&] { return openConnections() == 2; }));
-    peer.write(ipc::encodeFrameHeader(100) + std::string(10, 'x'));
-  }
-  ASSERT_TRUE(eventually([&] { return logs.contains("went away after 10 of 100 bytes"); }));
-  expectOthersStillServed();
-  EXPECT_EQ(runner->calls().size(), 2u);
-}
-
-TEST_F(PeersBreakingTheFraming, RequestsBeforeABrokenFrameAreStillServed) {
-  RawPeer peer(socketPath());
-  ipc::Request request = flushRequest();
-  request.set_id(7);
-  peer.write(ipc::encodeFrame(request.SerializeAsString()) + ipc::encodeFrameHeader(50));
-  peer.shutdownSending();
-  ASSERT_TRUE(eventually([&] { return runner->calls().size() == 2; }));
-  expectOthersStillServed();
-}
-
-// ---------------------------------------------------------------------------
-
+// Guards against: a frame length in the wrong byte order.
 TEST(FrameHeader, IsTheLengthBigEndian) {
   EXPECT_EQ(ipc::encodeFrameHeader(0x01020304u), std::string("\x01\x02\x03\x04", 4));
   const uint8_t bytes[4] = {0xfe, 0x00, 0x00, 0x10};
   EXPECT_EQ(ipc::decodeFrameHeader(bytes), 0xfe000010u);
-  EXPECT_EQ(ipc::encodeFrame("ab"), std::string("\0\0\0\x02"
-                                                "ab",
-                                                6));
+  EXPECT_EQ(ipc::encodeFrame("ab"), std::string("\0\0\0\x02" "ab", 6));
 }
 
 }  // namespace

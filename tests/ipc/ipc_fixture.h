@@ -37,19 +37,12 @@ class FakeFlushRunner final : public FlushRunner {
  public:
   explicit FakeFlushRunner(fs::path cacheDir) : cacheDir_(std::move(cacheDir)) {}
 
-  void flushAll(std::function<void()> completion) override {
-    record("flushAll", std::move(completion));
-  }
+  void flushAll(std::function<void()> completion) override { record("flushAll", std::move(completion)); }
   void flushCustomFeedbackType(const std::string& type, std::function<void()> completion) override {
     record("flushCustomFeedbackType " + type, std::move(completion));
   }
-  std::optional<std::string> flushSessionEagerly(const fs::path& path,
-                                                 std::function<void()> completion) override {
-    if (path.parent_path() != cacheDir_)
-      return "refused: " + path.string() + " is outside the cache directory";
-    if (path.filename().string().rfind("session.", 0) != 0) {
-      return "refused: " + path.filename().string() + " is not a session file name";
-    }
+  std::optional<std::string> flushSessionEagerly(const fs::path& path, std::function<void()> completion) override {
+    if (path.parent_path() != cacheDir_) return "refused: " + path.string() + " is outside the cache directory";
     record("flushSessionEagerly " + path.string(), std::move(completion));
     return std::nullopt;
   }
@@ -60,10 +53,6 @@ class FakeFlushRunner final : public FlushRunner {
     closed->set_files(3);
     closed->set_bytes(4096);
     closed->set_oldestageseconds(90);
-    auto* reports = reply.add_customfeedback();
-    reports->set_name("UserReport");
-    reports->set_files(1);
-    reports->set_bytes(10);
     return reply;
   }
 
@@ -91,14 +80,11 @@ class FakeFlushRunner final : public FlushRunner {
 
  private:
   void record(std::string call, std::function<void()> completion) {
-    bool hold;
-    {
-      std::lock_guard l(m_);
-      calls_.push_back(std::move(call));
-      hold = hold_;
-      if (hold) held_.push_back(std::move(completion));
-    }
-    if (!hold) completion();
+    std::unique_lock l(m_);
+    calls_.push_back(std::move(call));
+    if (hold_) return held_.push_back(std::move(completion));
+    l.unlock();
+    completion();
   }
 
   fs::path cacheDir_;
@@ -114,8 +100,7 @@ class FakeInstalledAppController final : public InstalledAppControllerProtocol {
   explicit FakeInstalledAppController(UserDefaults& defaults) : defaults_(defaults) {}
   void updateWhitelists(uint64_t condition, std::function<void()> completion) override {
     conditions.push_back(condition);
-    defaults_.setObject(FBFStrings::kVIRAppWhitelistSignatureKey,
-                        "signature-" + std::to_string(condition));
+    defaults_.setObject(FBFStrings::kVIRAppWhitelistSignatureKey, "signature-" + std::to_string(condition));
     if (completion) completion();
   }
   std::vector<uint64_t> conditions;  // work queue only
@@ -156,7 +141,6 @@ class IpcFixture : public ::testing::Test {
     assembly = std::make_unique<FBFAssembly>(std::move(deps));
     runner = std::make_shared<FakeFlushRunner>(env.cacheDir());
     service = std::make_unique<FlusherService>(*assembly, runner);
-
     fs::create_directories(env.dirs.runtimeDir);
     acceptor.emplace(io, asio::local::stream_protocol::endpoint(socketPath().string()));
     acceptNext();
@@ -164,17 +148,9 @@ class IpcFixture : public ::testing::Test {
   }
 
   void TearDown() override {
-    std::promise<void> acceptorClosed;
-    asio::post(io, [&] {
-      acceptor->close();
-      acceptorClosed.set_value();
-    });
-    acceptorClosed.get_future().wait();
+    closeListener();
     service.reset();
-    // Let the closes run and their invalidations reach the work queue.
-    std::promise<void> ioIdle;
-    asio::post(io, [&] { ioIdle.set_value(); });
-    ioIdle.get_future().wait();
+    ioIdle();  // let the closes run and their invalidations reach the work queue
     runner->holdCompletions(false);
     assembly->workloop().sync([this] {
       runner->releaseAll();
@@ -194,6 +170,18 @@ class IpcFixture : public ::testing::Test {
     assembly.reset();
   }
 
+  // Runs `f` on the io thread and waits for it.
+  void onIo(std::function<void()> f) {
+    std::promise<void> done;
+    asio::post(io, [&] {
+      f();
+      done.set_value();
+    });
+    done.get_future().wait();
+  }
+  void ioIdle() { onIo([] {}); }
+  void closeListener() { onIo([this] { acceptor->close(); }); }
+
   fs::path socketPath() const { return env.dirs.socketPath(); }
 
   std::shared_ptr<ipc::DaemonConnection> connectClient() {
@@ -203,20 +191,24 @@ class IpcFixture : public ::testing::Test {
     return c;
   }
 
+  // What `f` returns when run on the work queue.
+  template <class F>
+  auto onWorkQueue(F f) {
+    decltype(f()) result{};
+    assembly->workloop().sync([&] { result = f(); });
+    return result;
+  }
   size_t openConnections() {
-    size_t n = 0;
-    assembly->workloop().sync([&] { n = service->openConnectionCount(); });
-    return n;
+    return onWorkQueue([&] { return service->openConnectionCount(); });
   }
   std::shared_ptr<ClientConduit> uploadListener() {
-    std::shared_ptr<ClientConduit> l;
-    assembly->workloop().sync([&] { l = assembly->uploadListener(); });
-    return l;
+    return onWorkQueue([&] { return assembly->uploadListener(); });
   }
   std::shared_ptr<ClientConduit> cohortsListener() {
-    std::shared_ptr<ClientConduit> l;
-    assembly->workloop().sync([&] { l = assembly->cohortsListener(); });
-    return l;
+    return onWorkQueue([&] { return assembly->cohortsListener(); });
+  }
+  std::vector<uint64_t> conditions() {
+    return onWorkQueue([&] { return controller->conditions; });
   }
 
   LogCapture logs;
@@ -232,12 +224,11 @@ class IpcFixture : public ::testing::Test {
 
  private:
   void acceptNext() {
-    acceptor->async_accept(
-        [this](const std::error_code& ec, asio::local::stream_protocol::socket socket) {
-          if (ec) return;
-          if (service) service->accept(std::move(socket));
-          acceptNext();
-        });
+    acceptor->async_accept([this](const std::error_code& ec, asio::local::stream_protocol::socket socket) {
+      if (ec) return;
+      if (service) service->accept(std::move(socket));
+      acceptNext();
+    });
   }
 };
 
@@ -250,13 +241,8 @@ inline Answer ask(ipc::DaemonConnection& connection, ipc::Request request) {
   auto promise = std::make_shared<std::promise<Answer>>();
   auto future = promise->get_future();
   connection.send(
-      std::move(request),
-      [promise](const ipc::DaemonMessage& m) {
-        promise->set_value({m, ""});
-      },
-      [promise](const std::string& e) {
-        promise->set_value({std::nullopt, e});
-      });
+      std::move(request), [promise](const ipc::DaemonMessage& m) { promise->set_value({m, ""}); },
+      [promise](const std::string& e) { promise->set_value({std::nullopt, e}); });
   return future.get();
 }
 

@@ -14,12 +14,9 @@ uint32_t be32(const uint8_t* p) {
 uint16_t be16(const uint8_t* p) { return static_cast<uint16_t>((p[0] << 8) | p[1]); }
 
 int base64Value(char c) {
-  if (c >= 'A' && c <= 'Z') return c - 'A';
-  if (c >= 'a' && c <= 'z') return c - 'a' + 26;
-  if (c >= '0' && c <= '9') return c - '0' + 52;
-  if (c == '+') return 62;
-  if (c == '/') return 63;
-  return -1;
+  static const std::string_view kAlphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+  auto at = kAlphabet.find(c);
+  return at == std::string_view::npos ? -1 : static_cast<int>(at);
 }
 
 // Runs of equal bits, each at most 256 long, counted straight from the bits.
@@ -81,13 +78,8 @@ std::vector<uint8_t> md5Tail(const std::vector<uint8_t>& bytes) {
 }
 
 std::vector<uint8_t> bitmapOf(const std::vector<uint64_t>& ids) {
-  uint64_t largest = *std::max_element(ids.begin(), ids.end());
-  std::vector<bool> bits(largest + 1, false);
-  for (auto id : ids) bits[id] = true;
-  std::vector<uint8_t> bytes(largest / 8 + 1, 0);
-  for (size_t i = 0; i < bits.size(); ++i) {
-    if (bits[i]) bytes[i / 8] = static_cast<uint8_t>(bytes[i / 8] | (1u << (7 - i % 8)));
-  }
+  std::vector<uint8_t> bytes(*std::max_element(ids.begin(), ids.end()) / 8 + 1, 0);
+  for (auto id : ids) bytes[id / 8] = static_cast<uint8_t>(bytes[id / 8] | (1u << (7 - id % 8)));
   return bytes;
 }
 
@@ -135,16 +127,13 @@ std::optional<DecodedSignature> decodeSignature(std::string_view text, std::stri
       }
       size_t length = size_t{counts[i]} + 1;
       if (position + length > bitmapLength * 8) return fail(why, "runs overflow the bitmap");
-      if (ones) {
-        for (size_t k = position; k < position + length; ++k) {
-          decoded.bitmap[k / 8] = static_cast<uint8_t>(decoded.bitmap[k / 8] | (0x80u >> (k % 8)));
-        }
+      for (size_t k = position; ones && k < position + length; ++k) {
+        decoded.bitmap[k / 8] = static_cast<uint8_t>(decoded.bitmap[k / 8] | (0x80u >> (k % 8)));
       }
       position += length;
     }
-    if (runs % 8 != 0 && (flags[flagBytes - 1] & ((1u << (8 - runs % 8)) - 1)) != 0) {
+    if (runs % 8 != 0 && (flags[flagBytes - 1] & ((1u << (8 - runs % 8)) - 1)) != 0)
       return fail(why, "flag padding not zero");
-    }
     if (position != bitmapLength * 8) return fail(why, "runs do not cover the bitmap");
   }
   if (md5Tail(decoded.bitmap) != tail) return fail(why, "digest tail mismatch");

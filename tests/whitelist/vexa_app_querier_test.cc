@@ -2,46 +2,40 @@
 
 #include "assembly/fbf_strings.h"
 #include "support/test_support.h"
+#include "whitelist/whitelist_fixtures.h"
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
 #include <mutex>
+#include <thread>
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
 
 using namespace std::chrono_literals;
+using Ids = std::vector<std::string>;
 
-class FixedRegistry final : public ApplicationRegistry {
- public:
-  std::vector<InstalledApplication> installedApplications() const override { return apps; }
-  std::vector<InstalledApplication> apps;
-};
-
-// Answers at once, later by hand, or never.
+// Answers at once, or keeps the reply for the test to give (or never give).
 class ScriptedAssistantRegistry final : public AssistantAppRegistry {
  public:
-  enum class Mode { immediately, byHand, never };
-
   void queryEntitledApplications(Reply reply) override {
     std::lock_guard l(m);
     ++queries;
-    if (mode == Mode::immediately) {
+    if (immediately) {
       reply(answer);
     } else {
       pending = std::move(reply);
     }
   }
-
-  Mode mode = Mode::immediately;
+  bool immediately = true;
   std::vector<std::optional<std::string>> answer;
   std::mutex m;
   int queries = 0;
   Reply pending;
 };
 
-std::vector<std::string> sorted(std::vector<std::string> v) {
+Ids sorted(Ids v) {
   std::sort(v.begin(), v.end());
   return v;
 }
@@ -49,96 +43,42 @@ std::vector<std::string> sorted(std::vector<std::string> v) {
 class AssistantQueries : public ::testing::Test {
  protected:
   AssistantQueries() {
-    registry->apps = {{"org.vireon.Notes", std::string("1"), false},
-                      {"org.vireon.Music", std::string("1"), false},
-                      {"org.example.Mail", std::string("1"), false}};
-    defaults =
-        env.preferences->defaultsForDomain(std::string(FBFStrings::LinuxDefaults::AssistantDomain));
+    registry->apps = {installed("org.vireon.Notes"), installed("org.vireon.Music"), installed("org.example.Mail")};
+    defaults = env.preferences->defaultsForDomain(std::string(FBFStrings::LinuxDefaults::AssistantDomain));
   }
-
   VexaAppQuerier querier(std::chrono::milliseconds wait = VexaAppQuerier::kDefaultWait) {
     return VexaAppQuerier(defaults, extensions, registry, wait);
   }
-  void enableAssistant(bool on) {
-    defaults->setObject(FBFStrings::LinuxDefaults::AssistantEnabled, on);
-  }
+  void enableAssistant(bool on) { defaults->setObject(FBFStrings::LinuxDefaults::AssistantEnabled, on); }
 
-  testing::TestEnvironment env;
+  TestEnvironment env;
   std::shared_ptr<UserDefaults> defaults;
   std::shared_ptr<FixedRegistry> registry = std::make_shared<FixedRegistry>();
-  std::shared_ptr<ScriptedAssistantRegistry> extensions =
-      std::make_shared<ScriptedAssistantRegistry>();
+  std::shared_ptr<ScriptedAssistantRegistry> extensions = std::make_shared<ScriptedAssistantRegistry>();
 };
 
-TEST_F(AssistantQueries, AssistantOffOrUnsetAsksNothing) {
-  EXPECT_TRUE(querier().findEnabledVexaApps({"seed"}, {}).empty());
-  EXPECT_EQ(querier().assistantEnabled(), false);
-  enableAssistant(false);
-  EXPECT_TRUE(querier().findEnabledVexaApps({"seed"}, {}).empty());
-  EXPECT_EQ(extensions->queries, 0);
-}
-
-TEST_F(AssistantQueries, WithoutAssistantPreferencesNothingIsAsked) {
-  VexaAppQuerier noDefaults(nullptr, extensions, registry);
-  EXPECT_EQ(noDefaults.assistantEnabled(), std::nullopt);
-  EXPECT_TRUE(noDefaults.findEnabledVexaApps({"seed"}, {}).empty());
-  EXPECT_EQ(extensions->queries, 0);
-}
-
-TEST_F(AssistantQueries, UnitesSeedEntitledAndFirstPartyApps) {
+// Guards against: the asker not waiting for a reply from another thread, waiting forever, or a late reply crashing.
+TEST_F(AssistantQueries, WaitsForTheReplyUntilTheConfiguredBound) {
+  LogCapture logs;
   enableAssistant(true);
-  extensions->answer = {std::string("org.example.Todo"), std::nullopt, std::string("seed")};
-  auto result = querier().findEnabledVexaApps({"seed"}, {});
-  EXPECT_EQ(sorted(result), (std::vector<std::string>{"org.example.Todo", "org.vireon.Music",
-                                                      "org.vireon.Notes", "seed"}));
-}
+  extensions->immediately = false;
+  std::thread answerer([this] {
+    for (;; std::this_thread::yield()) {
+      std::lock_guard l(extensions->m);
+      if (extensions->pending) return extensions->pending({std::string("org.example.Todo")});
+    }
+  });
+  EXPECT_EQ(sorted(querier().findEnabledVexaApps({}, {})),
+            (Ids{"org.example.Todo", "org.vireon.Music", "org.vireon.Notes"}));
+  answerer.join();
 
-TEST_F(AssistantQueries, AppsDisabledForSearchAreRemoved) {
-  enableAssistant(true);
-  extensions->answer = {std::string("org.example.Todo")};
-  auto result = querier().findEnabledVexaApps({"seed"}, {"org.vireon.Music", "org.example.Todo"});
-  EXPECT_EQ(sorted(result), (std::vector<std::string>{"org.vireon.Notes", "seed"}));
-}
-
-TEST_F(AssistantQueries, RegistryThatNeverAnswersGivesAnEmptyList) {
-  testing::LogCapture logs;
-  enableAssistant(true);
-  extensions->mode = ScriptedAssistantRegistry::Mode::never;
+  extensions->pending = nullptr;
   EXPECT_TRUE(querier(20ms).findEnabledVexaApps({"seed"}, {}).empty());
   EXPECT_TRUE(logs.contains("query of assistant-entitled applications timed out"));
-}
-
-TEST_F(AssistantQueries, LateAnswerAfterTheWaitIsHarmless) {
-  enableAssistant(true);
-  extensions->mode = ScriptedAssistantRegistry::Mode::byHand;
-  EXPECT_TRUE(querier(10ms).findEnabledVexaApps({"seed"}, {}).empty());
   ASSERT_TRUE(extensions->pending);
-  // The asker has gone; the reply still has somewhere to write.
-  std::thread late(
-      [reply = std::move(extensions->pending)] { reply({std::string("org.example.Late")}); });
+  std::thread late([reply = std::move(extensions->pending)] { reply({std::string("org.example.Late")}); });
   late.join();
 }
 
-TEST_F(AssistantQueries, AnswerFromAnotherThreadIsCollected) {
-  enableAssistant(true);
-  extensions->mode = ScriptedAssistantRegistry::Mode::byHand;
-  std::thread answerer([this] {
-    while (true) {
-      {
-        std::lock_guard l(extensions->m);
-        if (extensions->pending) {
-          extensions->pending({std::string("org.example.Todo")});
-          return;
-        }
-      }
-      std::this_thread::yield();
-    }
-  });
-  auto result = querier().findEnabledVexaApps({}, {});
-  answerer.join();
-  EXPECT_EQ(sorted(result),
-            (std::vector<std::string>{"org.example.Todo", "org.vireon.Music", "org.vireon.Notes"}));
-}
-
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing
