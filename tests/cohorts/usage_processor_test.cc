@@ -67,17 +67,6 @@ TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecordButNewsOnlyA
             "4");
 }
 
-// Guards against: the rule that a session counts swapping its search and engagement flags or ignoring its client.
-TEST(UsageRule, OnFlags) {
-  EXPECT_FALSE(UsageProcessor::session(true, false, corevireon::CV_CLIENT_MESSAGING));
-  EXPECT_TRUE(UsageProcessor::session(false, true, corevireon::CV_CLIENT_MESSAGING));
-  EXPECT_FALSE(UsageProcessor::session(false, true, corevireon::CV_CLIENT_WEB_BROWSER));
-  EXPECT_TRUE(UsageProcessor::session(true, true, corevireon::CV_CLIENT_NEWS));
-  EXPECT_FALSE(UsageProcessor::session(true, true, corevireon::CV_CLIENT_NONE));
-}
-
-// --- Every counter is reachable -------------------------------------------
-
 ResultFields section(int32_t code) { return ResultFields{.knownSectionBundleIdentifier = code}; }
 ResultFields bundle(int32_t code) { return ResultFields{.knownResultBundleId = code}; }
 
@@ -153,28 +142,13 @@ TEST_F(UsageCounting, EveryCounterIsReachedByItsEngagementAndNothingElseCounts) 
     report(s);
     EXPECT_EQ(counters(row.entity), row.expected);
     EXPECT_EQ(rows("VIRUsageEvent"), row.expected == none ? 0 : 1);
-    // The save still wrote the aggregation markers staged at bring-up (the
-    // first purge takes them).
-    EXPECT_EQ(rows("VIRFlushEvent"), &row == &cases[0] ? 3 : 0);
     on([&] { EXPECT_FALSE(store->managedObjectContext().hasChanges()); });
     store->purgeEventsOlderThan(start);
     on([] {});
   }
 }
 
-TEST_F(UsageCounting, ImagesLookUpTheEngagedResultAmongTheSessionsResults) {
-  auto s = makeSession("messages", start);
-  // The engagement names only the identifier; the shown result says it was
-  // a zero-keyword suggestion.
-  addResultEngagement(s, ResultFields{.identifier = "img-7"});
-  *addItem(s)->mutable_visibleresults()->add_results() =
-      makeResult(ResultFields{.identifier = "img-7", .knownSectionBundleIdentifier = 101});
-  addResultEngagement(s, ResultFields{.identifier = "img-8"});
-  report(s);
-  EXPECT_EQ(counters(kImages), "image=1 zkw=1");
-}
-
-TEST_F(UsageCounting, EveryEngagementOfASessionIsCountedOnce) {
+TEST_F(UsageCounting, EveryEngagementIsCountedOnceAndImagesLookUpTheEngagedResultAmongTheShownOnes) {
   auto s = searched("wayfin");
   addDidGoToSite(s);
   addDidGoToSite(s);
@@ -182,6 +156,15 @@ TEST_F(UsageCounting, EveryEngagementOfASessionIsCountedOnce) {
   addResultEngagement(s, std::nullopt);
   report(s);
   EXPECT_EQ(counters(kWayfin), "goToSite=2 vireonTap=1 other=1");
+  // The engagement names only the identifier; the shown result says it was
+  // a zero-keyword suggestion.
+  auto images = makeSession("messages", start);
+  addResultEngagement(images, ResultFields{.identifier = "img-7"});
+  *addItem(images)->mutable_visibleresults()->add_results() =
+      makeResult(ResultFields{.identifier = "img-7", .knownSectionBundleIdentifier = 101});
+  addResultEngagement(images, ResultFields{.identifier = "img-8"});
+  report(images);
+  EXPECT_EQ(counters(kImages), "image=1 zkw=1");
 }
 
 TEST_F(UsageCounting, ASessionProcessedAgainIsCountedOnceAndADifferentOneStillCounts) {

@@ -60,16 +60,12 @@ class PeriodicRun : public ::testing::Test {
 
 TEST_F(PeriodicRun, IntervalOverrideAppliesOnlyFromOneSecond) {
   auto a = activity();
-  for (int ignored : {0, -5}) {
-    env.defaults().setObject("FlushFrequencyInSeconds", ignored);
+  for (auto [seconds, interval] : {std::pair{0, 21600}, {-5, 21600}, {1, 1}}) {
+    env.defaults().setObject("FlushFrequencyInSeconds", seconds);
     overrideActivityFrequencyIfNecessary(env.assembly(), *a);
-    EXPECT_EQ(a->criteria().interval, std::chrono::hours(6));
-    EXPECT_FALSE(a->criteria().allowBattery);
+    EXPECT_EQ(a->criteria().interval, std::chrono::seconds(interval));
+    EXPECT_EQ(a->criteria().allowBattery, seconds == 1);
   }
-  env.defaults().setObject("FlushFrequencyInSeconds", 1);
-  overrideActivityFrequencyIfNecessary(env.assembly(), *a);
-  EXPECT_EQ(a->criteria().interval, std::chrono::seconds(1));
-  EXPECT_TRUE(a->criteria().allowBattery);
   EXPECT_FALSE(a->criteria().requireScreenSleep);
 }
 

