@@ -1,3 +1,4 @@
+#include "flushing/reporters.h"
 #include "flushing/session_processing_helper.h"
 #include "processing/processing_builders.h"
 
@@ -174,18 +175,19 @@ TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
 
 // Guards against: the results a feedback contains being gathered from the wrong fields or in the wrong order.
 TEST(ContainedResults, FollowTheKindsOfFeedback) {
-  auto ids = [](const auto& feedback) {
+  auto ids = [](const auto& results) {
     std::string out;
-    for (const auto* r : containedResults(feedback)) out += r->identifier() + " ";
+    for (const auto* r : results) out += r->identifier() + " ";
     return out;
   };
-  EXPECT_EQ(ids(pb<corevireon::CVRankingFeedback>(R"(sections { results { result { identifier: "ranked" } }
-      section { results { items { identifier: "s1" } } } } sections { section { results { items { identifier: "s2" } } } })")),
-            "s1 s2 ");
-  EXPECT_EQ(ids(pb<corevireon::CVResultRankingFeedback>(
-                R"(result { identifier: "main" } hiddenResults { identifier: "hidden" } duplicateResults { identifier: "dup" })")),
+  auto ranking = pb<corevireon::CVRankingFeedback>(R"(sections { results { result { identifier: "ranked" } }
+      section { results { items { identifier: "s1" } } } } sections { section { results { items { identifier: "s2" } } } })");
+  EXPECT_EQ(ids(RankingReporter::from(ranking)->containedResults()), "s1 s2 ");
+  EXPECT_FALSE(RankingReporter::from(corevireon::CVSectionRankingFeedback()));
+  EXPECT_EQ(ids(containedResults(pb<corevireon::CVResultRankingFeedback>(
+                R"(result { identifier: "main" } hiddenResults { identifier: "hidden" } duplicateResults { identifier: "dup" })"))),
             "dup hidden main ");
-  EXPECT_EQ(ids(corevireon::CVClearInputFeedback()), "");
+  EXPECT_EQ(ids(containedResults(corevireon::CVClearInputFeedback())), "");
 }
 
 }  // namespace
