@@ -23,20 +23,6 @@ void teeCohorts(ipc::Request& r) { r.mutable_teecohortsfeedback(); }
 
 class AClientAskingTheDaemon : public IpcFixture {};
 
-// Guards against: a flush answered before it has finished.
-TEST_F(AClientAskingTheDaemon, GetsAFullFlushAnsweredWhenTheFlushHasFinished) {
-  runner->holdCompletions(true);
-  auto client = ipc::ControlClient::connect(socketPath());
-  ASSERT_TRUE(client);
-  auto outcome = std::async(std::launch::async, [&] { return client->flush(); });
-  ASSERT_TRUE(eventually([&] { return runner->heldCount() == 1; }));
-  EXPECT_NE(outcome.wait_for(std::chrono::seconds(0)), std::future_status::ready);
-  assembly->workloop().sync([&] { runner->releaseAll(); });
-  auto result = outcome.get();
-  EXPECT_TRUE(result.ok) << result.error;
-  EXPECT_TRUE(logs.contains("Service created new flusher"));
-}
-
 // Guards against: a request kind routed wrongly, a missing argument unreported, or the connection ended by a refusal.
 TEST_F(AClientAskingTheDaemon, EachRequestKindGetsItsAnswer) {
   auto client = ipc::ControlClient::connect(socketPath());

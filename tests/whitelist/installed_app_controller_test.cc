@@ -53,11 +53,11 @@ class WhitelistUpdates : public ::testing::Test {
     deps.vexaAppQuerier = querier;
     deps.notifications = poster;
     controller = std::make_unique<InstalledAppController>(env.assembly(), std::move(deps));
+    writeFile(resourcePath(), whitelistDocument({{"org.example.Mail", entry(0)}}));
   }
 
   fs::path resourcePath() const { return env.dirs.dataHome / "vireond" / "app-whitelist.json"; }
   fs::path assistantList() const { return env.cacheDir() / "assistant-apps.json"; }
-  void writeStandardResource() { writeFile(resourcePath(), whitelistDocument({{"org.example.Mail", entry(0)}})); }
   int openTransactions() { return env.transactions->openCount(); }
   // Makes a request and lets the queue take it in (arming the timer).
   void request(uint64_t condition, std::function<void()> completion) {
@@ -102,7 +102,6 @@ TEST_F(WhitelistUpdates, EachConditionWaitsItsDelay) {
       {"soon, negative preference", kSoon, -1, 60s, "update whitelists soon"},
       {"soon, preference not a number", kSoon, "2", 60s, "update whitelists soon"},
   };
-  writeStandardResource();
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
     LogCapture rowLogs;
@@ -126,7 +125,6 @@ TEST_F(WhitelistUpdates, EachConditionWaitsItsDelay) {
 
 // Guards against: requests not coalesced into one generation, completions lost or reordered, the timer not re-armed.
 TEST_F(WhitelistUpdates, TenSoonRequestsShareOneGenerationAndCompleteInOrder) {
-  writeStandardResource();
   std::vector<int> completed;
   for (int i = 0; i < 10; ++i) {
     if (i > 0) queue->advance(5s);
@@ -155,7 +153,6 @@ TEST_F(WhitelistUpdates, TenSoonRequestsShareOneGenerationAndCompleteInOrder) {
 
 // Guards against: the process allowed to exit between a request and the generation serving it.
 TEST_F(WhitelistUpdates, ATransactionIsHeldFromEachRequestToItsGeneration) {
-  writeStandardResource();
   int openDuringCompletion = -1;
   bool second = false;
   controller->updateWhitelists(kNow, [&] {
@@ -176,7 +173,6 @@ TEST_F(WhitelistUpdates, ATransactionIsHeldFromEachRequestToItsGeneration) {
 
 // Guards against: queued work running on a destroyed controller.
 TEST_F(WhitelistUpdates, DestroyedControllerRunsNothingMore) {
-  writeStandardResource();
   bool done = false;
   controller->updateWhitelists(kNow, [&] { done = true; });
   controller.reset();
@@ -188,7 +184,6 @@ TEST_F(WhitelistUpdates, DestroyedControllerRunsNothingMore) {
 
 // Guards against: the assistant list written world-readable, unsorted or unannounced, or a failed write stopping work.
 TEST_F(WhitelistUpdates, AssistantListIsWrittenOwnerOnlyAndAnnounced) {
-  writeStandardResource();
   ASSERT_TRUE(updateNow());
   EXPECT_EQ(readFile(assistantList()), R"(["org.vireon.Notes","seed"])");
   EXPECT_EQ(modeOf(assistantList()), 0600u);
@@ -204,7 +199,6 @@ TEST_F(WhitelistUpdates, AssistantListIsWrittenOwnerOnlyAndAnnounced) {
 
 // Guards against: "if stale" redoing a list under 48 h old, or not refreshing or creating (0600) the list at once.
 TEST_F(WhitelistUpdates, IfStaleWorksOnlyOnAListOlderThan48Hours) {
-  writeStandardResource();
   bool done = false;
   controller->updateWhitelists(kIfStale, [&] { done = true; });
   EXPECT_FALSE(done);
@@ -236,7 +230,6 @@ TEST_F(WhitelistUpdates, IfStaleWorksOnlyOnAListOlderThan48Hours) {
 
 // Guards against: a link in place of the list being followed or kept.
 TEST_F(WhitelistUpdates, IfStaleWithALinkInPlaceOfTheListGoesOn) {
-  writeStandardResource();
   fs::create_symlink("/etc/passwd", assistantList());
   EXPECT_TRUE(updateNow(kIfStale));
   EXPECT_TRUE(logs.contains("could not get modify time"));
