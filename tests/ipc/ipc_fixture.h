@@ -8,6 +8,7 @@
 #include "assembly/fbf_strings.h"
 #include "ipc/daemon_connection.h"
 #include "ipc/flusher_service.h"
+#include "support/process.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>
@@ -21,17 +22,9 @@
 
 namespace fbf::testing {
 
-// Polls `done` until it holds; gives up (returning false) only after a very
-// generous bound, so a hang fails the test instead of blocking the suite.
-template <class Predicate>
-bool eventually(Predicate done) {
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-  while (!done()) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  return true;
-}
+// Polls `done` until it holds; gives up only after a generous bound, so a
+// hang fails the test instead of blocking the suite.
+inline bool eventually(const std::function<bool()>& done) { return waitUntil(done, std::chrono::seconds(20)); }
 
 class FakeFlushRunner final : public FlushRunner {
  public:
