@@ -6,7 +6,7 @@
 // with seccomp:
 //   SystemCallFilter=       allow list, then "~" deny lists, groups expanded
 //                           with `systemd-analyze syscall-filter`
-//   SystemCallErrorNumber=  the errno of a refused call
+//   SystemCallErrorNumber=  the errno of a refused call (EPERM, the only one used)
 //   SystemCallArchitectures=native
 //   RestrictAddressFamilies= socket() for other families is refused (EPERM
 //                           here, EAFNOSUPPORT under systemd)
@@ -91,12 +91,6 @@ void expand(const std::string& entry, const std::map<std::string, std::vector<st
   for (const auto& member : it->second) expand(member, groups, out);
 }
 
-int named(const std::map<std::string, int>& known, const std::string& name) {
-  auto it = known.find(name);
-  if (it == known.end()) die("unsupported setting " + name);
-  return it->second;
-}
-
 void check(int rc, const std::string& what) {
   if (rc < 0) die(what + ": " + std::strerror(-rc));
 }
@@ -126,21 +120,20 @@ int main(int argc, char** argv) {
     haveAllowList |= !deny;
   }
   if (!haveAllowList) die("the unit has no SystemCallFilter allow list");
-  const std::string errnoName = setting("SystemCallErrorNumber");
-  const int refusal =
-      errnoName.empty() ? EPERM : named({{"EPERM", EPERM}, {"EACCES", EACCES}, {"ENOSYS", ENOSYS}}, errnoName);
+  if (setting("SystemCallErrorNumber") != "EPERM") die("expected SystemCallErrorNumber=EPERM");
   if (setting("SystemCallArchitectures") != "native") die("expected SystemCallArchitectures=native");
   const bool mdwe = setting("MemoryDenyWriteExecute") == "yes";
+  const std::map<std::string, int> knownFamilies = {{"AF_UNIX", AF_UNIX}, {"AF_INET", AF_INET}, {"AF_INET6", AF_INET6}};
   std::vector<int> families;
   for (const auto& w : words(setting("RestrictAddressFamilies"))) {
-    families.push_back(
-        named({{"AF_UNIX", AF_UNIX}, {"AF_INET", AF_INET}, {"AF_INET6", AF_INET6}, {"AF_NETLINK", AF_NETLINK}}, w));
+    if (!knownFamilies.count(w)) die("unsupported address family " + w);
+    families.push_back(knownFamilies.at(w));
   }
   if (auto um = setting("UMask"); !um.empty()) ::umask(static_cast<mode_t>(std::stoul(um, nullptr, 8)));
 
-  // Anything not allowed fails with the unit's errno; other architectures
+  // Anything not allowed fails with EPERM; other architectures
   // are killed (libseccomp's default for a foreign architecture).
-  scmp_filter_ctx ctx = seccomp_init(SCMP_ACT_ERRNO(static_cast<uint32_t>(refusal)));
+  scmp_filter_ctx ctx = seccomp_init(SCMP_ACT_ERRNO(EPERM));
   if (!ctx) die("seccomp_init failed");
   check(seccomp_attr_set(ctx, SCMP_FLTATR_CTL_NNP, 1), "no_new_privs");
 

@@ -23,21 +23,7 @@ void teeCohorts(ipc::Request& r) { r.mutable_teecohortsfeedback(); }
 
 class AClientAskingTheDaemon : public IpcFixture {};
 
-// Guards against: a flush answered before it has finished.
-TEST_F(AClientAskingTheDaemon, GetsAFullFlushAnsweredWhenTheFlushHasFinished) {
-  runner->holdCompletions(true);
-  auto client = ipc::ControlClient::connect(socketPath());
-  ASSERT_TRUE(client);
-  auto outcome = std::async(std::launch::async, [&] { return client->flush(); });
-  ASSERT_TRUE(eventually([&] { return runner->heldCount() == 1; }));
-  EXPECT_NE(outcome.wait_for(std::chrono::seconds(0)), std::future_status::ready);
-  assembly->workloop().sync([&] { runner->releaseAll(); });
-  auto result = outcome.get();
-  EXPECT_TRUE(result.ok) << result.error;
-  EXPECT_TRUE(logs.contains("Service created new flusher"));
-}
-
-// Guards against: a request kind routed wrongly, a refusal or missing argument unreported, or ending the connection.
+// Guards against: a request kind routed wrongly, a missing argument unreported, or the connection ended by a refusal.
 TEST_F(AClientAskingTheDaemon, EachRequestKindGetsItsAnswer) {
   auto client = ipc::ControlClient::connect(socketPath());
   ASSERT_TRUE(client);
@@ -52,8 +38,6 @@ TEST_F(AClientAskingTheDaemon, EachRequestKindGetsItsAnswer) {
       {"no custom type", [&] { return client->flushCustomFeedbackType(""); }, "missing custom feedback type"},
       {"session", [&] { return client->flushSessionEagerly(session); }, ""},
       {"no session", [&] { return client->flushSessionEagerly(""); }, "missing session file path"},
-      {"refused session", [&] { return client->flushSessionEagerly(env.temp.path() / "session.1.A.closed"); },
-       "refused: " + (env.temp.path() / "session.1.A.closed").string() + " is outside the cache directory"},
       {"whitelists", [&] { return client->updateWhitelists(2); }, ""},
       {"flush", [&] { return client->flush(); }, ""},
   };
@@ -126,24 +110,6 @@ class ListenersOfUploadsAndCohorts : public IpcFixture {
   }
 };
 
-// Guards against: payloads lost, altered or sent to the wrong subscriber.
-TEST_F(ListenersOfUploadsAndCohorts, EachSubscriberReceivesThePayloadsOfItsKind) {
-  auto uploads = subscribe(true, false);
-  auto cohorts = subscribe(false, true);
-  EXPECT_TRUE(logs.contains("setting up a new sending stream listener"));
-  EXPECT_TRUE(logs.contains("setting up a new cohort listnener"));
-  upload("first payload");
-  upload(std::string("\0\1\2", 3));
-  assembly->workloop().sync([&] { assembly->cohortsListener()->willGenerateCohortFeebacks("envelope bytes"); });
-
-  ASSERT_TRUE(eventually([&] { return uploads->count() == 2 && cohorts->count() == 1; }));
-  std::scoped_lock l(uploads->m, cohorts->m);
-  EXPECT_EQ(uploads->received[0].willuploaddata().data(), "first payload");
-  EXPECT_EQ(uploads->received[0].willuploaddata().format(), "FeedbackV2");
-  EXPECT_EQ(uploads->received[1].willuploaddata().data(), std::string("\0\1\2", 3));
-  EXPECT_EQ(cohorts->received[0].willgeneratecohortfeebacks().data(), "envelope bytes");
-}
-
 // Guards against: a slot kept for a subscriber that left, or cleared for the wrong one.
 TEST_F(ListenersOfUploadsAndCohorts, TheSecondSubscriberReplacesTheFirstAndTheFirstLeavingClearsTheSlot) {
   auto first = subscribe(true, false);
@@ -173,6 +139,8 @@ TEST_F(ListenersOfUploadsAndCohorts, AConnectionHoldingBothClearsBothWhenItLeave
   EXPECT_NE(status->version().find("vireon-fbf/"), std::string::npos);
 
   auto both = subscribe(true, true);
+  EXPECT_TRUE(logs.contains("setting up a new sending stream listener"));
+  EXPECT_TRUE(logs.contains("setting up a new cohort listnener"));
   status = client->status(&error);
   ASSERT_TRUE(status) << error;
   EXPECT_TRUE(status->uploadslistener() && status->cohortslistener());
@@ -255,14 +223,6 @@ TEST_F(PeersBreakingTheFraming, OnlyTheBrokenConnectionEnds) {
     EXPECT_TRUE(result.ok) << result.error;
   }
   EXPECT_EQ(runner->calls().size(), 6u);
-}
-
-// Guards against: a frame length in the wrong byte order.
-TEST(FrameHeader, IsTheLengthBigEndian) {
-  EXPECT_EQ(ipc::encodeFrameHeader(0x01020304u), std::string("\x01\x02\x03\x04", 4));
-  const uint8_t bytes[4] = {0xfe, 0x00, 0x00, 0x10};
-  EXPECT_EQ(ipc::decodeFrameHeader(bytes), 0xfe000010u);
-  EXPECT_EQ(ipc::encodeFrame("ab"), std::string("\0\0\0\x02" "ab", 6));
 }
 
 }  // namespace

@@ -8,6 +8,7 @@
 #include "assembly/fbf_strings.h"
 #include "ipc/daemon_connection.h"
 #include "ipc/flusher_service.h"
+#include "support/process.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>
@@ -21,38 +22,23 @@
 
 namespace fbf::testing {
 
-// Polls `done` until it holds; gives up (returning false) only after a very
-// generous bound, so a hang fails the test instead of blocking the suite.
-template <class Predicate>
-bool eventually(Predicate done) {
-  auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
-  while (!done()) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
-  return true;
-}
+// Polls `done` until it holds; gives up only after a generous bound, so a
+// hang fails the test instead of blocking the suite.
+inline bool eventually(const std::function<bool()>& done) { return waitUntil(done, std::chrono::seconds(20)); }
 
 class FakeFlushRunner final : public FlushRunner {
  public:
-  explicit FakeFlushRunner(fs::path cacheDir) : cacheDir_(std::move(cacheDir)) {}
-
   void flushAll(std::function<void()> completion) override { record("flushAll", std::move(completion)); }
   void flushCustomFeedbackType(const std::string& type, std::function<void()> completion) override {
     record("flushCustomFeedbackType " + type, std::move(completion));
   }
   std::optional<std::string> flushSessionEagerly(const fs::path& path, std::function<void()> completion) override {
-    if (path.parent_path() != cacheDir_) return "refused: " + path.string() + " is outside the cache directory";
     record("flushSessionEagerly " + path.string(), std::move(completion));
     return std::nullopt;
   }
   ipc::StatusReply status() override {
     ipc::StatusReply reply;
-    auto* closed = reply.add_sessions();
-    closed->set_name("closed");
-    closed->set_files(3);
-    closed->set_bytes(4096);
-    closed->set_oldestageseconds(90);
+    reply.add_sessions()->set_files(3);
     return reply;
   }
 
@@ -87,7 +73,6 @@ class FakeFlushRunner final : public FlushRunner {
     completion();
   }
 
-  fs::path cacheDir_;
   mutable std::mutex m_;
   bool hold_ = false;
   std::vector<std::string> calls_;
@@ -139,7 +124,7 @@ class IpcFixture : public ::testing::Test {
       };
     }
     assembly = std::make_unique<FBFAssembly>(std::move(deps));
-    runner = std::make_shared<FakeFlushRunner>(env.cacheDir());
+    runner = std::make_shared<FakeFlushRunner>();
     service = std::make_unique<FlusherService>(*assembly, runner);
     fs::create_directories(env.dirs.runtimeDir);
     acceptor.emplace(io, asio::local::stream_protocol::endpoint(socketPath().string()));

@@ -1,5 +1,5 @@
-// The schema properties the daemon relies on: presence where readers tell
-// absent from empty, and stable field numbers.
+// The schema properties the daemon relies on: stable field numbers and
+// presence where readers tell absent from empty.
 //
 // The wire-number check compares against wire_numbers.golden. After adding
 // fields, regenerate it with FBF_UPDATE_WIRE_GOLDEN=1 and review the diff: it
@@ -14,7 +14,6 @@
 #include <fstream>
 #include <set>
 #include <string>
-#include <vector>
 
 #include "corevireon.pb.h"
 #include "fbf_ipc.pb.h"
@@ -25,35 +24,6 @@ using google::protobuf::Descriptor;
 using google::protobuf::EnumDescriptor;
 using google::protobuf::FieldDescriptor;
 using google::protobuf::FileDescriptor;
-
-// Guards against: an empty string or message decoding as absent (or absent as empty) where readers tell them apart.
-TEST(Presence, AbsentAndEmptyStayDistinct) {
-  using namespace corevireon;
-  const std::pair<const Descriptor*, std::vector<const char*>> rows[] = {
-      {CVClientSession::descriptor(),
-       {"feedbacks", "agent", "userGuidString", "countryCode", "locale", "usageSinceLookback", "cohortsFeedback"}},
-      {CVSearchResultForFeedback::descriptor(),
-       {"identifier", "jsonSectionBundleIdentifier", "userInput", "completedQuery", "intendedQuery", "punchout"}},
-      {CVPunchout::descriptor(), {"urls"}},
-      {CVSearchSuggestionForFeedback::descriptor(), {"identifier"}},
-      {CVResultSection::descriptor(), {"results"}},
-      {CVResultEngagementFeedback::descriptor(), {"titleText"}},
-      {CVCBAEngagementFeedback::descriptor(), {"url"}},
-      {CVStartLocalSearchFeedback::descriptor(), {"input"}},
-      {CVStartNetworkSearchFeedback::descriptor(), {"input"}},
-      {CVCustomFeedback::descriptor(), {"feedbackJSON"}},
-      {fbf::ipc::Reply::descriptor(), {"error"}},
-      {fbf::ipc::PendingFiles::descriptor(), {"oldestAgeSeconds"}},
-  };
-  // Presence is what keeps an empty value apart from an absent one on the wire.
-  for (const auto& [type, names] : rows) {
-    for (const char* name : names) {
-      const FieldDescriptor* f = type->FindFieldByName(name);
-      ASSERT_NE(f, nullptr) << type->name() << "." << name;
-      EXPECT_TRUE(f->has_presence()) << type->name() << "." << name;
-    }
-  }
-}
 
 void DumpEnum(const EnumDescriptor* e, std::set<std::string>* out) {
   for (int i = 0; i < e->value_count(); ++i) {
@@ -72,14 +42,18 @@ void DumpMessage(const Descriptor* d, std::set<std::string>* out) {
       type = "map<" + std::string(f->message_type()->field(0)->type_name()) + "," +
              f->message_type()->field(1)->type_name() + ">";
     }
-    const char* label = f->is_repeated() && !f->is_map() ? "repeated " : "";
+    // Presence keeps an empty value apart from an absent one, which readers tell apart.
+    const char* label = f->is_repeated() && !f->is_map() ? "repeated "
+                        : f->has_presence() && !f->message_type() ? "optional "
+                                                                     : "";
     out->insert(d->full_name() + "." + f->name() + " = " + std::to_string(f->number()) + " : " + label + type);
   }
   for (int i = 0; i < d->nested_type_count(); ++i) DumpMessage(d->nested_type(i), out);
   for (int i = 0; i < d->enum_type_count(); ++i) DumpEnum(d->enum_type(i), out);
 }
 
-// Guards against: a field or enum value changing its number, type or label (the on-disk and on-socket formats).
+// Guards against: a field or enum value changing its number, type or label (the on-disk and on-socket formats),
+// or a field losing the presence that keeps an empty value apart from an absent one.
 TEST(WireCompatibility, NoFieldOrEnumValueChangedItsNumber) {
   std::set<std::string> current;
   for (const FileDescriptor* file : {corevireon::CVClientSession::descriptor()->file(),

@@ -21,7 +21,6 @@ TEST(MatchLevels, BetweenShownAndVisitedAddresses) {
       {"https://example.com", "https://example.com/", 3}, {"https://WWW.Example.COM/a", "https://example.com/a", 3},
       {"https://news.bbc.co.uk/x", "https://www.bbc.co.uk/x", 3},
       {"https://www.example.com/a", "https://example.com/a?utm_source=x", 2},
-      {"https://www.example.com/a?id=1", "https://example.com/a/", 2},
       {"https://example.com/a?id=1", "https://example.com/a?id=2", 2},
       {"https://www.example.com/a", "https://example.com/b", 1},
       {"https://www.example.com/a", "https://shop.example.co.uk/", 1},

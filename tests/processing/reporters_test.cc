@@ -19,10 +19,6 @@ TEST(ClientFromAgent, MatchesTheLowerCasedAgentFirstRuleWins) {
       {"", corevireon::CV_CLIENT_NONE},                        {"Mail/16", corevireon::CV_CLIENT_NONE},
   };
   for (const auto& [agent, client] : rows) EXPECT_EQ(cohortsClient(agent), client) << agent.value_or("<none>");
-  corevireon::CVClientSession session;
-  EXPECT_EQ(cohortsClient(session), corevireon::CV_CLIENT_NONE);
-  session.set_agent("wayfin");
-  EXPECT_EQ(cohortsClient(session), corevireon::CV_CLIENT_WEB_BROWSER);
 }
 
 // Guards against: previews, destination 1 or go-to feedback counted as engagements on the wrong surface.
@@ -70,11 +66,6 @@ TEST(Keystrokes, NeedInputAndNetworkEndpoint12NeverCounts) {
   network.set_endpoint(12);
   EXPECT_FALSE(KeystrokeReporter::from(network)->isKeystroke());
   EXPECT_FALSE(KeystrokeReporter::from(corevireon::CVEndLocalSearchFeedback()));
-
-  corevireon::CVRankingFeedback ranking;
-  ranking.add_sections()->mutable_section()->mutable_results()->add_items()->set_identifier("x");
-  EXPECT_EQ(RankingReporter::from(ranking)->containedResults().at(0)->identifier(), "x");
-  EXPECT_FALSE(RankingReporter::from(corevireon::CVSectionRankingFeedback()));
 }
 
 }  // namespace

@@ -34,8 +34,6 @@ TEST(SessionJSON, KeysInTheirOrderWithValuesOrDefaults) {
   EXPECT_NE(jsonOf(s).find(R"("usage_propensity":{"newsUsagePropensity":{}})"), std::string::npos);
   s.mutable_cohortsfeedback()->mutable_usageenvelope();
   EXPECT_EQ(jsonOf(s).find("usage_propensity"), std::string::npos);
-  s.mutable_cohortsfeedback()->mutable_propensityenvelope();
-  EXPECT_EQ(jsonOf(s).find("usage_propensity"), std::string::npos);
   // The base time is the whole seconds of the start, 0 outside the signed range.
   for (auto [start, base] : std::initializer_list<std::pair<double, int64_t>>{
            {-5.0, 0}, {9223372036854775808.0, 0}, {9223372036854774784.0, 9223372036854774784LL}}) {

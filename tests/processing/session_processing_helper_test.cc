@@ -1,3 +1,4 @@
+#include "flushing/reporters.h"
 #include "flushing/session_processing_helper.h"
 #include "processing/processing_builders.h"
 
@@ -34,8 +35,6 @@ void processAll(SessionProcessingHelper& helper, std::vector<CVFeedbackPayload>&
 // Guards against: replacement numbers reused across keys, handed out twice for one key, or given to empty identifiers.
 TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearance) {
   SessionProcessingHelper helper;
-  EXPECT_EQ(helper.replacementForIdentifier(std::nullopt, 1), std::nullopt);
-  EXPECT_EQ(helper.replacementForIdentifier("", 1), std::nullopt);
   for (int i = 0; i < 9; ++i) helper.replacementForIdentifier("id" + std::to_string(i), 0);
   // Keys are identifier + decimal type with no separator, so ab+17 and ab1+7 share a number.
   std::vector<CVFeedbackPayload> payloads = {
@@ -174,18 +173,19 @@ TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
 
 // Guards against: the results a feedback contains being gathered from the wrong fields or in the wrong order.
 TEST(ContainedResults, FollowTheKindsOfFeedback) {
-  auto ids = [](const auto& feedback) {
+  auto ids = [](const auto& results) {
     std::string out;
-    for (const auto* r : containedResults(feedback)) out += r->identifier() + " ";
+    for (const auto* r : results) out += r->identifier() + " ";
     return out;
   };
-  EXPECT_EQ(ids(pb<corevireon::CVRankingFeedback>(R"(sections { results { result { identifier: "ranked" } }
-      section { results { items { identifier: "s1" } } } } sections { section { results { items { identifier: "s2" } } } })")),
-            "s1 s2 ");
-  EXPECT_EQ(ids(pb<corevireon::CVResultRankingFeedback>(
-                R"(result { identifier: "main" } hiddenResults { identifier: "hidden" } duplicateResults { identifier: "dup" })")),
+  auto ranking = pb<corevireon::CVRankingFeedback>(R"(sections { results { result { identifier: "ranked" } }
+      section { results { items { identifier: "s1" } } } } sections { section { results { items { identifier: "s2" } } } })");
+  EXPECT_EQ(ids(RankingReporter::from(ranking)->containedResults()), "s1 s2 ");
+  EXPECT_FALSE(RankingReporter::from(corevireon::CVSectionRankingFeedback()));
+  EXPECT_EQ(ids(containedResults(pb<corevireon::CVResultRankingFeedback>(
+                R"(result { identifier: "main" } hiddenResults { identifier: "hidden" } duplicateResults { identifier: "dup" })"))),
             "dup hidden main ");
-  EXPECT_EQ(ids(corevireon::CVClearInputFeedback()), "");
+  EXPECT_EQ(ids(containedResults(corevireon::CVClearInputFeedback())), "");
 }
 
 }  // namespace

@@ -8,32 +8,42 @@
 namespace fbf::testing {
 namespace {
 
-uint32_t be32(const uint8_t* p) {
-  return (uint32_t{p[0]} << 24) | (uint32_t{p[1]} << 16) | (uint32_t{p[2]} << 8) | uint32_t{p[3]};
-}
-uint16_t be16(const uint8_t* p) { return static_cast<uint16_t>((p[0] << 8) | p[1]); }
+using Bytes = std::vector<uint8_t>;
 
-int base64Value(char c) {
-  static const std::string_view kAlphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-  auto at = kAlphabet.find(c);
-  return at == std::string_view::npos ? -1 : static_cast<int>(at);
+bool bitAt(const Bytes& bitmap, size_t i) { return (bitmap[i / 8] >> (7 - i % 8)) & 1; }
+void setBit(Bytes& bitmap, size_t i) { bitmap[i / 8] = static_cast<uint8_t>(bitmap[i / 8] | (0x80u >> (i % 8))); }
+void put16(Bytes& out, size_t value) {
+  out.push_back(static_cast<uint8_t>(value >> 8));
+  out.push_back(static_cast<uint8_t>(value));
 }
 
-// Runs of equal bits, each at most 256 long, counted straight from the bits.
-size_t canonicalRunCount(const std::vector<uint8_t>& bitmap) {
-  size_t runs = 0;
-  int previous = -1;
-  size_t length = 0;
-  for (size_t i = 0; i < bitmap.size() * 8; ++i) {
-    int bit = (bitmap[i / 8] >> (7 - i % 8)) & 1;
-    if (bit != previous || length == 256) {
-      ++runs;
-      length = 0;
-      previous = bit;
-    }
-    ++length;
+// The one record a correct coder writes for a bitmap: maximal runs of at
+// most 256 equal bits, run-coded only when that is strictly shorter.
+Bytes canonicalRecord(const Bytes& bitmap, uint16_t version) {
+  Bytes counts, flags;
+  for (size_t i = 0, bits = bitmap.size() * 8; i < bits;) {
+    size_t start = i;
+    while (i < bits && i - start < 256 && bitAt(bitmap, i) == bitAt(bitmap, start)) ++i;
+    if (counts.size() % 8 == 0) flags.push_back(0);
+    if (bitAt(bitmap, start)) flags.back() = static_cast<uint8_t>(flags.back() | (0x80u >> (counts.size() % 8)));
+    counts.push_back(static_cast<uint8_t>(i - start - 1));
   }
-  return runs;
+  bool compressed = 2 + counts.size() + flags.size() < bitmap.size();
+  Bytes record(4, 0);
+  put16(record, version | (compressed ? 0x8000u : 0u));
+  put16(record, bitmap.size());
+  auto tail = md5Tail(bitmap);
+  record.insert(record.end(), tail.begin(), tail.end());
+  if (!compressed) {
+    record.insert(record.end(), bitmap.begin(), bitmap.end());
+  } else {
+    put16(record, counts.size());
+    record.insert(record.end(), counts.begin(), counts.end());
+    record.insert(record.end(), flags.begin(), flags.end());
+  }
+  auto crc = static_cast<uint32_t>(crc32(0L, record.data() + 4, static_cast<uInt>(record.size() - 4)));
+  for (int k = 0; k < 4; ++k) record[k] = static_cast<uint8_t>(crc >> (24 - 8 * k));
+  return record;
 }
 
 std::optional<DecodedSignature> fail(std::string* why, std::string text) {
@@ -44,29 +54,17 @@ std::optional<DecodedSignature> fail(std::string* why, std::string text) {
 }  // namespace
 
 std::optional<std::vector<uint8_t>> decodeBase64(std::string_view text) {
-  if (text.size() % 4 != 0) return std::nullopt;
-  std::vector<uint8_t> out;
-  for (size_t i = 0; i < text.size(); i += 4) {
-    bool last = i + 4 == text.size();
-    int v[4];
-    int padding = 0;
-    for (int k = 0; k < 4; ++k) {
-      char c = text[i + k];
-      if (c == '=' && last && k >= 2) {
-        v[k] = 0;
-        ++padding;
-        continue;
-      }
-      if (padding) return std::nullopt;  // data after padding
-      v[k] = base64Value(c);
-      if (v[k] < 0) return std::nullopt;
-    }
-    uint32_t group =
-        (uint32_t(v[0]) << 18) | (uint32_t(v[1]) << 12) | (uint32_t(v[2]) << 6) | uint32_t(v[3]);
-    out.push_back(static_cast<uint8_t>(group >> 16));
-    if (padding < 2) out.push_back(static_cast<uint8_t>(group >> 8));
-    if (padding < 1) out.push_back(static_cast<uint8_t>(group));
-  }
+  Bytes out(text.size() / 4 * 3 + 3);
+  int n = EVP_DecodeBlock(out.data(), reinterpret_cast<const unsigned char*>(text.data()),
+                          static_cast<int>(text.size()));
+  size_t padding = text.ends_with("==") ? 2 : text.ends_with('=') ? 1 : 0;
+  if (n < 0 || static_cast<size_t>(n) < padding) return std::nullopt;
+  out.resize(static_cast<size_t>(n) - padding);
+  // Only the canonical spelling: no whitespace, no stray bits in the padding.
+  std::string again(out.size() / 3 * 4 + 5, '\0');
+  again.resize(static_cast<size_t>(EVP_EncodeBlock(reinterpret_cast<unsigned char*>(again.data()), out.data(),
+                                                   static_cast<int>(out.size()))));
+  if (again != text) return std::nullopt;
   return out;
 }
 
@@ -78,65 +76,38 @@ std::vector<uint8_t> md5Tail(const std::vector<uint8_t>& bytes) {
 }
 
 std::vector<uint8_t> bitmapOf(const std::vector<uint64_t>& ids) {
-  std::vector<uint8_t> bytes(*std::max_element(ids.begin(), ids.end()) / 8 + 1, 0);
-  for (auto id : ids) bytes[id / 8] = static_cast<uint8_t>(bytes[id / 8] | (1u << (7 - id % 8)));
-  return bytes;
+  Bytes bitmap(*std::max_element(ids.begin(), ids.end()) / 8 + 1, 0);
+  for (auto id : ids) setBit(bitmap, id);
+  return bitmap;
 }
 
+// Reads the bitmap leniently, then accepts the record only if it is exactly
+// the canonical record of that bitmap (CRC, header, digest tail and coding).
 std::optional<DecodedSignature> decodeSignature(std::string_view text, std::string* why) {
   auto record = decodeBase64(text);
-  if (!record) return fail(why, "not standard base64");
-  if (record->size() < 12) return fail(why, "record shorter than its header and digest tail");
-  const uint8_t* r = record->data();
-  uint32_t crc = static_cast<uint32_t>(crc32(0L, r + 4, static_cast<uInt>(record->size() - 4)));
-  if (crc != be32(r)) return fail(why, "CRC mismatch");
-
+  if (!record || record->size() < 12) return fail(why, "not base64 of a record with its header");
+  const Bytes& r = *record;
   DecodedSignature decoded;
-  uint16_t word = be16(r + 4);
-  decoded.compressed = (word & 0x8000) != 0;
-  decoded.version = word & 0x7FFF;
-  size_t bitmapLength = be16(r + 6);
-  if (bitmapLength == 0) return fail(why, "empty bitmap");
-  std::vector<uint8_t> tail(r + 8, r + 12);
-  const uint8_t* body = r + 12;
-  size_t bodyLength = record->size() - 12;
-
+  decoded.compressed = (r[4] & 0x80) != 0;
+  decoded.version = static_cast<uint16_t>(((r[4] & 0x7F) << 8) | r[5]);
+  size_t bits = size_t((r[6] << 8) | r[7]) * 8;
   if (!decoded.compressed) {
-    if (bodyLength != bitmapLength)
-      return fail(why, "stored bitmap length differs from the header");
-    decoded.bitmap.assign(body, body + bodyLength);
-    size_t runs = canonicalRunCount(decoded.bitmap);
-    if (2 + runs + (runs + 7) / 8 < bitmapLength)
-      return fail(why, "stored although the run coding is shorter");
+    decoded.bitmap.assign(r.begin() + 12, r.end());
   } else {
-    if (bodyLength < 2) return fail(why, "no run count");
-    size_t runs = be16(body);
-    size_t flagBytes = (runs + 7) / 8;
-    if (bodyLength != 2 + runs + flagBytes) return fail(why, "run coding length mismatch");
-    if (bodyLength >= bitmapLength) return fail(why, "compressed although not shorter");
-    const uint8_t* counts = body + 2;
-    const uint8_t* flags = counts + runs;
-    decoded.bitmap.assign(bitmapLength, 0);
-    size_t position = 0;
-    for (size_t i = 0; i < runs; ++i) {
-      bool ones = (flags[i / 8] & (0x80u >> (i % 8))) != 0;
-      if (i > 0) {
-        bool previousOnes = (flags[(i - 1) / 8] & (0x80u >> ((i - 1) % 8))) != 0;
-        if (previousOnes == ones && counts[i - 1] != 255)
-          return fail(why, "run split before 256 bits");
+    size_t runs = r.size() >= 14 ? size_t((r[12] << 8) | r[13]) : 0;
+    if (runs == 0 || r.size() < 14 + runs + (runs + 7) / 8) return fail(why, "run coding cut short");
+    decoded.bitmap.assign(bits / 8, 0);
+    for (size_t i = 0, at = 0; i < runs && at < bits; ++i) {
+      bool ones = r[14 + runs + i / 8] & (0x80u >> (i % 8));
+      for (size_t end = at + r[14 + i] + 1; at < end && at < bits; ++at) {
+        if (ones) setBit(decoded.bitmap, at);
       }
-      size_t length = size_t{counts[i]} + 1;
-      if (position + length > bitmapLength * 8) return fail(why, "runs overflow the bitmap");
-      for (size_t k = position; ones && k < position + length; ++k) {
-        decoded.bitmap[k / 8] = static_cast<uint8_t>(decoded.bitmap[k / 8] | (0x80u >> (k % 8)));
-      }
-      position += length;
     }
-    if (runs % 8 != 0 && (flags[flagBytes - 1] & ((1u << (8 - runs % 8)) - 1)) != 0)
-      return fail(why, "flag padding not zero");
-    if (position != bitmapLength * 8) return fail(why, "runs do not cover the bitmap");
   }
-  if (md5Tail(decoded.bitmap) != tail) return fail(why, "digest tail mismatch");
+  if (decoded.bitmap.empty()) return fail(why, "empty bitmap");
+  if (canonicalRecord(decoded.bitmap, decoded.version) != r) {
+    return fail(why, "not the canonical record of its bitmap");
+  }
   return decoded;
 }
 
