@@ -2,6 +2,9 @@
 BUILD      ?= build/release
 ASAN_BUILD ?= build/asan
 JOBS       ?= $(shell nproc)
+# The release tests spend most of their time waiting on the real programs
+# they start, so twice as many run at once as there are cores.
+TEST_JOBS  ?= $(shell echo $$(( $(JOBS) * 2 )))
 CMAKE_GEN  := -G Ninja
 
 FUZZ_BUILD   ?= build/fuzz
@@ -23,7 +26,7 @@ build: deps $(BUILD)/build.ninja
 	cmake --build $(BUILD) -j $(JOBS)
 
 test-release: build
-	ctest --test-dir $(BUILD) --output-on-failure -j $(JOBS)
+	ctest --test-dir $(BUILD) --output-on-failure -j $(TEST_JOBS)
 
 $(ASAN_BUILD)/build.ninja: | deps
 	cmake -S . -B $(ASAN_BUILD) $(CMAKE_GEN) -DCMAKE_BUILD_TYPE=Debug -DFBF_SANITIZE=ON

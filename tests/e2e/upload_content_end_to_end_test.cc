@@ -5,7 +5,9 @@
 #include "e2e/daemon_home.h"
 
 #include <gtest/gtest.h>
+#include <fmt/format.h>
 #include <openssl/evp.h>
+#include <strings.h>
 
 #include <fstream>
 #include <map>
@@ -24,23 +26,15 @@ std::string sha512Hex(const std::string& data) {
   unsigned char md[EVP_MAX_MD_SIZE];
   unsigned int len = 0;
   EVP_Digest(data.data(), data.size(), md, &len, EVP_sha512(), nullptr);
-  static constexpr char kHex[] = "0123456789abcdef";
   std::string out;
-  for (unsigned i = 0; i < len; ++i) {
-    out += kHex[md[i] >> 4];
-    out += kHex[md[i] & 15];
-  }
+  for (unsigned i = 0; i < len; ++i) out += fmt::format("{:02x}", md[i]);
   return out;
 }
 
-std::string lower(std::string s) {
-  for (auto& c : s) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
-  return s;
-}
-
+// The digest header, whatever case the receiver recorded its name in.
 std::string digestOf(const nlohmann::json& record) {
   for (const auto& [name, value] : record.at("headers").items()) {
-    if (lower(name) == "x-corvane-digest") return lower(value.get<std::string>());
+    if (strcasecmp(name.c_str(), "x-corvane-digest") == 0) return value.get<std::string>();
   }
   return {};
 }
