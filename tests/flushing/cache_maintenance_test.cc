@@ -61,8 +61,6 @@ TEST_F(CleanupAfterCrashedWriters, OnlyUnparseableSessionNamesGoAndNoCopyIsRepla
                                       pending.filename(), otherCopy.filename(), open.filename()}));
   EXPECT_EQ(readFile(otherCopy), "the other copy");
   EXPECT_TRUE(logs.contains("error renaming session file"));
-  EXPECT_TRUE(logs.contains(
-      "Closed session file is ready for processing: " + closed.filename().string() + "."));
   EXPECT_TRUE(logs.contains("Ignoring file in uploaded state, but you might want to delete it: " +
                             uploaded.filename().string() + "."));
   EXPECT_EQ(logs.count(processing.filename().string()), 0u);
@@ -95,9 +93,6 @@ TEST_F(OverfullSessionDirectory, AtTheLimitAllStayOnePastItHalfTheLimitRemains) 
   EXPECT_EQ(vireon_pruneSessionFiles(fm(), limit), 0u);
   // Its name starts with "session", so it counts, and it is the newest.
   files.push_back(makeFile(cache(), "sessionjunk"));
-  auto selected = vireon_getPrunedSessionFiles(fm(), limit);
-  ASSERT_EQ(selected.size(), 51u);
-  EXPECT_EQ(selected.front(), files.front());
   EXPECT_EQ(vireon_pruneSessionFiles(fm(), limit), 51u);
   expectOldestRemoved(files, 51);
   EXPECT_TRUE(fs::exists(other) && fs::exists(custom));

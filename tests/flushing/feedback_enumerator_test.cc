@@ -34,7 +34,6 @@ TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown
     EXPECT_EQ(file.knownFeedbackType(), row.known) << row.path;
     EXPECT_EQ(file.uploadPending(), row.pending) << row.path;
   }
-  EXPECT_EQ(FeedbackFile(custom + "Usage/u-1").fileName(), "u-1");
 }
 
 // Guards against: a walk that misses, repeats or invents files, or never interleaves.

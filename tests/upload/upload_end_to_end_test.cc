@@ -142,7 +142,6 @@ TEST(CurlErrorMapping, SortsOfflineFailuresFromTheRest) {
             HttpErrorCode::cannotConnectToHost);  // connect
   EXPECT_EQ(httpErrorFromCurl(7, ENETUNREACH, "").code,
             HttpErrorCode::notConnectedToInternet);                                     // no route
-  EXPECT_EQ(httpErrorFromCurl(90, 0, "").code, HttpErrorCode::secureConnectionFailed);  // pin
   EXPECT_EQ(httpErrorFromCurl(28, 0, "").code, HttpErrorCode::timedOut);
   EXPECT_EQ(httpErrorFromCurl(52, 0, "").domain, HttpErrorDomain::network);  // got nothing
   EXPECT_EQ(httpErrorFromCurl(27, 0, "").domain, HttpErrorDomain::other);    // out of memory
