@@ -28,11 +28,6 @@ std::string certificatePin() {
   return spki.status == 0 ? "sha256//" + spki.out.substr(0, 44) : "";
 }
 
-struct Outcome {
-  std::optional<HttpResponse> response;
-  std::optional<HttpError> error;
-};
-
 class UploadToIngest : public ::testing::Test {
  protected:
   UploadToIngest() : env(true) {}
@@ -53,15 +48,16 @@ class UploadToIngest : public ::testing::Test {
     EXPECT_EQ(open, 0u);
   }
   void onQueue(const std::function<void()>& f) { env.assembly().workloop().sync(f); }
-  // Sends and waits (bounded) for the completion.
-  std::optional<Outcome> send(const std::function<std::optional<UploadRequest>()>& prepare) {
-    std::optional<Outcome> result;
+  // Sends and waits (bounded) for the completion: its error, if any.
+  std::optional<std::optional<HttpError>> send(
+      const std::function<std::optional<UploadRequest>()>& prepare) {
+    std::optional<std::optional<HttpError>> result;
     onQueue([&] {
       manager = std::make_unique<UploadManager>(env.assembly());
       if (auto request = prepare()) {
-        manager->enqueue(std::move(*request), [&](auto r, auto e) {
+        manager->enqueue(std::move(*request), [&](auto, auto e) {
           std::lock_guard l(m);
-          result = Outcome{std::move(r), std::move(e)};
+          result = std::move(e);
           done.notify_all();
         });
       }
@@ -92,21 +88,21 @@ TEST_F(UploadToIngest, OnlyAPinnedTrustedServerGetsTheFeedbackWhole) {
   auto prepareSession = [&] { return sent = manager->uploadProtobufFeedback(session, file); };
   for (std::string_view key : {"sha256//AAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAAA=", "", "pinned"}) {
     SCOPED_TRACE(key.empty() ? "untrusted certificate" : key);
-    if (!key.empty()) {
+    if (key.empty()) {  // neither pinned nor signed by a trusted authority
+      env.defaults().removeObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys);
+      env.defaults().removeObject(FBFStrings::LinuxDefaults::UploadCAFile);
+    } else {
       env.defaults().setObject(FBFStrings::LinuxDefaults::UploadCAFile,
                                testing::LoopbackCertificate::get().cert.string());
       env.defaults().setObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys,
                                std::string(key == "pinned" ? pin : key));
-    } else {
-      env.defaults().removeObject(FBFStrings::LinuxDefaults::UploadPinnedPublicKeys);
-      env.defaults().removeObject(FBFStrings::LinuxDefaults::UploadCAFile);
     }
-    auto outcome = send(prepareSession);
-    ASSERT_TRUE(outcome && sent);
+    auto error = send(prepareSession);
+    ASSERT_TRUE(error && sent);
     EXPECT_EQ(fs::exists(sent->fileURL), key != "pinned");
-    EXPECT_EQ(outcome->error.has_value(), key != "pinned");
-    if (outcome->error) {
-      EXPECT_EQ(outcome->error->code, HttpErrorCode::secureConnectionFailed);
+    EXPECT_EQ(error->has_value(), key != "pinned");
+    if (*error) {
+      EXPECT_EQ((*error)->code, HttpErrorCode::secureConnectionFailed);
     }
   }
   auto records = ingest.records();
@@ -127,8 +123,8 @@ TEST_F(UploadToIngest, OnlyAPinnedTrustedServerGetsTheFeedbackWhole) {
   // Custom feedback goes without Content-Type (libcurl would add one).
   auto source = env.cacheDir() / "CustomFeedback" / "Crowdsourcing" / "c-1";
   testing::writeFile(source, "{}");
-  auto outcome = send([&] { return manager->uploadCustomFeedback(source, "Crowdsourcing"); });
-  ASSERT_TRUE(outcome && outcome->response);
+  auto error = send([&] { return manager->uploadCustomFeedback(source, "Crowdsourcing"); });
+  ASSERT_TRUE(error && !*error);
   EXPECT_FALSE(fs::exists(source.string() + ".uploadPending"));
   records = ingest.records();
   ASSERT_EQ(records.size(), 2u);
