@@ -49,11 +49,7 @@ inline std::vector<std::string> entryNames(const fs::path& dir) {
 }
 inline std::vector<FeedbackFile> drain(std::optional<FeedbackEnumerator> e) {
   std::vector<FeedbackFile> out;
-  while (e) {
-    auto f = e->next();
-    if (!f) break;
-    out.push_back(std::move(*f));
-  }
+  for (std::optional<FeedbackFile> f; e && (f = e->next());) out.push_back(std::move(*f));
   return out;
 }
 
