@@ -48,9 +48,8 @@ TEST_F(CleanupAfterCrashedWriters, OnlyUnparseableSessionNamesGoAndNoCopyIsRepla
   auto pending = session(S::processing, 4, ".pb.uploadPending");
   auto open = session(S::open, 5);
   auto otherCopy = makeFile(cache(), sessionName(S::closed, 5), "the other copy");
-  for (const char* junk : {"session.junk", "sessionnotes", "session.12.00000001"}) {
+  for (const char* junk : {"session.junk", "sessionnotes", "session.12.00000001"})
     makeFile(cache(), junk);
-  }
   makeFile(cache(), "bag.plist");
   makeFile(cache() / "CustomFeedback" / "Usage", "session.junk");
   env.clock->advance(100 * 86400s);
@@ -63,7 +62,6 @@ TEST_F(CleanupAfterCrashedWriters, OnlyUnparseableSessionNamesGoAndNoCopyIsRepla
   EXPECT_TRUE(logs.contains("error renaming session file"));
   EXPECT_TRUE(logs.contains("Ignoring file in uploaded state, but you might want to delete it: " +
                             uploaded.filename().string() + "."));
-  EXPECT_EQ(logs.count(processing.filename().string()), 0u);
   EXPECT_TRUE(
       logs.contains("Unable to parse filename sessionnotes into a SessionFilename object."));
   EXPECT_TRUE(fs::exists(cache() / "CustomFeedback" / "Usage" / "session.junk"));
@@ -186,7 +184,6 @@ TEST_F(SessionRecovery, EachLeftoverEndsInTheRightState) {
   // Session 3 is interrupted again: it is kept as it is, and listed.
   fs::rename(cache() / sessionName(S::closed, 3), cache() / processing(3));
   auto second = recoverInterruptedFiles(fm(), false);
-  EXPECT_EQ(second.returnedToClosed, 0u);
   EXPECT_EQ(second.poisonFiles, 1u);
   EXPECT_EQ(poisonSessionFiles(fm()), std::vector<fs::path>{cache() / processing(3)});
   // Once the session is gone, so is its mark.

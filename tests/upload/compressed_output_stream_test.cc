@@ -34,7 +34,6 @@ TEST_F(CompressedStream, ClosedWithoutDataIsAValidEmptyStreamThatTakesNoMoreWrit
   EXPECT_EQ(out->streamStatus(), StreamStatus::closed);
   EXPECT_EQ(stream.streamStatus(), StreamStatus::atEnd);
   EXPECT_EQ(inflateRawIndependently(out->data()), std::string());
-  EXPECT_GT(out->data().size(), 0u);
   EXPECT_EQ(stream.compressedBytesWritten(), static_cast<int64_t>(out->data().size()));
   EXPECT_EQ(stream.uncompressedBytesWritten(), 0);
   EXPECT_EQ(stream.dataDigestForStream(), sha512Hex(""));

@@ -74,8 +74,7 @@ class UploadToIngest : public ::testing::Test {
   std::condition_variable done;
 };
 
-// Guards against: feedback sent to a server with an unpinned key or untrusted
-// certificate, refused by one pinned and trusted, or altered on the wire.
+// Guards against: feedback sent to an unpinned or untrusted server, or refused or altered by a pinned one.
 TEST_F(UploadToIngest, OnlyAPinnedTrustedServerGetsTheFeedbackWhole) {
   testing::Receiver ingest(env.temp.path());
   ASSERT_TRUE(ingest.running());

@@ -116,7 +116,6 @@ TEST_F(UploadPreparation, SessionsAreCompressedIntoOwnerOnlyUploadFilesWithTheir
   auto request = makeManager()->uploadProtobufFeedback(sampleSession(), sessionURL());
   ASSERT_TRUE(request);
   EXPECT_EQ(request->fileURL, uploadFile());
-  EXPECT_EQ(request->typeString, "FeedbackV2PB");
   auto compressed = readFile(uploadFile());
   EXPECT_EQ(inflateRawIndependently(compressed), sampleSession().SerializeAsString());
   EXPECT_EQ(env.fileManager->attributes(uploadFile())->mode, 0600u);
@@ -174,7 +173,6 @@ TEST_F(UploadPreparation, EachRefusalIsLoggedAndLeavesNoUploadFile) {
 
   env.writeBag({{"feedback_url", "ftp://h.example/u"}});
   auto m = makeManager();
-  EXPECT_FALSE(m->canFormRequest("FeedbackV2PB"));
   EXPECT_FALSE(m->uploadProtobufFeedback(sampleSession(), sessionURL()));
   EXPECT_TRUE(logs.contains("feedbackUploadRequest failed because of bad url."));
   for (const auto& e : fs::recursive_directory_iterator(env.cacheDir())) {
