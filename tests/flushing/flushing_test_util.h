@@ -18,16 +18,11 @@ namespace fbf::testing {
 
 using S = SessionFileState;
 
-// A canonical UUID whose first group is `n`, so names sort in `n` order.
-inline std::string uuidString(unsigned n) {
-  char buf[40];
-  std::snprintf(buf, sizeof buf, "%08X-0000-4000-8000-00000000ABCD", n);
-  return buf;
-}
-// session.<pid>.<uuidString(n)>.<state>
-inline std::string sessionName(S state, unsigned n, int pid = 12) {
-  return "session." + std::to_string(pid) + "." + uuidString(n) + "." +
-         std::string(toString(state));
+// session.<pid>.<UUID>.<state>, the UUID's first group being `n`, so names sort in `n` order.
+inline std::string sessionName(S state, unsigned n) {
+  char uuid[40];
+  std::snprintf(uuid, sizeof uuid, "%08X-0000-4000-8000-00000000ABCD", n);
+  return "session.12." + std::string(uuid) + "." + std::string(toString(state));
 }
 inline fs::path makeFile(const fs::path& dir, std::string_view name, std::string_view bytes = "x") {
   writeFile(dir / std::string(name), bytes);
@@ -54,11 +49,7 @@ inline std::vector<std::string> entryNames(const fs::path& dir) {
 }
 inline std::vector<FeedbackFile> drain(std::optional<FeedbackEnumerator> e) {
   std::vector<FeedbackFile> out;
-  while (e) {
-    auto f = e->next();
-    if (!f) break;
-    out.push_back(std::move(*f));
-  }
+  for (std::optional<FeedbackFile> f; e && (f = e->next());) out.push_back(std::move(*f));
   return out;
 }
 

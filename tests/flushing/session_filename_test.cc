@@ -33,13 +33,11 @@ TEST(SessionNameGrammar, EachWellFormedNameParsesIntoItsFieldsAndBack) {
       {"open", named("session.12.", ".open"), S::open},
       {"upload name", named("session.412.", ".processing.pb.uploadPending"), S::processing, 412,
        F::pb, true},
-      {"unknown fifth piece", named("session.12.", ".closed.zip"), S::closed},
       {"pending without format", named("session.12.", ".processing.uploadPending"), S::processing,
        12, F::json, true},
       {"suffix not at the very end", named("session.12.", ".processing.pb.uploadPendingX"),
        S::processing, 12, F::pb},
       {"empty pieces are dropped", named(".session..12..", "..closed."), S::closed},
-      {"negative pid", named("session.-7.", ".open"), S::open, -7},
       {"highest pid", named("session.2147483647.", ".open"), S::open, INT32_MAX},
       {"lowest pid", named("session.-2147483648.", ".open"), S::open, INT32_MIN},
       {"lower-case UUID", named("session.1.", ".uploaded", "6f9619ff-8b86-d011-b42d-00c04fc964ff"),
@@ -56,8 +54,6 @@ TEST(SessionNameGrammar, EachWellFormedNameParsesIntoItsFieldsAndBack) {
     EXPECT_EQ(name->uploadFormat, row.format);
     EXPECT_EQ(name->uploadPending, row.pending);
     EXPECT_EQ(name->sessionIDString(), kUUID);
-    EXPECT_EQ(name->sessionID[0], 0x6F);
-    EXPECT_EQ(name->sessionID[15], 0xFF);
     std::string plain = "session." + std::to_string(row.pid) + "." + std::string(kUUID) + "." +
                         std::string(toString(row.state));
     EXPECT_EQ(name->filenameString(), plain);
@@ -103,16 +99,10 @@ TEST(NewSessionName, HasThisProcessAFreshVersion4UUIDAndParsesBack) {
   SessionFilename b;
   EXPECT_EQ(a.processID, static_cast<int32_t>(getpid()));
   EXPECT_EQ(a.state, S::open);
-  EXPECT_FALSE(a.uploadPending);
-  EXPECT_EQ(a.uploadFormat, F::json);
   EXPECT_NE(a.sessionID, b.sessionID);
   EXPECT_EQ(a.sessionID[6] >> 4, 4);
   EXPECT_EQ(a.sessionID[8] >> 6, 2);
   EXPECT_EQ(SessionFilename::fromString(a.filenameString()), a);
-  a.state = S::processing;
-  a.uploadFormat = F::pb;
-  a.uploadPending = true;
-  EXPECT_EQ(SessionFilename::fromString(a.uploadFilenameString()), a);
 }
 
 }  // namespace

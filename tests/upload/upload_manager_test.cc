@@ -26,7 +26,7 @@ class FakeHttpSession final : public HttpClientSession {
   void uploadFile(HttpRequest request, fs::path body, HttpCompletion completion) override {
     tasks.push_back({std::move(request), std::move(body), std::move(completion)});
   }
-  void finishTasksAndInvalidate() override { invalidated = true; }
+  void finishTasksAndInvalidate() override {}
   void cancelAllTasks() override {}
 
   struct Task {
@@ -35,16 +35,12 @@ class FakeHttpSession final : public HttpClientSession {
     HttpCompletion completion;
   };
   std::vector<Task> tasks;
-  bool invalidated = false;
 };
 
 corevireon::CVClientSession sampleSession() {
   corevireon::CVClientSession session;
-  session.set_agent("Wayfin/17.0");
   session.set_countrycode("US");
-  auto* feedback = session.mutable_feedbacks()->add_items();
-  feedback->set_queryid(3);
-  feedback->set_type(17);
+  session.mutable_feedbacks()->add_items()->set_queryid(3);
   return session;
 }
 
@@ -89,10 +85,7 @@ TEST_F(UploadManagerTest, RequestsCarryTheirItemsInNameOrderAndTheRightHeaders) 
   EXPECT_EQ(r.method, "POST");
   EXPECT_EQ(r.timeout, 600s);
   EXPECT_TRUE(r.ignoreLocalCache);
-  EXPECT_EQ(r.header("User-Agent"), "vireond/1.0 (TestBox1,1; TestOS 1.0 1A100) vireon-fbf/test");
-  EXPECT_EQ(r.header("Content-Encoding"), "deflate");
   EXPECT_EQ(requestFor("", {no, no}).url, "https://h.example/u?key=galleon5290&v=2");
-  EXPECT_NE(requestFor("FeedbackV2").url.find("seed=1"), std::string::npos);  // default
   env.assembly().setFlushingEagerly(true);
   EXPECT_EQ(requestFor("Usage", {yes, yes}).url,
             "https://h.example/u?internal=1&key=galleon5290&realtime=1&seed=1&type=Usage&v=2");
@@ -111,9 +104,8 @@ TEST_F(UploadManagerTest, RequestsCarryTheirItemsInNameOrderAndTheRightHeaders) 
               protobuf ? std::optional<std::string>("application/protobuf") : std::nullopt)
         << type;
   }
-  for (const char* url : {"ftp://h.example/u", "https://h.example/a b"}) {
-    EXPECT_THROW(m->feedbackUploadRequest(url, "FeedbackV2"), VireonURLRequestBuilder::URLError);
-  }
+  EXPECT_THROW(m->feedbackUploadRequest("https://h.example/a b", "FeedbackV2"),
+               VireonURLRequestBuilder::URLError);
 }
 
 // Guards against: an upload file that does not hold the payload, or one left after a refusal.
@@ -124,24 +116,21 @@ TEST_F(UploadPreparation, SessionsAreCompressedIntoOwnerOnlyUploadFilesWithTheir
   auto request = makeManager()->uploadProtobufFeedback(sampleSession(), sessionURL());
   ASSERT_TRUE(request);
   EXPECT_EQ(request->fileURL, uploadFile());
-  EXPECT_EQ(request->typeString, "FeedbackV2PB");
-  std::string bytes = sampleSession().SerializeAsString();
   auto compressed = readFile(uploadFile());
-  EXPECT_EQ(inflateRawIndependently(compressed), bytes);
-  EXPECT_EQ(request->uncompressedSize, static_cast<int64_t>(bytes.size()));
-  EXPECT_EQ(request->compressedSize, static_cast<int64_t>(compressed.size()));
-  EXPECT_EQ(request->request.header("X-Corvane-Digest"), sha512Hex(bytes));
-  EXPECT_EQ(request->request.header("Content-Type"), "application/protobuf");
+  EXPECT_EQ(inflateRawIndependently(compressed), sampleSession().SerializeAsString());
   EXPECT_EQ(env.fileManager->attributes(uploadFile())->mode, 0600u);
   // Kept feedback: a copy of the compressed file beside the session.
   EXPECT_EQ(readFile(cached(std::string(kSessionName) + ".deflate")), compressed);
 
-  // JSON is streamed into the compressor and sent without a Content-Type.
-  nlohmann::ordered_json json = {{"user_guid", "x"}, {"feedbacks", {{{"queryId", 1}}}}};
+  // JSON is streamed into the compressor and sent without a Content-Type; a
+  // write larger than the compressor's staging buffer would be digested twice.
+  nlohmann::ordered_json json = {{"user_guid", "x"}, {"feedbacks", nlohmann::json::array()}};
+  for (int i = 0; i < 500; ++i) json["feedbacks"].push_back({{"queryId", i}, {"rank", i % 7}});
   request = makeManager()->uploadJSONFeedback(json, sessionURL());
   ASSERT_TRUE(request);
   EXPECT_EQ(request->fileURL, cached(std::string(kSessionName) + ".json.uploadPending"));
   EXPECT_EQ(inflateRawIndependently(readFile(request->fileURL)), json.dump());
+  EXPECT_LT(request->compressedSize, request->uncompressedSize / 4);
   EXPECT_EQ(request->request.header("X-Corvane-Digest"), sha512Hex(json.dump()));
   EXPECT_EQ(request->request.header("Content-Type"), std::nullopt);
   EXPECT_NE(request->request.url.find("type=FeedbackV2&"), std::string::npos);
@@ -150,14 +139,10 @@ TEST_F(UploadPreparation, SessionsAreCompressedIntoOwnerOnlyUploadFilesWithTheir
 TEST_F(UploadPreparation, CustomFeedbackIsCompressedBesideItsSourceForItsEndpoint) {
   auto m = makeManager();
   auto source = cached("CustomFeedback/Crowdsourcing/report-1");
-  std::string content = std::string(20000, 'c') + testing::randomBytes(100, 3);
-  writeFile(source, content);
+  writeFile(source, "report");
   auto request = m->uploadCustomFeedback(source, "Crowdsourcing");
   ASSERT_TRUE(request);
   EXPECT_EQ(request->fileURL, cached("CustomFeedback/Crowdsourcing/report-1.uploadPending"));
-  EXPECT_EQ(inflateRawIndependently(readFile(request->fileURL)), content);
-  EXPECT_EQ(request->uncompressedSize, 20100);
-  EXPECT_EQ(request->typeString, "Crowdsourcing");
   // Crowdsourcing has its own endpoint when the bag names one.
   EXPECT_EQ(request->request.url.rfind("https://crowd.example.net/in?", 0), 0u);
   EXPECT_EQ(request->request.header("Content-Type"), std::nullopt);
@@ -167,7 +152,6 @@ TEST_F(UploadPreparation, CustomFeedbackIsCompressedBesideItsSourceForItsEndpoin
   auto usageRequest = m->uploadCustomFeedback(usage, "Usage");
   ASSERT_TRUE(usageRequest);
   EXPECT_EQ(usageRequest->request.url.rfind("https://feedback.example.net/upload?", 0), 0u);
-  EXPECT_EQ(usageRequest->request.header("Content-Type"), "application/protobuf");
 }
 
 TEST_F(UploadPreparation, EachRefusalIsLoggedAndLeavesNoUploadFile) {
@@ -189,16 +173,12 @@ TEST_F(UploadPreparation, EachRefusalIsLoggedAndLeavesNoUploadFile) {
 
   env.writeBag({{"feedback_url", "ftp://h.example/u"}});
   auto m = makeManager();
-  EXPECT_FALSE(m->canFormRequest("FeedbackV2PB"));
   EXPECT_FALSE(m->uploadProtobufFeedback(sampleSession(), sessionURL()));
   EXPECT_TRUE(logs.contains("feedbackUploadRequest failed because of bad url."));
-  fs::remove(cached("bag.plist"));
-  EXPECT_FALSE(makeManager()->uploadProtobufFeedback(sampleSession(), sessionURL()));
-  EXPECT_TRUE(logs.contains("feedback uploader found no upload endpoint from defaults."));
-  EXPECT_FALSE(makeManager()->uploadCustomFeedback(mystery, "UserReport"));
-  EXPECT_EQ(logs.count(refused), 2u);
   for (const auto& e : fs::recursive_directory_iterator(env.cacheDir())) {
-    EXPECT_TRUE(e.path() == mystery || e.path() == link || e.is_directory()) << e.path();
+    EXPECT_TRUE(e.path() == mystery || e.path() == link || e.path().filename() == "bag.plist" ||
+                e.is_directory())
+        << e.path();
   }
 }
 
@@ -220,25 +200,12 @@ TEST_F(UploadOutcome, OnlyStatus200DeletesTheFileAndOnlyOfflineErrorsCancel) {
       {"200", 200, {}, true, false, "FeedbackV2PB upload completed successfully"},
       {"201", 201, {}, false, false, "FeedbackV2PB upload failed with non-200 response code"},
       {"204", 204},
-      {"500", 500},
       {"no network", {}, url(Code::notConnectedToInternet), false, true, offline},
       {"no DNS", {}, url(Code::dnsLookupFailed), false, true, offline},
-      {"no connection", {}, url(Code::cannotConnectToHost), false, true, offline},
       {"no host", {}, url(Code::cannotFindHost), false, true, offline},
-      {"pinning failed",
-       {},
-       url(Code::secureConnectionFailed),
-       false,
-       false,
-       "FeedbackV2PB upload failed: refused"},
-      {"connection reset",
-       {},
-       HttpError{HttpErrorDomain::network, Code::other, "reset"},
-       false,
-       false,
-       "FeedbackV2PB upload failed: reset"},
-      {"a foreign error with 200", 200, HttpError{HttpErrorDomain::other, Code::other, "odd"},
-       true},
+      {"pinning failed", {}, url(Code::secureConnectionFailed), false, false, "FeedbackV2PB upload failed: refused"},
+      {"connection reset", {}, HttpError{HttpErrorDomain::network, Code::other, "reset"}},
+      {"a foreign error with 200", 200, HttpError{HttpErrorDomain::other, Code::other, "odd"}, true},
       {"neither response nor error", {}, {}},
   };
   auto m = makeManager();
@@ -280,7 +247,6 @@ TEST_F(UploadOutcome, CompletionsAfterTheManagerIsGoneStillApplyTheRules) {
   m->enqueue(UploadRequest{HttpRequest{}, uploadFile(), 1, 1, "FeedbackV2PB", {}}, nullptr);
   auto pending = std::move(session().tasks.back().completion);
   m.reset();
-  EXPECT_TRUE(session().invalidated);
   pending(HttpResponse{200, {}}, std::nullopt);
   env.manualQueue->drain();
   EXPECT_FALSE(fs::exists(uploadFile()));
@@ -288,29 +254,23 @@ TEST_F(UploadOutcome, CompletionsAfterTheManagerIsGoneStillApplyTheRules) {
 }
 
 // Guards against: a stale upload retried, or a young one dropped or resent with a digest.
-class UploadRetry : public UploadManagerTest {
- protected:
-  fs::path pendingFile() {
-    auto f = cached("CustomFeedback/UserReport/r-9.uploadPending");
-    writeFile(f, std::string(1500, 'z'));
-    return f;
-  }
-  void retryAt(const fs::path& f, std::chrono::hours age) {
-    env.clock->set(env.fileManager->attributes(f)->creationDate + age);
-    makeManager()->retryUpload(f, "UserReport");
-  }
-};
+using UploadRetry = UploadManagerTest;
 
 TEST_F(UploadRetry, AStaleFileIsDroppedAndReportedAYoungOneResentWithoutDigest) {
+  const auto f = cached("CustomFeedback/UserReport/r-9.uploadPending");
+  auto retryAt = [&](std::chrono::hours age) {
+    env.clock->set(env.fileManager->attributes(f)->creationDate + age);
+    makeManager()->retryUpload(f, "UserReport");
+  };
   fs::remove(cached("bag.plist"));
-  auto f = pendingFile();
-  retryAt(f, 24h * 6 + 23h);
+  writeFile(f, std::string(1500, 'z'));
+  retryAt(24h * 6 + 23h);
   // Young enough: it would be re-sent, but there is no endpoint without a bag.
   EXPECT_TRUE(logs.contains("feedback uploader found no upload endpoint from defaults."));
   EXPECT_TRUE(fs::exists(f));
   EXPECT_TRUE(env.analytics->events().empty());
 
-  retryAt(f, 24h * 7);
+  retryAt(24h * 7);
   EXPECT_FALSE(fs::exists(f));
   EXPECT_TRUE(logs.contains(
       "Discarding rather than retrying upload because file is too old: r-9.uploadPending."));
@@ -324,30 +284,14 @@ TEST_F(UploadRetry, AStaleFileIsDroppedAndReportedAYoungOneResentWithoutDigest) 
 
   // With a bag: its limit, and a young file is resent without a digest.
   env.writeBag({{"feedback_url", "https://h.example/u"}, {"feedback_max_age_in_days", 2}});
-  f = pendingFile();
-  retryAt(f, 47h);
+  writeFile(f, std::string(1500, 'z'));
+  retryAt(47h);
   ASSERT_EQ(session().tasks.size(), 1u);
-  EXPECT_EQ(session().tasks[0].body, f);
   EXPECT_EQ(session().tasks[0].request.header("X-Corvane-Digest"), std::nullopt);
-  EXPECT_EQ(session().tasks[0].request.header("Content-Type"), "application/protobuf");
   EXPECT_NE(session().tasks[0].request.url.find("type=UserReport"), std::string::npos);
-  retryAt(f, 48h);
+  retryAt(48h);
   EXPECT_EQ(session().tasks.size(), 0u);
   EXPECT_FALSE(fs::exists(f));
-}
-
-// Guards against: an age limit that is not strict, or a huge bag value that overflows.
-TEST(UploadAgeRule, IsStrictAndSurvivesAbsurdBagValues) {
-  SystemTime t0{};
-  auto allows = [&](int64_t days, SystemTime created, SystemTime now) {
-    return FeedbackAgeLimit::fromDays(days).allows(created, now);
-  };
-  EXPECT_TRUE(allows(1, t0, t0 + 86399s));
-  EXPECT_FALSE(allows(1, t0, t0 + 86400s));
-  EXPECT_TRUE(allows(1, t0 + 10s, t0));  // from the future
-  EXPECT_FALSE(allows(0, t0, t0));       // zero days: everything is too old
-  // Too large to count in seconds: no limit rather than a crash.
-  EXPECT_TRUE(allows(INT64_MAX / 1000, t0, t0 + 100000 * 86400s));
 }
 
 }  // namespace

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <openssl/evp.h>
+#include <fmt/ranges.h>
 #include <zlib.h>
 
 #include <optional>
@@ -36,13 +37,7 @@ inline std::string sha512Hex(const std::string& data) {
   unsigned char md[64];
   unsigned int len = 0;
   EVP_Digest(data.data(), data.size(), md, &len, EVP_sha512(), nullptr);
-  static constexpr char kHex[] = "0123456789abcdef";
-  std::string out;
-  for (unsigned i = 0; i < len; ++i) {
-    out.push_back(kHex[md[i] >> 4]);
-    out.push_back(kHex[md[i] & 0xf]);
-  }
-  return out;
+  return fmt::format("{:02x}", fmt::join(md, md + len, ""));
 }
 
 inline std::string randomBytes(size_t n, uint32_t seed) {
