@@ -109,7 +109,10 @@ bool readAll(int fd, std::string& out) {
   char buf[65536];
   while (true) {
     pollfd p{fd, POLLIN, 0};
-    if (::poll(&p, 1, 10000) <= 0) return false;  // the daemon never hung up
+    // libFuzzer's timeout alarm interrupts poll, which no handler restarts.
+    const int ready = ::poll(&p, 1, 10000);
+    if (ready < 0 && errno == EINTR) continue;
+    if (ready <= 0) return false;  // the daemon never hung up
     ssize_t n = ::read(fd, buf, sizeof buf);
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) return true;  // reset by the daemon: also an end
