@@ -31,6 +31,14 @@ void processAll(SessionProcessingHelper& helper, std::vector<CVFeedbackPayload>&
   for (auto& p : payloads) helper.process(mutableCodableMessage(p));
 }
 
+// A table row's payloads in text form, parsed and processed in turn.
+std::vector<CVFeedbackPayload> processRow(SessionProcessingHelper& helper, const std::vector<std::string>& texts) {
+  std::vector<CVFeedbackPayload> payloads;
+  for (const auto& text : texts) payloads.push_back(pb(text));
+  processAll(helper, payloads);
+  return payloads;
+}
+
 
 // Guards against: replacement numbers reused across keys, handed out twice for one key, or given to empty identifiers.
 TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearance) {
@@ -73,10 +81,8 @@ TEST(ReferencedAndExpanded, MissingItemsAreTheReferencedOnesNeverExpanded) {
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
-    std::vector<CVFeedbackPayload> payloads;
-    for (const auto& text : row.in) payloads.push_back(pb(text));
     SessionProcessingHelper helper;
-    processAll(helper, payloads);
+    const auto payloads = processRow(helper, row.in);
     ASSERT_TRUE(helper.missingResults() && helper.missingSuggestions());
     EXPECT_EQ(join(*helper.missingResults()), row.missingResults);
     EXPECT_EQ(join(*helper.missingSuggestions()), row.missingSuggestions);
@@ -136,10 +142,8 @@ TEST(Rewrites, EachKindRewrittenInPlace) {
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
-    std::vector<CVFeedbackPayload> payloads;
-    for (const auto& text : row.in) payloads.push_back(pb(text));
     SessionProcessingHelper helper;
-    processAll(helper, payloads);
+    const auto payloads = processRow(helper, row.in);
     EXPECT_EQ(join(payloads), row.out);
     EXPECT_EQ(join(*helper.missingResults()), row.missing);
     EXPECT_EQ(std::to_string(helper.identifiersMapped()) + "/" + std::to_string(helper.titlesCleared()), row.counts);
