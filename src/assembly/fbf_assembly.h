@@ -39,7 +39,7 @@ struct FBFAssemblyDependencies {
 
 class FBFAssembly final : public FBFAssemblyProtocol {
  public:
-  static constexpr int kUploadConnectionsPerHost = 4;
+  static constexpr int kUploadConnectionsPerHost = 6;
 
   explicit FBFAssembly(FBFAssemblyDependencies deps);
   ~FBFAssembly() override;

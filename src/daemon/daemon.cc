@@ -44,6 +44,9 @@ class LinuxDaemon final : public Daemon {
     // The activity's thread uses the scheduler, the assembly and the main
     // loop: stop it before any of them goes.
     if (activityQueue_) activityQueue_->shutdown();
+    // Its jobs post back to the work queue and write through the file
+    // manager, both the assembly's.
+    if (encoderQueue_) encoderQueue_->shutdown();
   }
 
   void setup() {
@@ -88,9 +91,11 @@ class LinuxDaemon final : public Daemon {
     });
 
     // 3. Serve clients.
-    auto flusherDependencies = [] {
+    // Sessions are compressed here while the work queue processes the next.
+    encoderQueue_ = makeSerialQueue("vireon-fbf.encoder");
+    auto flusherDependencies = [encoder = encoderQueue_] {
       FlusherDependencies d;
-      d.uploadManagerFactory = UploadManager::factory();
+      d.uploadManagerFactory = UploadManager::factory(encoder);
       d.usageStoreFactory = [](FBFAssemblyProtocol& a) -> std::unique_ptr<FlushUsageStore> {
         return CohortsUsageStore::make(a);
       };
@@ -212,6 +217,7 @@ class LinuxDaemon final : public Daemon {
   // Destroyed before the assembly: closes every open connection.
   std::unique_ptr<FlusherService> service_;
   std::shared_ptr<TaskQueue> activityQueue_;
+  std::shared_ptr<TaskQueue> encoderQueue_;
   std::unique_ptr<PeriodicActivityScheduler> scheduler_;
   std::unique_ptr<ChangeWatcher> watcher_;
 };

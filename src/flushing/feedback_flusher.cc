@@ -111,8 +111,8 @@ void FeedbackFlusher::flushNext() {
       self->enumeratingFeedbackDidFinish();
       return;
     }
-    if (self->uploadManager_ && self->uploadManager_->uploadsInFlight() >= kMaximumUploadsInFlight) {
-      // Resumed by the next upload's completion.
+    if (!self->hasRoom()) {
+      // Resumed by the next preparation's or upload's completion.
       self->walkWaiting_ = true;
       return;
     }
@@ -254,7 +254,7 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
     return;
   }
 
-  std::optional<UploadRequest> request;
+  std::string payload;
   {
     std::string guid = file.sessionFilename ? file.sessionFilename->sessionIDString() : name;
     SignpostInterval serialize("serialize session", ("file GUID:" + guid).c_str());
@@ -265,6 +265,7 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
       log().error("File contents did not deserialize into a _CVClientSession");
       return;
     }
+    bytes.reset();
     if (!session.has_feedbacks() || session.feedbacks().items_size() == 0) {
       log().error("Deserialized session contained no feedback.");
       return;
@@ -272,33 +273,54 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
     FlushableSession flushable(std::move(session));
     flushable.postProcessFeedback(usageStore_ ? usageStore_->usageEventSink() : nullptr);
     if (protobufFormat) {
-      if (assembly_.uploadListener()) tee(serializeSessionDeterministically(flushable.backingStore()), typeString);
-      request = uploadManager_->uploadProtobufFeedback(flushable.backingStore(), path);
+      // Deterministic: the upload is byte for byte what `fbfctl explain` shows.
+      payload = serializeSessionDeterministically(flushable.backingStore());
     } else {
-      auto json = flushable.generateSessionJSON();
-      if (assembly_.uploadListener()) tee(json.dump(), typeString);
-      request = uploadManager_->uploadJSONFeedback(json, path);
+      try {
+        payload = flushable.generateSessionJSON().dump();
+      } catch (const nlohmann::json::exception& e) {
+        // Strings that are not UTF-8 cannot be written as JSON.
+        log().error("Session didn't serialize properly to JSON: {}", e.what());
+        returnToClosed(path);
+        return;
+      }
     }
   }
+  tee(payload, typeString);
+
+  // The work queue goes on with the next file while this one is compressed.
+  ++preparationsInFlight_;
+  auto self = shared_from_this();
+  uploadManager_->prepareSessionUpload(
+      std::move(payload), protobufFormat ? UploadFormat::pb : UploadFormat::json, path,
+      [self, path, typeString, fileSize = attrs->size](std::optional<UploadRequest> request) {
+        --self->preparationsInFlight_;
+        self->sessionUploadPrepared(path, typeString, fileSize, std::move(request));
+        self->resumeWalk();
+      });
+}
+
+void FeedbackFlusher::sessionUploadPrepared(const fs::path& path, const std::string& typeString, uint64_t fileSize,
+                                            std::optional<UploadRequest> request) {
   if (!request) {
     // No upload file was made (no space, no endpoint, ...): try again later.
     returnToClosed(path);
     return;
   }
-
   // The processed payload has its own limit under its feedback type.
   const uint64_t processedLimit = sizeLimitFor(typeString);
   if (static_cast<uint64_t>(request->uncompressedSize) > processedLimit) {
-    log().info("Discarding vireon session {} because size exceeds maximum size {}KB", name, processedLimit / 1024);
-    vireon_removeItemOrLogError(fm, request->fileURL, "error removing upload file");
-    discardFeedback(path, protobufType, FeedbackDeletionReason::tooLarge);
+    log().info("Discarding vireon session {} because size exceeds maximum size {}KB", path.filename().string(),
+               processedLimit / 1024);
+    vireon_removeItemOrLogError(assembly_.fileManager(), request->fileURL, "error removing upload file");
+    discardFeedback(path, *knownFeedbackTypeFromName(FBFStrings::VireonProtobufFeedbackType),
+                    FeedbackDeletionReason::tooLarge);
     return;
   }
-
   SignpostInterval upload("upload");
   // The payload now lives in the upload file; the session file goes once
   // that is safe.
-  enqueue(std::move(*request), attrs->size, path);
+  enqueue(std::move(*request), fileSize, path);
 }
 
 void FeedbackFlusher::validateAndUploadCustomFeedback(const FeedbackFile& file) {
@@ -347,6 +369,7 @@ void FeedbackFlusher::validateAndUploadCustomFeedback(const FeedbackFile& file) 
 }
 
 void FeedbackFlusher::tee(const std::string& payload, const std::string& format) {
+  // A listener sees what is about to be sent.
   if (auto listener = assembly_.uploadListener()) listener->willUploadData(payload, format);
 }
 
@@ -414,8 +437,12 @@ void FeedbackFlusher::discardFeedback(const fs::path& file, int typeCode, int32_
 
 void FeedbackFlusher::enumeratingFeedbackDidFinish() {
   if (walkFinished_) return;
-  walkFinished_ = true;
   walkWaiting_ = false;
+  // Files still being compressed are enqueued, and their sources retired,
+  // before the walk counts as finished.
+  walkEnding_ = preparationsInFlight_ > 0;
+  if (walkEnding_) return;
+  walkFinished_ = true;
   log().debug("flush complete, cleaning up");
   flushInterval_.reset();
   syncAndRetireSources();
@@ -457,11 +484,22 @@ void FeedbackFlusher::uploadManagerDidUploadFile(const fs::path& file, long stat
       }
     }
   }
-  if (walkWaiting_ && uploadManager_ && uploadManager_->uploadsInFlight() < kMaximumUploadsInFlight) {
+  resumeWalk();
+  if (walkFinished_) completeWhenUploadsSettle();
+}
+
+bool FeedbackFlusher::hasRoom() const {
+  const size_t uploads = uploadManager_ ? uploadManager_->uploadsInFlight() : 0;
+  return preparationsInFlight_ < kMaximumPreparations && uploads + preparationsInFlight_ < kMaximumUploadsInFlight;
+}
+
+void FeedbackFlusher::resumeWalk() {
+  if (walkWaiting_ && hasRoom()) {
     walkWaiting_ = false;
     flushNext();
+  } else if (walkEnding_ && preparationsInFlight_ == 0) {
+    enumeratingFeedbackDidFinish();
   }
-  if (walkFinished_) completeWhenUploadsSettle();
 }
 
 void FeedbackFlusher::completeWhenUploadsSettle() {
@@ -487,9 +525,7 @@ void FeedbackFlusher::flushSessionEagerly(const fs::path& url, std::function<voi
     } else if (attrs && attrs->isRegular()) {
       self->flushFeedbackFile(FeedbackFile(url, attrs));
     }
-    self->walkFinished_ = true;
-    self->syncAndRetireSources();
-    self->completeWhenUploadsSettle();
+    self->enumeratingFeedbackDidFinish();
   });
 }
 

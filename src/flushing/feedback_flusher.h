@@ -5,11 +5,13 @@
 // and calls its completion exactly once.
 //
 // The walk is bounded: it takes the next file only while fewer than
-// `kMaximumUploadsInFlight` uploads are queued or in flight, and resumes from
-// each upload's completion, so memory, descriptors and the work waiting on the
+// `kMaximumUploadsInFlight` uploads are being compressed, queued or in flight
+// (at most `kMaximumPreparations` of them compressed at once), and resumes
+// from each completion, so memory, descriptors and the work waiting on the
 // queue do not grow with the backlog on disk, and completions (delete after
-// 200, loss events) run promptly between files. Uploads left by earlier runs
-// are retried first, oldest first.
+// 200, loss events) run promptly between files. A session is compressed while
+// the walk processes the next one, on the upload manager's encoder where it
+// has one. Uploads left by earlier runs are retried first, oldest first.
 //
 // A claimed file is removed only once its payload is safe: after its upload
 // answered 200, or after a batched file-system sync has made its upload file
@@ -77,6 +79,9 @@ class FeedbackFlusher final : public UploadManagerDelegate, public std::enable_s
   // Uploads queued or in flight before the walk waits: enough for HTTP/2
   // streams to hide a slow server's latency, few enough to hold little.
   static constexpr size_t kMaximumUploadsInFlight = 32;
+  // Payloads handed over for compression and not back yet: one being
+  // compressed and one waiting keep the encoder busy without holding more.
+  static constexpr size_t kMaximumPreparations = 2;
   static constexpr size_t kSessionRemovalBatch = 64;
 
   static std::shared_ptr<FeedbackFlusher> make(FBFAssemblyProtocol& assembly, FlusherDependencies deps);
@@ -104,6 +109,12 @@ class FeedbackFlusher final : public UploadManagerDelegate, public std::enable_s
   std::optional<FeedbackFile> nextFile();
   void flushFeedbackFile(const FeedbackFile& file);
   void postProcessAndUpload(const FeedbackFile& file);
+  void sessionUploadPrepared(const fs::path& path, const std::string& typeString, uint64_t fileSize,
+                             std::optional<UploadRequest> request);
+  bool hasRoom() const;
+  // After a completion: takes the next file if the walk waits for room, or
+  // ends a walk that waited for its last preparation.
+  void resumeWalk();
   void validateAndUploadCustomFeedback(const FeedbackFile& file);
   void retryPendingUpload(const FeedbackFile& file);
   void checkAgeOfPoisonFile(const FeedbackFile& file);
@@ -133,7 +144,9 @@ class FeedbackFlusher final : public UploadManagerDelegate, public std::enable_s
   FeedbackAgeLimit ageLimit_;
   bool leaveFeedbackAfterUpload_ = false;
   bool walkFinished_ = false;
-  bool walkWaiting_ = false;  // the walk waits for an upload to complete
+  bool walkWaiting_ = false;  // the walk waits for a preparation or an upload to complete
+  bool walkEnding_ = false;   // the walk is over but preparations are outstanding
+  size_t preparationsInFlight_ = 0;
   bool pruneWhenSettled_ = false;  // a full or typed flush prunes; an eager one does not
   // Uploads left by earlier runs, oldest first; retried before the walk.
   std::deque<FeedbackFile> pendingUploads_;

@@ -8,9 +8,8 @@
 
 #include "assembly/fbf_assembly_protocol.h"
 #include "platform/file_manager.h"
+#include "flushing/session_filename.h"
 #include "platform/http_session.h"
-
-#include <nlohmann/json.hpp>
 
 #include <cstdint>
 #include <functional>
@@ -18,10 +17,6 @@
 #include <optional>
 #include <string>
 #include <vector>
-
-namespace corevireon {
-class CVClientSession;
-}
 
 namespace fbf {
 
@@ -60,14 +55,17 @@ class UploadManagerProtocol {
   virtual ~UploadManagerProtocol() = default;
 
   // Each preparation forms the request and compresses its payload into the
-  // upload file, which appears under its name only once whole; no value on
+  // upload file, which appears under its name only once whole; no request on
   // any failure (already logged), and then no upload file is left behind.
-  // The session file at `sessionURL` names the upload file (its upload name,
-  // in the shared cache directory).
-  virtual std::optional<UploadRequest> uploadProtobufFeedback(const corevireon::CVClientSession& session,
-                                                              const fs::path& sessionURL) = 0;
-  virtual std::optional<UploadRequest> uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
-                                                          const fs::path& sessionURL) = 0;
+
+  // A session's payload, already serialised in `format`, for the session
+  // file at `sessionURL` (which names the upload file: its upload name, in
+  // the shared cache directory). The compression may run off the work queue,
+  // so that the next file is processed meanwhile; `completion` runs on the
+  // work queue, possibly before this call returns.
+  using PreparationCompletion = std::function<void(std::optional<UploadRequest>)>;
+  virtual void prepareSessionUpload(std::string payload, UploadFormat format, const fs::path& sessionURL,
+                                    PreparationCompletion completion) = 0;
   // Compresses `fileURL` into "<fileURL>.uploadPending" beside it.
   virtual std::optional<UploadRequest> uploadCustomFeedback(const fs::path& fileURL, const std::string& type) = 0;
 

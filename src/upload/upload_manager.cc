@@ -16,7 +16,6 @@
 
 #include <array>
 #include <cstring>
-#include <ostream>
 
 namespace fbf {
 namespace {
@@ -158,10 +157,12 @@ struct UploadManager::Core {
   }
 };
 
-UploadManager::UploadManager(FBFAssemblyProtocol& assembly, UploadBuildPredicates predicates)
+UploadManager::UploadManager(FBFAssemblyProtocol& assembly, UploadBuildPredicates predicates,
+                             std::shared_ptr<TaskQueue> encoder)
     : assembly_(assembly),
       predicates_(std::move(predicates)),
       uploadSession_(assembly.makeUploadSession()),
+      encoder_(std::move(encoder)),
       bag_(assembly.cachedBag()),
       ageLimit_(FeedbackAgeLimit::fromBag(bag_)),
       fileManager_(assembly.fileManager()),
@@ -177,9 +178,9 @@ UploadManager::~UploadManager() {
 
 void UploadManager::setDelegate(UploadManagerDelegate* delegate) { core_->delegate = delegate; }
 
-UploadManagerFactory UploadManager::factory() {
-  return [](FBFAssemblyProtocol& assembly) -> std::unique_ptr<UploadManagerProtocol> {
-    return std::make_unique<UploadManager>(assembly);
+UploadManagerFactory UploadManager::factory(std::shared_ptr<TaskQueue> encoder) {
+  return [encoder](FBFAssemblyProtocol& assembly) -> std::unique_ptr<UploadManagerProtocol> {
+    return std::make_unique<UploadManager>(assembly, UploadBuildPredicates{}, encoder);
   };
 }
 
@@ -292,11 +293,20 @@ bool UploadManager::canFormRequest(const std::string& type) {
   return usable;
 }
 
+namespace {
+
+struct Compressed {
+  int64_t uncompressedSize = 0;
+  int64_t compressedSize = 0;
+  std::string digest;
+};
+
 // Compresses whatever `produce` writes into the upload file at `finalPath`.
 // No value when the file cannot be written whole (nothing is left behind).
-std::optional<UploadManager::Compressed> UploadManager::compressInto(
-    const fs::path& finalPath, const std::function<bool(CompressedOutputStream&)>& produce) {
-  PartialUploadFile file(fileManager_, finalPath);
+// Touches only the file manager, so any thread may run it.
+std::optional<Compressed> compressInto(FileManager& fm, const fs::path& finalPath,
+                                       const std::function<bool(CompressedOutputStream&)>& produce) {
+  PartialUploadFile file(fm, finalPath);
   FileDescriptor fd = file.create();
   if (!fd.valid()) {
     log().error("Error getting temp file.");
@@ -326,71 +336,118 @@ std::optional<UploadManager::Compressed> UploadManager::compressInto(
   return Compressed{stream.uncompressedBytesWritten(), stream.compressedBytesWritten(), stream.dataDigestForStream()};
 }
 
-UploadRequest UploadManager::finish(HttpRequest request, const fs::path& fileURL, const Compressed& compressed,
-                                    std::string typeString) {
+UploadRequest finish(HttpRequest request, const fs::path& fileURL, const Compressed& compressed,
+                     std::string typeString) {
   setHeader(request, FBFStrings::HTTPHeaders::Digest, compressed.digest);
   return UploadRequest{std::move(request), fileURL, compressed.uncompressedSize, compressed.compressedSize,
                        std::move(typeString), {}};
 }
 
+}  // namespace
+
 // ---- preparations ----
 // Each forms the request first: a request that cannot be formed leaves no
 // compressed copy behind.
 
+struct UploadManager::SessionJob {
+  std::string payload;
+  UploadFormat format = UploadFormat::pb;
+  fs::path fileURL;
+  HttpRequest request;
+  std::string type;
+  // Where a copy of the compressed upload stays (LeaveFeedbackAfterUpload).
+  std::optional<fs::path> keepCopyAt;
+
+  // Any thread.
+  std::optional<UploadRequest> run(FileManager& fm) {
+    auto compressed = compressInto(fm, fileURL, [&](CompressedOutputStream& stream) {
+      if (format == UploadFormat::pb) {
+        stream.write(reinterpret_cast<const uint8_t*>(payload.data()), payload.size());
+      } else {
+        // JSON goes in small writes, so its digest is the plain SHA-512.
+        CompressedStreamBuf buffer(stream);
+        buffer.sputn(payload.data(), static_cast<std::streamsize>(payload.size()));
+      }
+      return true;
+    });
+    if (!compressed) return std::nullopt;
+    if (keepCopyAt) {
+      log().info("Respecting LeaveFeedbackAfterUpload and leaving compressed feedback file {}", fileURL.string());
+      std::error_code ec;
+      if (!fm.copyItem(fileURL, *keepCopyAt, ec)) {
+        log().error("Error copying compressed upload data for LeaveFeedbackAfterUpload {}", fileURL.string());
+      }
+    }
+    log().debug("{} vireon feedback upload to {}", format == UploadFormat::pb ? "Protobuf" : "JSON",
+                request.url.empty() ? "unknown?" : request.url);
+    return finish(std::move(request), fileURL, *compressed, std::move(type));
+  }
+};
+
+std::optional<UploadManager::SessionJob> UploadManager::sessionJob(std::string payload, UploadFormat format,
+                                                                   const fs::path& sessionURL) {
+  SessionJob job;
+  job.format = format;
+  job.type = format == UploadFormat::pb ? FBFStrings::VireonProtobufFeedbackType : FBFStrings::VireonFeedbackType;
+  auto fileURL = uploadFileForSessionAt(sessionURL, format);
+  if (!fileURL) return std::nullopt;
+  auto request = requestFor(job.type);
+  if (!request) return std::nullopt;
+  job.fileURL = std::move(*fileURL);
+  job.request = std::move(*request);
+  if (format == UploadFormat::pb &&
+      assembly_.userDefaults().boolForKey(FBFStrings::Defaults::LeaveFeedbackAfterUpload)) {
+    if (auto dir = cacheDirNoCreate(fileManager_)) {
+      job.keepCopyAt = *dir / (sessionURL.filename().string() + ".deflate");
+    } else {
+      log().error("Error copying compressed upload data for LeaveFeedbackAfterUpload {}", job.fileURL.string());
+    }
+  }
+  job.payload = std::move(payload);
+  return job;
+}
+
+void UploadManager::prepareSessionUpload(std::string payload, UploadFormat format, const fs::path& sessionURL,
+                                         PreparationCompletion completion) {
+  auto job = sessionJob(std::move(payload), format, sessionURL);
+  if (!job) {
+    completion(std::nullopt);
+    return;
+  }
+  if (!encoder_) {
+    completion(job->run(fileManager_));
+    return;
+  }
+  // The completion (and what it keeps alive) moves on to the work queue; the
+  // encoder's thread never holds the last reference to it.
+  encoder_->async([&fm = fileManager_, &workloop = assembly_.workloop(), job = std::move(*job),
+                   completion = std::move(completion)]() mutable {
+    auto request = job.run(fm);
+    workloop.async([request = std::move(request), completion = std::move(completion)]() mutable {
+      completion(std::move(request));
+    });
+  });
+}
+
 std::optional<UploadRequest> UploadManager::uploadProtobufFeedback(const corevireon::CVClientSession& session,
                                                                    const fs::path& sessionURL) {
-  const std::string type(FBFStrings::VireonProtobufFeedbackType);
-  auto fileURL = uploadFileForSessionAt(sessionURL, UploadFormat::pb);
-  if (!fileURL) return std::nullopt;
-  auto request = requestFor(type);
-  if (!request) return std::nullopt;
   // Deterministic: the upload is byte for byte what `fbfctl explain` shows.
-  const std::string bytes = serializeSessionDeterministically(session);
-  auto compressed = compressInto(*fileURL, [&](CompressedOutputStream& stream) {
-    stream.write(reinterpret_cast<const uint8_t*>(bytes.data()), bytes.size());
-    return true;
-  });
-  if (!compressed) return std::nullopt;
-
-  if (assembly_.userDefaults().boolForKey(FBFStrings::Defaults::LeaveFeedbackAfterUpload)) {
-    log().info("Respecting LeaveFeedbackAfterUpload and leaving compressed feedback file {}", fileURL->string());
-    std::error_code ec;
-    auto dir = cacheDirNoCreate(fileManager_);
-    bool copied = false;
-    if (dir) copied = fileManager_.copyItem(*fileURL, *dir / (sessionURL.filename().string() + ".deflate"), ec);
-    if (!copied) log().error("Error copying compressed upload data for LeaveFeedbackAfterUpload {}", fileURL->string());
-  }
-  log().debug("Protobuf vireon feedback upload to {}", request->url.empty() ? "unknown?" : request->url);
-  return finish(std::move(*request), *fileURL, *compressed, type);
+  auto job = sessionJob(serializeSessionDeterministically(session), UploadFormat::pb, sessionURL);
+  return job ? job->run(fileManager_) : std::nullopt;
 }
 
 std::optional<UploadRequest> UploadManager::uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
                                                                const fs::path& sessionURL) {
-  const std::string type(FBFStrings::VireonFeedbackType);
-  auto fileURL = uploadFileForSessionAt(sessionURL, UploadFormat::json);
-  if (!fileURL) return std::nullopt;
-  auto request = requestFor(type);
-  if (!request) return std::nullopt;
-  auto compressed = compressInto(*fileURL, [&](CompressedOutputStream& stream) {
-    CompressedStreamBuf buffer(stream);
-    std::ostream out(&buffer);
-    try {
-      out << dictionary;
-      out.flush();
-    } catch (const nlohmann::json::exception& e) {
-      // Strings that are not UTF-8 cannot be written as JSON.
-      log().error("Session didn't serialize properly to JSON: {}", e.what());
-      return false;
-    }
-    return true;
-  });
-  if (!compressed) return std::nullopt;
-  if (!fileManager_.exists(*fileURL)) {
-    log().error("Couldn't find file {} after compression.", fileURL->string());
+  std::string text;
+  try {
+    text = dictionary.dump();
+  } catch (const nlohmann::json::exception& e) {
+    // Strings that are not UTF-8 cannot be written as JSON.
+    log().error("Session didn't serialize properly to JSON: {}", e.what());
     return std::nullopt;
   }
-  log().debug("JSON vireon feedback upload to {}", request->url.empty() ? "unknown?" : request->url);
-  return finish(std::move(*request), *fileURL, *compressed, type);
+  auto job = sessionJob(std::move(text), UploadFormat::json, sessionURL);
+  return job ? job->run(fileManager_) : std::nullopt;
 }
 
 std::optional<UploadRequest> UploadManager::uploadCustomFeedback(const fs::path& fileURL, const std::string& type) {
@@ -411,7 +468,7 @@ std::optional<UploadRequest> UploadManager::uploadCustomFeedback(const fs::path&
     return std::nullopt;
   }
   const fs::path outURL = uploadFileForCustomFeedback(fileURL);
-  auto compressed = compressInto(outURL, [&](CompressedOutputStream& stream) {
+  auto compressed = compressInto(fileManager_, outURL, [&](CompressedOutputStream& stream) {
     std::array<uint8_t, 8192> buffer{};
     while (true) {
       ssize_t n = ::read(input.get(), buffer.data(), buffer.size());

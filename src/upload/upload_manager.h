@@ -7,6 +7,9 @@
 //
 // One manager is made per flush, on the assembly's work queue, and used only
 // there; completions of its session arrive there too, so it takes no locks.
+// Given an encoder queue, it compresses session payloads there, touching
+// nothing of its own: the job carries its request, file names and payload,
+// and its result comes back to the work queue.
 // The bag is read once, at construction. The upload session is made at
 // construction and asked to finish its tasks and invalidate when the manager
 // is destroyed; completions that arrive after that still apply the outcome
@@ -24,7 +27,10 @@
 #include "assembly/age_limit.h"
 #include "flushing/session_filename.h"
 #include "flushing/upload_manager_protocol.h"
+#include "platform/task_queue.h"
 #include "upload/url_request_builder.h"
+
+#include <nlohmann/json.hpp>
 
 #include <functional>
 #include <memory>
@@ -33,9 +39,11 @@
 #include <string>
 #include <vector>
 
-namespace fbf {
+namespace corevireon {
+class CVClientSession;
+}
 
-class CompressedOutputStream;
+namespace fbf {
 
 // The build facts that decide the "seed" and "internal" query items.
 struct UploadBuildPredicates {
@@ -49,7 +57,10 @@ class UploadManager final : public UploadManagerProtocol {
   static constexpr std::string_view kClientKey = "galleon5290";
   static constexpr std::chrono::seconds kUploadTimeout{600};
 
-  explicit UploadManager(FBFAssemblyProtocol& assembly, UploadBuildPredicates predicates = {});
+  // Without an encoder queue session payloads are compressed on the work
+  // queue, within `prepareSessionUpload`.
+  explicit UploadManager(FBFAssemblyProtocol& assembly, UploadBuildPredicates predicates = {},
+                         std::shared_ptr<TaskQueue> encoder = nullptr);
   ~UploadManager() override;
   UploadManager(const UploadManager&) = delete;
   UploadManager& operator=(const UploadManager&) = delete;
@@ -61,10 +72,13 @@ class UploadManager final : public UploadManagerProtocol {
   // Throws URLError for a URL that is not http(s) or cannot be parsed.
   HttpRequest feedbackUploadRequest(const std::string& url, const std::string& type);
 
+  void prepareSessionUpload(std::string payload, UploadFormat format, const fs::path& sessionURL,
+                            PreparationCompletion completion) override;
+  // The same, serialised here and compressed at once.
   std::optional<UploadRequest> uploadProtobufFeedback(const corevireon::CVClientSession& session,
-                                                      const fs::path& sessionURL) override;
+                                                      const fs::path& sessionURL);
   std::optional<UploadRequest> uploadJSONFeedback(const nlohmann::ordered_json& dictionary,
-                                                  const fs::path& sessionURL) override;
+                                                  const fs::path& sessionURL);
   std::optional<UploadRequest> uploadCustomFeedback(const fs::path& fileURL, const std::string& type) override;
   void enqueue(UploadRequest request, UploadCompletion completion) override;
   void retryUpload(const fs::path& fileURL, const std::string& typeString) override;
@@ -83,32 +97,29 @@ class UploadManager final : public UploadManagerProtocol {
   static std::vector<QueryItem> debugQueryItems(std::string_view parameters);
   // The endpoint a custom feedback type is uploaded to (see above).
   static std::optional<std::string> endpointForCustomType(const ConfigurationBag& bag, const std::string& type);
-  // Makes UploadManagers with the default build predicates.
-  static UploadManagerFactory factory();
+  // Makes UploadManagers with the default build predicates that compress on
+  // `encoder`.
+  static UploadManagerFactory factory(std::shared_ptr<TaskQueue> encoder);
 
   size_t uploadsInFlight() const override;
 
  private:
   struct Core;
-  struct Compressed {
-    int64_t uncompressedSize = 0;
-    int64_t compressedSize = 0;
-    std::string digest;
-  };
+  struct SessionJob;
   std::optional<std::string> endpointFor(const std::string& type) const;
   // The upload file of the session file at `sessionURL` in `format`; logs
   // when there is none.
   std::optional<fs::path> uploadFileForSessionAt(const fs::path& sessionURL, UploadFormat format) const;
   // The request for `type`, or no value after logging why not.
   std::optional<HttpRequest> requestFor(const std::string& type);
-  std::optional<Compressed> compressInto(const fs::path& finalPath,
-                                         const std::function<bool(CompressedOutputStream&)>& produce);
-  static UploadRequest finish(HttpRequest request, const fs::path& fileURL, const Compressed& compressed,
-                              std::string typeString);
+  // The session's request and upload file, formed on the work queue; no
+  // value after logging why not.
+  std::optional<SessionJob> sessionJob(std::string payload, UploadFormat format, const fs::path& sessionURL);
 
   FBFAssemblyProtocol& assembly_;
   UploadBuildPredicates predicates_;
   std::shared_ptr<HttpClientSession> uploadSession_;
+  std::shared_ptr<TaskQueue> encoder_;
   std::optional<ConfigurationBag> bag_;
   FeedbackAgeLimit ageLimit_;
   FileManager& fileManager_;

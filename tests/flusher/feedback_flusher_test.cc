@@ -36,14 +36,11 @@ class FakeUploadManager final : public UploadManagerProtocol {
 
   explicit FakeUploadManager(std::shared_ptr<Log> log) : log_(std::move(log)) {}
 
-  std::optional<UploadRequest> uploadProtobufFeedback(const corevireon::CVClientSession& session,
-                                                      const fs::path& sessionURL) override {
-    return prepared(sessionURL, session.ByteSizeLong(), "FeedbackV2PB");
-  }
-  // These tests run with the protobuf format only.
-  std::optional<UploadRequest> uploadJSONFeedback(const nlohmann::ordered_json&, const fs::path&) override {
-    ADD_FAILURE() << "unexpected JSON upload";
-    return std::nullopt;
+  // These tests run with the protobuf format only; the payload is ready at once.
+  void prepareSessionUpload(std::string payload, UploadFormat format, const fs::path& sessionURL,
+                            PreparationCompletion completion) override {
+    EXPECT_EQ(format, UploadFormat::pb);
+    completion(prepared(sessionURL, payload.size(), "FeedbackV2PB"));
   }
   std::optional<UploadRequest> uploadCustomFeedback(const fs::path& fileURL, const std::string& type) override {
     return prepared(fileURL, fs::file_size(fileURL), type);
