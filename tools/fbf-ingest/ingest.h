@@ -26,8 +26,6 @@
 // to --port-file (atomically). SIGINT/SIGTERM end the process with status 0.
 #pragma once
 
-#include <nlohmann/json.hpp>
-
 #include <optional>
 #include <string>
 #include <utility>
@@ -42,17 +40,11 @@ struct ReceivedRequest {
   std::string body;
 };
 
-// What is recorded of one request: the fields up to "type" in `head`, the
-// decoded body as JSON text (or "null") and why it could not be decoded.
-struct RequestDescription {
-  nlohmann::ordered_json head;
-  std::string decoded;
-  std::string decodeError;
-  // The whole record line, newline included, with this "status".
-  std::string line(const nlohmann::ordered_json& status) const;
-};
-
-RequestDescription describeRequest(const ReceivedRequest& request);
+// Writes the record line of `request` into `line`, up to its "status".
+void describeRequest(const ReceivedRequest& request, std::string& line);
+// Ends the line with the status answered, or with "dropped", and a newline.
+void finishLine(std::string& line, int status);
+void finishLineDropped(std::string& line);
 
 // Raw DEFLATE; no value when the data is not one complete stream.
 std::optional<std::string> inflateRaw(const std::string& compressed);
