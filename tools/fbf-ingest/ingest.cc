@@ -93,7 +93,10 @@ std::string digestKind(const std::string& header, std::string_view inflated, siz
   size_t maxPasses = bodySize / CompressedOutputStream::kStagingBufferSize + 2;
   EVP_MD_CTX* ctx = EVP_MD_CTX_new();
   EVP_MD_CTX* probe = EVP_MD_CTX_new();
-  EVP_DigestInit_ex(ctx, EVP_sha512(), nullptr);
+  // Fetched once: an implicit fetch on every initialisation costs a lookup
+  // in the provider's tables.
+  static EVP_MD* const sha512 = EVP_MD_fetch(nullptr, "SHA512", nullptr);
+  EVP_DigestInit_ex(ctx, sha512 ? sha512 : EVP_sha512(), nullptr);
   std::string kind;
   for (size_t passes = 1; passes <= maxPasses && kind.empty(); ++passes) {
     EVP_DigestUpdate(ctx, inflated.data(), inflated.size());
@@ -198,8 +201,10 @@ bool validUtf8(std::string_view v) {
 
 // A JSON string of `v`, escaped as the JSON library escapes (short escapes
 // where JSON has them, \u00xx for other control characters, everything else
-// as it is). The bytes are copied as they are: callers give valid UTF-8.
-void appendJsonString(std::string& out, std::string_view v) {
+// as it is). The bytes are copied as they are: callers give valid UTF-8, or
+// check it when this returns true, which it does when `v` is not all ASCII.
+bool appendJsonString(std::string& out, std::string_view v) {
+  bool nonAscii = false;
   out += '"';
   // Runs of characters that need no escape are copied whole.
   size_t start = 0;
@@ -207,6 +212,7 @@ void appendJsonString(std::string& out, std::string_view v) {
     while (k + 8 <= v.size() && !needsLook(load8(v.data() + k))) k += 8;
     if (k == v.size()) break;
     auto u = static_cast<unsigned char>(v[k]);
+    nonAscii |= u >= 0x80;
     if (u >= 0x20 && u != '"' && u != '\\') continue;
     out.append(v.data() + start, k - start);
     start = k + 1;
@@ -226,6 +232,7 @@ void appendJsonString(std::string& out, std::string_view v) {
   }
   out.append(v.data() + start, v.size() - start);
   out += '"';
+  return nonAscii;
 }
 
 // A string the client chose (path, query, header, type): the rare one that
@@ -387,6 +394,8 @@ struct WireMessage {
 
 struct WireField {
   const google::protobuf::FieldDescriptor* descriptor = nullptr;
+  // The descriptor resolves its type lazily, behind a once-flag, on every call.
+  google::protobuf::FieldDescriptor::Type type = google::protobuf::FieldDescriptor::TYPE_INT32;
   std::string key;  // "name":
   int wireType = 0;
   bool repeated = false;
@@ -435,6 +444,7 @@ class WireSchema {
       }
       auto f = std::make_unique<WireField>();
       f->descriptor = fd;
+      f->type = fd->type();
       appendJsonString(f->key, fd->name());
       f->key += ':';
       f->repeated = fd->is_repeated();
@@ -658,7 +668,7 @@ class WirePrinter {
     uint64_t v = 0;
     if (wireType == 0 && !varint(p, end, v)) return false;
     isDefault = v == 0;
-    switch (f.descriptor->type()) {
+    switch (f.type) {
       case FD::TYPE_INT32: isDefault = static_cast<int32_t>(v) == 0; appendInteger(out_, static_cast<int32_t>(v), false); break;
       case FD::TYPE_INT64: appendInteger(out_, static_cast<int64_t>(v), true); break;
       case FD::TYPE_UINT32: isDefault = static_cast<uint32_t>(v) == 0; appendInteger(out_, static_cast<uint32_t>(v), false); break;
@@ -712,11 +722,10 @@ class WirePrinter {
         std::string_view s(reinterpret_cast<const char*>(p), static_cast<size_t>(contentEnd - p));
         p = contentEnd;
         isDefault = s.empty();
-        if (f.descriptor->type() == FD::TYPE_BYTES) {
+        if (f.type == FD::TYPE_BYTES) {
           appendBase64(out_, s);
         } else {
-          if (!validUtf8(s)) return false;
-          appendJsonString(out_, s);
+          if (appendJsonString(out_, s) && !validUtf8(s)) return false;
         }
         break;
       }
@@ -775,12 +784,23 @@ bool appendJsonBodyAsLine(std::string& out, std::string_view body) {
 
 // Raw DEFLATE into a scratch buffer kept per thread, so that a request costs
 // neither the clearing of a fresh buffer nor its page faults. The view is
-// valid until the thread inflates again.
+// valid until the thread inflates again. The inflater is kept too, and reset
+// per body; asking it to finish in one call spares it from copying the last
+// 32 KB of the output into its window, which only a later call would need.
 std::optional<std::string_view> inflateToScratch(std::string_view compressed) {
-  z_stream z{};
-  if (inflateInit2(&z, -15) != Z_OK) return std::nullopt;
+  struct Inflater {
+    z_stream z{};
+    bool live = false;
+    Inflater() { live = inflateInit2(&z, -15) == Z_OK; }
+    ~Inflater() {
+      if (live) inflateEnd(&z);
+    }
+  };
+  thread_local Inflater inflater;
   thread_local std::unique_ptr<char[]> scratch;
   thread_local size_t scratchSize = 0;
+  z_stream& z = inflater.z;
+  if (!inflater.live || inflateReset(&z) != Z_OK) return std::nullopt;
   size_t produced = 0;
   z.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));
   z.avail_in = static_cast<uInt>(compressed.size());
@@ -796,15 +816,16 @@ std::optional<std::string_view> inflateToScratch(std::string_view compressed) {
     size_t room = std::min<size_t>(scratchSize - produced, 1u << 30);
     z.next_out = reinterpret_cast<Bytef*>(scratch.get() + produced);
     z.avail_out = static_cast<uInt>(room);
-    rc = inflate(&z, Z_NO_FLUSH);
+    rc = inflate(&z, Z_FINISH);
     produced += room - z.avail_out;
     if (rc == Z_BUF_ERROR) {
-      if (z.avail_in == 0 || z.avail_out != 0) break;
-      rc = Z_OK;  // only out of room: grow and go on
+      // Unfinished: with room left the stream is cut short, without it the
+      // buffer grows and inflating goes on.
+      if (z.avail_out != 0) break;
+      rc = Z_OK;
     }
   }
   bool complete = rc == Z_STREAM_END && z.avail_in == 0;
-  inflateEnd(&z);
   if (!complete) return std::nullopt;
   return std::string_view(scratch.get(), produced);
 }
