@@ -8,12 +8,17 @@
 // inflates the raw DEFLATE body, checks the "X-Corvane-Digest" header, decodes
 // the body by its "type" query item (protobuf session, cohort feedback, JSON),
 // answers, and appends one JSON line describing the request to the record
-// file (standard output without --record), flushed per line:
+// file (standard output without --record), with one write per line, made
+// before the answer is sent:
 //
 //   {"method","path","query":{name:value|null},"headers":{name:value},
 //    "body_size","inflated_size"(null when the body does not inflate),
 //    "digest_ok","digest_kind","type","decoded"(JSON or null),
 //    "decode_error"(when decoding failed),"status"(answered, or "dropped")}
+//
+// "decoded" is the proto3 JSON mapping (field names as in the .proto file,
+// 64-bit integers and bytes as strings, enums by name, default values left
+// out); a map's members come in the order they were sent.
 //
 // "digest_kind" is "sha512" when the header is the plain SHA-512 of the
 // inflated bytes, "passes/<pattern>" when it is the uploader's per-pass
