@@ -945,17 +945,18 @@ void describeRequest(const ReceivedRequest& request, std::string& line) {
   line += ",\"type\":";
   appendClientString(line, type);
 
-  // The decoded body is written in place; a session's JSON is about two and
-  // a half times its payload.
+  // The decoded body is written in place; a message's JSON is about two and
+  // a half times its payload, so room for it is made once.
   line += ",\"decoded\":";
-  if (inflated) line.reserve(line.size() + inflated->size() * 3 + 256);
   size_t decodedAt = line.size();
   std::string error;
   if (!inflated) {
     error = "the body is not a raw DEFLATE stream";
   } else if (type == "FeedbackV2PB") {
+    line.reserve(line.size() + inflated->size() * 3 + 256);
     if (!appendDecoded<corevireon::CVClientSession>(line, *inflated)) error = "not a CVClientSession";
   } else if (iequals(type, "Usage")) {
+    line.reserve(line.size() + inflated->size() * 3 + 256);
     if (!appendDecoded<corevireon::CVCohortsFeedback>(line, *inflated)) error = "not a CVCohortsFeedback";
   } else if (auto ct = headerValue(request, "Content-Type"); ct && iequals(*ct, "application/protobuf")) {
     // Protobuf of a type this receiver has no message for: recorded by size only.
