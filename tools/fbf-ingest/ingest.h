@@ -8,12 +8,17 @@
 // inflates the raw DEFLATE body, checks the "X-Corvane-Digest" header, decodes
 // the body by its "type" query item (protobuf session, cohort feedback, JSON),
 // answers, and appends one JSON line describing the request to the record
-// file (standard output without --record), flushed per line:
+// file (standard output without --record), with one write per line, made
+// before the answer is sent:
 //
 //   {"method","path","query":{name:value|null},"headers":{name:value},
 //    "body_size","inflated_size"(null when the body does not inflate),
 //    "digest_ok","digest_kind","type","decoded"(JSON or null),
 //    "decode_error"(when decoding failed),"status"(answered, or "dropped")}
+//
+// "decoded" is the proto3 JSON mapping (field names as in the .proto file,
+// 64-bit integers and bytes as strings, enums by name, default values left
+// out); a map's members come in the order they were sent.
 //
 // "digest_kind" is "sha512" when the header is the plain SHA-512 of the
 // inflated bytes, "passes/<pattern>" when it is the uploader's per-pass
@@ -25,8 +30,6 @@
 // the connection instead of answering. With PORT 0 the bound port is written
 // to --port-file (atomically). SIGINT/SIGTERM end the process with status 0.
 #pragma once
-
-#include <nlohmann/json.hpp>
 
 #include <optional>
 #include <string>
@@ -42,17 +45,11 @@ struct ReceivedRequest {
   std::string body;
 };
 
-// What is recorded of one request: the fields up to "type" in `head`, the
-// decoded body as JSON text (or "null") and why it could not be decoded.
-struct RequestDescription {
-  nlohmann::ordered_json head;
-  std::string decoded;
-  std::string decodeError;
-  // The whole record line, newline included, with this "status".
-  std::string line(const nlohmann::ordered_json& status) const;
-};
-
-RequestDescription describeRequest(const ReceivedRequest& request);
+// Writes the record line of `request` into `line`, up to its "status".
+void describeRequest(const ReceivedRequest& request, std::string& line);
+// Ends the line with the status answered, or with "dropped", and a newline.
+void finishLine(std::string& line, int status);
+void finishLineDropped(std::string& line);
 
 // Raw DEFLATE; no value when the data is not one complete stream.
 std::optional<std::string> inflateRaw(const std::string& compressed);
