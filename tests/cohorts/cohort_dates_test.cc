@@ -54,14 +54,6 @@ TEST(CaptureRanges, StartAndEndAtLocalMidnightsAndCountCalendarDays) {
   }
 }
 
-// Guards against: the calendar ignoring the process time zone.
-TEST(ProcessCalendar, FollowsTheProcessTimeZone) {
-  ScopedTimeZone zone("America/New_York");
-  EXPECT_EQ(CohortCalendar::current().timeZoneId(), "America/New_York");
-  ScopedTimeZone tokyo("Asia/Tokyo");
-  EXPECT_EQ(CohortCalendar::current().timeZoneId(), "Asia/Tokyo");
-}
-
 // Guards against: the week rule taken from the wrong locale variable.
 TEST(WeekRuleLocale, FollowsPosixPrecedence) {
   struct Row {

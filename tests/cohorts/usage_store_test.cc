@@ -155,22 +155,6 @@ TEST_F(StoreQueries, SentinelsAreNewestFirstForTheirClientInTheHalfOpenRange) {
   });
 }
 
-TEST_F(StoreQueries, UsageSessionsAndColumnSumsCoverTheHalfOpenRange) {
-  SystemTime start = utcTime(2030, 6, 1), end = utcTime(2030, 7, 1);
-  for (SystemTime t : {start - seconds(1), start, end - seconds(1), end}) {
-    addWayfinSession(t, {{VIRWayfinSession::goToSite, 1}, {VIRWayfinSession::other, 2}});
-  }
-  save();
-  on([&] {
-    EXPECT_EQ(store->queryProcessor().usageSessions<VIRWayfinSession>(start, end).size(), 2u);
-    auto sums = store->queryProcessor().fetchColumnSums(VIRWayfinSession::kEntityName, start, end);
-    EXPECT_EQ(sums, (std::map<std::string, int64_t>{{"goToSite", 2}, {"localGoto", 0}, {"localTap", 0},
-                                                    {"other", 4}, {"thirdPartyCompletionOrRecentSearch", 0},
-                                                    {"thirdPartyGoto", 0}, {"thirdPartyTap", 0}, {"vireonGoto", 0},
-                                                    {"vireonTap", 0}}));
-  });
-}
-
 TEST_F(StoreQueries, APurgeRemovesRecordsAtOrBeforeTheDateButNoCategories) {
   SystemTime date = utcTime(2030, 3, 1);
   for (SystemTime t : {date - hours(1), date, date + seconds(1)}) addSentinel(corevireon::CV_CLIENT_WEB_BROWSER, t);

@@ -74,6 +74,11 @@ TEST(RequestBuilderOnABadEndpoint, LogsAndThrowsOrStops) {
     EXPECT_TRUE(logs.contains("Scheme for url is neither http nor https.")) << url;
   }
   EXPECT_FALSE(URLComponents::parse("http://[::1"));
+  // Digits, "+", "-" and "." may follow the scheme's first letter.
+  auto other = URLComponents::parse("web+x-1.2://h.example/p");
+  ASSERT_TRUE(other);
+  EXPECT_EQ(other->scheme, "web+x-1.2");
+  EXPECT_EQ(other->authority, "h.example");
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(VireonURLRequestBuilder("https://h.example/a b"), "cannot be parsed");
 }
