@@ -8,8 +8,6 @@
 #include <sys/stat.h>
 #include <unicode/locid.h>
 
-#include <gtest/gtest.h>
-
 namespace fbf::testing {
 namespace {
 

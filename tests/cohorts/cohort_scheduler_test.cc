@@ -5,8 +5,6 @@
 #include "cohorts/cohort_scheduler.h"
 #include "cohorts_test_support.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf::testing {
 namespace {
 

@@ -4,7 +4,6 @@
 
 #include <signal.h>
 
-#include <chrono>
 #include <fstream>
 
 namespace fbf::testing {

@@ -3,8 +3,6 @@
 #include "e2e/daemon_home.h"
 #include "upload/upload_manager.h"
 
-#include <set>
-
 namespace fbf::testing {
 namespace {
 
@@ -97,16 +95,6 @@ TEST_F(HealthyReceiver, FlushSendsEverythingValidAndDropsTheRestWithDeletionEven
   EXPECT_TRUE(home.sessionFiles().empty()) << ::testing::PrintToString(home.sessionFiles());
   EXPECT_TRUE(home.customFiles().empty()) << ::testing::PrintToString(home.customFiles());
   EXPECT_EQ(lossesByReason(home.deletionEvents()), (std::map<int, int>{{kTooLarge, tooLarge}, {kEmpty, empty}}));
-}
-
-TEST_F(HealthyReceiver, LeftoverSessionFilesArePrunedToFifty) {
-  // Files still being processed by someone are never uploaded, so they pile up.
-  for (unsigned i = 0; i < 120; ++i) writeFile(home.cacheDir() / session(100 + i, "processing"), "p");
-  home.startDaemon();
-  flush();
-  EXPECT_EQ(home.sessionFiles().size(), 50u);
-  EXPECT_EQ(lossesByReason(home.deletionEvents()), (std::map<int, int>{{kPruned, 70}}));
-  EXPECT_TRUE(receiver->records().empty());
 }
 
 TEST_F(HealthyReceiver, FlushSessionIsRefusedOutsideTheCacheDirectory) {

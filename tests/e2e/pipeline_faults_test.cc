@@ -4,7 +4,6 @@
 // daemon that stops serving.
 #include "e2e/daemon_home.h"
 
-#include <gtest/gtest.h>
 #include <signal.h>
 
 #include <random>

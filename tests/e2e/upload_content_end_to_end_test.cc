@@ -5,12 +5,10 @@
 #include "e2e/daemon_home.h"
 #include "upload/upload_test_util.h"
 
-#include <gtest/gtest.h>
 #include <strings.h>
 
 #include <fstream>
 #include <regex>
-#include <set>
 
 namespace fbf::testing {
 namespace {

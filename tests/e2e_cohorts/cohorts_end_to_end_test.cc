@@ -9,10 +9,8 @@
 #include <glob.h>
 
 #include <google/protobuf/util/json_util.h>
-#include <gtest/gtest.h>
 
 #include <ctime>
-#include <set>
 
 namespace fbf::testing {
 namespace {

@@ -5,8 +5,6 @@
 // test runs where no user manager is available.
 #include "e2e/daemon_home.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf::testing {
 namespace {
 
