@@ -145,9 +145,15 @@ TEST_F(CohortEnvelopes, AMonthAlsoWritesLookbackUsageAndOnePropensityEnvelope) {
 }
 
 // A damaged store can hold counts no 32-bit total holds: that surface's
-// propensity is left out with an error line, the rest of the report stays.
+// propensity is left out with an error line, the rest of the report stays,
+// down to a surface engaged with once.
 TEST_F(CohortEnvelopes, AnEngagementTotalBeyond32BitsLeavesThatSurfaceOut) {
   addWayfinSession(localTime(2030, 3, 10, 12), {{VIRWayfinSession::goToSite, 1}});
+  on([&] {
+    auto s = store->eventFactory().createScoutlumeSession();
+    s->setTimestamp(localTime(2030, 3, 10, 12));
+    s->incrementCounter(VIRScoutlumeSession::appLaunch);
+  });
   setMarker(FlushFrequency::monthly, localTime(2030, 3, 1));
   save();
   ASSERT_TRUE(RawDatabase(databasePath()).exec("UPDATE VIRWayfinSession SET goToSite = 5000000000"));
@@ -157,6 +163,7 @@ TEST_F(CohortEnvelopes, AnEngagementTotalBeyond32BitsLeavesThatSurfaceOut) {
   ASSERT_EQ(persisted.back().whichKind_case(), CVCohortsFeedback::kPropensityEnvelope);
   EXPECT_FALSE(persisted.back().propensityenvelope().has_wayfinusagepropensity());
   EXPECT_TRUE(persisted.back().propensityenvelope().has_newsusagepropensity());
+  EXPECT_EQ(persisted.back().propensityenvelope().scoutlumeusagepropensity().totalengagements(), 1);
   EXPECT_TRUE(logs.contains("Total engagements of VIRWayfinSession do not fit a 32-bit integer"));
 }
 
