@@ -8,8 +8,6 @@
 #include <sys/stat.h>
 #include <unicode/locid.h>
 
-#include <gtest/gtest.h>
-
 namespace fbf::testing {
 namespace {
 
@@ -146,13 +144,27 @@ TEST_F(CohortEnvelopes, AMonthAlsoWritesLookbackUsageAndOnePropensityEnvelope) {
   EXPECT_EQ(marker(FlushFrequency::monthly), localTime(2030, 4, 1));
 }
 
-TEST_F(CohortEnvelopes, TheLookbackIs56DaysWithoutABagAndTheBagsValueOtherwise) {
-  EXPECT_EQ(makeGenerator()->cohortsLookbackInDays(), 56);
-  EXPECT_EQ(makeGenerator(ConfigurationBag(PropertyList{{"feedback_url", "https://x"}}))->cohortsLookbackInDays(), 56);
-  auto generator = makeGenerator(ConfigurationBag(PropertyList{{"cohorts_lookback_in_days", 28}}));
-  EXPECT_EQ(generator->cohortsLookbackInDays(), 28);
-  EXPECT_EQ(generator->dateRangeForLookbackPeriod(localTime(2030, 3, 15)),
-            (DateInterval{localTime(2030, 3, 4), localTime(2030, 4, 1)}));
+// A damaged store can hold counts no 32-bit total holds: that surface's
+// propensity is left out with an error line, the rest of the report stays,
+// down to a surface engaged with once.
+TEST_F(CohortEnvelopes, AnEngagementTotalBeyond32BitsLeavesThatSurfaceOut) {
+  addWayfinSession(localTime(2030, 3, 10, 12), {{VIRWayfinSession::goToSite, 1}});
+  on([&] {
+    auto s = store->eventFactory().createScoutlumeSession();
+    s->setTimestamp(localTime(2030, 3, 10, 12));
+    s->incrementCounter(VIRScoutlumeSession::appLaunch);
+  });
+  setMarker(FlushFrequency::monthly, localTime(2030, 3, 1));
+  save();
+  ASSERT_TRUE(RawDatabase(databasePath()).exec("UPDATE VIRWayfinSession SET goToSite = 5000000000"));
+  LogCapture logs;
+  makeGenerator()->aggregateNext(FlushFrequency::monthly);
+  ASSERT_FALSE(persisted.empty());
+  ASSERT_EQ(persisted.back().whichKind_case(), CVCohortsFeedback::kPropensityEnvelope);
+  EXPECT_FALSE(persisted.back().propensityenvelope().has_wayfinusagepropensity());
+  EXPECT_TRUE(persisted.back().propensityenvelope().has_newsusagepropensity());
+  EXPECT_EQ(persisted.back().propensityenvelope().scoutlumeusagepropensity().totalengagements(), 1);
+  EXPECT_TRUE(logs.contains("Total engagements of VIRWayfinSession do not fit a 32-bit integer"));
 }
 
 // Guards against: engagement counts rounded at the wrong edge, or a zero bucket dividing silently.

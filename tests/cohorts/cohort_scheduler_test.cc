@@ -5,8 +5,6 @@
 #include "cohorts/cohort_scheduler.h"
 #include "cohorts_test_support.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf::testing {
 namespace {
 
@@ -72,6 +70,7 @@ TEST_F(CohortSchedule, ADayIsNeverDueInItsFirstHourAndAlwaysADayLater) {
       {"12 hours later the coin weighs the age", localTime(2030, 6, 6, 12), 24, 40, 160},
       {"24 hours later", localTime(2030, 6, 7), 24, 200, 200},
       {"no maximum age", localTime(2030, 6, 6, 0, 0, 1), 0, 200, 200},
+      {"no maximum age, the period ends exactly today", localTime(2030, 6, 6), 0, 0, 0},
       {"a negative maximum age", localTime(2030, 6, 6, 0, 0, 1), -5, 200, 200},
   };
   for (const auto& row : rows) {

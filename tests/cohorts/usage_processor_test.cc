@@ -3,8 +3,6 @@
 #include "cohorts/usage_processor.h"
 #include "cohorts_test_support.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf::testing {
 namespace {
 

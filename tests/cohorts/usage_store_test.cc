@@ -4,8 +4,6 @@
 #include "cohorts/object_graph_storage_container.h"
 #include "cohorts_test_support.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf::testing {
 namespace {
 
@@ -133,43 +131,8 @@ PRAGMA user_version = 1;)sql"));
   EXPECT_EQ(raw.scalar("SELECT appLaunch FROM VIRScoutlumeSession"), "3");
 }
 
-// Guards against: fetches and purges that include or exclude a range's edge wrongly, come unsorted, mix clients, or remove categories.
+// Guards against: purges that include or exclude the date's edge wrongly, or remove categories.
 using StoreQueries = OpenStore;
-
-TEST_F(StoreQueries, SentinelsAreNewestFirstForTheirClientInTheHalfOpenRange) {
-  SystemTime start = utcTime(2030, 5, 1), end = utcTime(2030, 5, 2);
-  for (SystemTime t : {start - seconds(1), start + hours(12), start, end}) addSentinel(corevireon::CV_CLIENT_NEWS, t);
-  addSentinel(corevireon::CV_CLIENT_MESSAGING, start + hours(1));
-  save();
-  on([&] {
-    auto& q = store->queryProcessor();
-    std::vector<SystemTime> inRange, all;
-    for (const auto& e : q.sessionSentinels(corevireon::CV_CLIENT_NEWS, DateInterval{start, end})) {
-      inRange.push_back(*e->timestamp());
-    }
-    for (const auto& e : q.sessionSentinels(corevireon::CV_CLIENT_NEWS, std::nullopt)) all.push_back(*e->timestamp());
-    EXPECT_EQ(inRange, (std::vector<SystemTime>{start + hours(12), start}));
-    EXPECT_EQ(all, (std::vector<SystemTime>{end, start + hours(12), start, start - seconds(1)}));
-    EXPECT_EQ(q.sessionSentinels(corevireon::CV_CLIENT_MESSAGING, std::nullopt).size(), 1u);
-    EXPECT_TRUE(q.sessionSentinels(corevireon::CV_CLIENT_WEB_BROWSER, std::nullopt).empty());
-  });
-}
-
-TEST_F(StoreQueries, UsageSessionsAndColumnSumsCoverTheHalfOpenRange) {
-  SystemTime start = utcTime(2030, 6, 1), end = utcTime(2030, 7, 1);
-  for (SystemTime t : {start - seconds(1), start, end - seconds(1), end}) {
-    addWayfinSession(t, {{VIRWayfinSession::goToSite, 1}, {VIRWayfinSession::other, 2}});
-  }
-  save();
-  on([&] {
-    EXPECT_EQ(store->queryProcessor().usageSessions<VIRWayfinSession>(start, end).size(), 2u);
-    auto sums = store->queryProcessor().fetchColumnSums(VIRWayfinSession::kEntityName, start, end);
-    EXPECT_EQ(sums, (std::map<std::string, int64_t>{{"goToSite", 2}, {"localGoto", 0}, {"localTap", 0},
-                                                    {"other", 4}, {"thirdPartyCompletionOrRecentSearch", 0},
-                                                    {"thirdPartyGoto", 0}, {"thirdPartyTap", 0}, {"vireonGoto", 0},
-                                                    {"vireonTap", 0}}));
-  });
-}
 
 TEST_F(StoreQueries, APurgeRemovesRecordsAtOrBeforeTheDateButNoCategories) {
   SystemTime date = utcTime(2030, 3, 1);

@@ -4,7 +4,6 @@
 
 #include <signal.h>
 
-#include <chrono>
 #include <fstream>
 
 namespace fbf::testing {
@@ -17,7 +16,7 @@ const LoopbackCertificate& LoopbackCertificate::get() {
     LoopbackCertificate out;
     out.cert = dir.path() / "cert.pem";
     out.key = dir.path() / "key.pem";
-    std::string cmd = "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 2"
+    std::string cmd = "openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -days 30"
                       " -subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout '" +
                       out.key.string() + "' -out '" + out.cert.string() + "' >/dev/null 2>&1";
     out.made = std::system(cmd.c_str()) == 0 && fs::exists(out.cert) && fs::exists(out.key);
@@ -44,15 +43,7 @@ Receiver::Receiver(const fs::path& dir, int port, std::vector<std::string> extra
       10s);
 }
 
-std::vector<nlohmann::json> Receiver::records() const {
-  std::vector<nlohmann::json> out;
-  std::ifstream in(recordFile_);
-  for (std::string line; std::getline(in, line);) {
-    auto j = nlohmann::json::parse(line, nullptr, false);
-    if (!j.is_discarded()) out.push_back(std::move(j));
-  }
-  return out;
-}
+std::vector<nlohmann::json> Receiver::records() const { return jsonLines(recordFile_); }
 
 void Receiver::stop() {
   if (!process_) return;
@@ -134,10 +125,8 @@ RunResult DaemonHome::generate(int sessions, int custom, int seed, const std::st
 
 std::vector<nlohmann::json> DaemonHome::deletionEvents() const {
   std::vector<nlohmann::json> out;
-  std::ifstream in(dirs_.stateHome / "vireon-fbf" / "analytics.jsonl");
-  for (std::string line; std::getline(in, line);) {
-    auto j = nlohmann::json::parse(line, nullptr, false);
-    if (!j.is_discarded() && j.contains("payload") && j["payload"].contains("reason")) out.push_back(j["payload"]);
+  for (auto& j : jsonLines(dirs_.stateHome / "vireon-fbf" / "analytics.jsonl")) {
+    if (j.contains("payload") && j["payload"].contains("reason")) out.push_back(j["payload"]);
   }
   return out;
 }
@@ -179,6 +168,16 @@ size_t delivered(const std::vector<nlohmann::json>& records) {
   size_t n = 0;
   for (const auto& r : records) n += r.value("status", 0) == 200;
   return n;
+}
+
+std::vector<nlohmann::json> jsonLines(const fs::path& file) {
+  std::vector<nlohmann::json> out;
+  std::ifstream in(file);
+  for (std::string line; std::getline(in, line);) {
+    auto j = nlohmann::json::parse(line, nullptr, false);
+    if (!j.is_discarded()) out.push_back(std::move(j));
+  }
+  return out;
 }
 
 std::string tail(const std::string& text, size_t n) { return text.size() > n ? text.substr(text.size() - n) : text; }

@@ -16,7 +16,7 @@
 namespace fbf::testing {
 
 // A key and self-signed certificate for 127.0.0.1, made once per run with
-// the openssl command-line tool.
+// the openssl command-line tool; valid for days the faked clocks move ahead.
 struct LoopbackCertificate {
   static const LoopbackCertificate& get();
   fs::path cert;
@@ -97,6 +97,8 @@ int lossCount(const std::vector<nlohmann::json>& events);
 // Receiver records of requests answered with 200.
 size_t delivered(const std::vector<nlohmann::json>& records);
 std::string tail(const std::string& text, size_t n = 4000);
+// One JSON value per line of `file`; lines that do not parse are skipped.
+std::vector<nlohmann::json> jsonLines(const fs::path& file);
 
 // A home configured for a running receiver; each case writes its files and
 // starts the daemon.

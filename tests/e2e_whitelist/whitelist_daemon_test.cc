@@ -3,16 +3,12 @@
 // here; the stored signature is read from the preferences file and checked
 // with the tests' own signature reader. Few daemon launches, no sleeps: the
 // "soon" delay is set to zero and changes are polled for.
+#include "e2e/daemon_home.h"
 #include "platform/file_manager.h"
 #include "platform/user_defaults.h"
-#include "support/process.h"
-#include "support/test_support.h"
 #include "whitelist/signature_decoder.h"
 
 #include <fmt/format.h>
-#include <gtest/gtest.h>
-#include <nlohmann/json.hpp>
-#include <signal.h>
 #include <sys/stat.h>
 
 namespace fbf::testing {
@@ -48,38 +44,32 @@ std::string whitelistDocument(const std::map<std::string, uint64_t>& ids) {
 // shared data dir.
 class WhitelistDaemon : public ::testing::Test {
  protected:
-  WhitelistDaemon() : env(xdgEnvironment(home.path())), dirs(XdgDirectories::underRoot(home.path())) {
+  WhitelistDaemon() {
     fs::create_directories(userApps());
     fs::create_directories(sharedApps());
-    files = makePosixFileManager(dirs);
-    store = makePlistPreferencesStore(dirs.preferencesDir(), *files);
-    vireond = store->defaultsForDomain("vireond");
     vireond->setObject("FBFNoExit", true);
     vireond->setObject("VIRWhitelistSoonDelaySeconds", 0);
   }
 
   // A clean exit on SIGTERM, so that a sanitizer finding in the daemon fails the test.
   void TearDown() override {
-    if (!daemon || daemon->waitFor(0ms)) return;
-    daemon->signal(SIGTERM);
-    EXPECT_EQ(daemon->waitFor(20s), 0) << log();
+    if (home.daemon() && !home.daemon()->waitFor(0ms)) {
+      EXPECT_EQ(home.stopDaemon(), 0) << log();
+    }
   }
 
   fs::path userApps() const { return dirs.dataHome / "applications"; }
   fs::path sharedApps() const { return dirs.dataDirs.front() / "applications"; }
   fs::path userResource() const { return dirs.dataHome / "vireond" / "app-whitelist.json"; }
   fs::path sharedResource() const { return dirs.dataDirs.front() / "vireond" / "app-whitelist.json"; }
-  fs::path assistantList() const { return dirs.cacheHome / "vireond" / "assistant-apps.json"; }
-  std::string log() const { return readFile(home.path() / "daemon.err"); }
+  fs::path assistantList() const { return home.cacheDir() / "assistant-apps.json"; }
+  std::string log() const { return home.daemonLog(); }
   bool logged(const std::string& line) const { return log().find(line) != std::string::npos; }
-
   void startDaemon() {
-    daemon = std::make_unique<ChildProcess>(binDir() / "vireon-fbf", std::vector<std::string>{}, env,
-                                            home.path() / "daemon.out", home.path() / "daemon.err");
-    ASSERT_TRUE(waitUntil([&] { return fs::exists(dirs.socketPath()) && logged("setup"); }, 20s)) << log();
+    home.startDaemon();
+    ASSERT_TRUE(logged("setup")) << log();
   }
-
-  RunResult ctl(const std::vector<std::string>& args) { return runProgram(binDir() / "fbfctl", args, env); }
+  RunResult ctl(const std::vector<std::string>& args) { return home.fbfctl(args); }
 
   // What `fbfctl update-whitelists CONDITION` printed; fails the test on a non-zero exit.
   std::string update(const std::string& condition) {
@@ -98,13 +88,11 @@ class WhitelistDaemon : public ::testing::Test {
     return ::testing::AssertionFailure() << "stored: " << stored().value_or("(none)") << "\n" << log();
   }
 
-  TempDir home;
-  std::map<std::string, std::string> env;
-  XdgDirectories dirs;
-  std::shared_ptr<FileManager> files;
-  std::unique_ptr<PreferencesStore> store;
-  std::shared_ptr<UserDefaults> vireond;
-  std::unique_ptr<ChildProcess> daemon;
+  DaemonHome home;
+  XdgDirectories dirs = XdgDirectories::underRoot(home.root());
+  std::shared_ptr<FileManager> files = makePosixFileManager(dirs);
+  std::unique_ptr<PreferencesStore> store = makePlistPreferencesStore(dirs.preferencesDir(), *files);
+  std::shared_ptr<UserDefaults> vireond = store->defaultsForDomain("vireond");
 };
 
 // Guards against: wrong entries, resource or assistant list read, a condition ignored, a fresh list redone.
@@ -218,8 +206,8 @@ TEST_F(WhitelistDaemon, ApplicationAndPreferenceChangesRegenerateTheSignature) {
   EXPECT_TRUE(eventuallyStores({0, 3}));
   EXPECT_TRUE(logged("applications changed; whitelist update requested"));
 
-  writeFile(home.path() / "org.example.Notes.desktop.tmp", applicationEntry("Notes"));
-  fs::rename(home.path() / "org.example.Notes.desktop.tmp", userApps() / "org.example.Notes.desktop");
+  writeFile(home.root() / "org.example.Notes.desktop.tmp", applicationEntry("Notes"));
+  fs::rename(home.root() / "org.example.Notes.desktop.tmp", userApps() / "org.example.Notes.desktop");
   EXPECT_TRUE(eventuallyStores({0, 3, 17}));
 
   ASSERT_TRUE(store->defaultsForDomain("vireon.scoutlume")

@@ -11,12 +11,9 @@
 #include "processing/processing_builders.h"
 #include "support/test_support.h"
 
-#include <gtest/gtest.h>
-
 #include <algorithm>
 #include <cstdio>
 #include <deque>
-#include <set>
 
 namespace fbf::testing {
 namespace {

@@ -6,8 +6,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <set>
-
 using namespace std::chrono_literals;
 
 namespace fbf::testing {

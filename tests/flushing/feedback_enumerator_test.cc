@@ -1,7 +1,5 @@
 #include "flushing/flushing_test_util.h"
 
-#include <set>
-
 namespace fbf::testing {
 namespace {
 
@@ -89,18 +87,6 @@ TEST_F(FeedbackWalk, EachCallDrawsAmongTheDirectoriesStillOpen) {
   for (const auto& f : walk({"Usage", "UserReport"})) types.insert(f.typeString());
   EXPECT_EQ(types, (std::multiset<std::string>{"Usage", "Usage", "UserReport", "UserReport"}));
   EXPECT_TRUE(walk({"NotAType", "usage"}).empty());
-}
-
-TEST_F(FeedbackWalk, TheSystemDrawInterleavesDirectories) {
-  // Keeping one directory's 40 files together by chance has a probability of 2^-39.
-  for (unsigned i = 0; i < 40; ++i) {
-    session(S::closed, i);
-    makeFile(custom("Usage"), "r" + std::to_string(i));
-  }
-  std::string order = kinds(walk());
-  ASSERT_EQ(order.size(), 80u);
-  EXPECT_NE(order, std::string(40, 's') + std::string(40, 'c'));
-  EXPECT_NE(order, std::string(40, 'c') + std::string(40, 's'));
 }
 
 TEST_F(FeedbackWalk, FilesAndDirectoriesRemovedMidWalkAreNotYielded) {

@@ -5,9 +5,6 @@
 
 #include <gtest/gtest.h>
 
-#include <functional>
-#include <optional>
-
 namespace fbf {
 namespace {
 

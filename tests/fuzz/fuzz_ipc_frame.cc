@@ -14,7 +14,6 @@
 #include "ipc/frame_channel.h"
 #include "platform/logging.h"
 #include "support/test_support.h"
-#include "upload/device_context.h"
 
 #include <asio.hpp>
 #include <poll.h>
@@ -49,33 +48,17 @@ class Controller final : public fbf::InstalledAppControllerProtocol {
   }
 };
 
-class FixedDeviceContext final : public fbf::DeviceContextProtocol {
- public:
-  std::optional<std::string> localeIdentifier() const override { return "en_US"; }
-  std::optional<std::string> country() const override { return "US"; }
-  std::optional<std::string> deviceModel() const override { return "TestBox1,1"; }
-  std::optional<std::string> osVersion() const override { return "1.0"; }
-  std::string userAgent() const override { return "fuzz"; }
-};
-
 struct Fixture {
   Fixture() {
-    fbf::FBFAssemblyDependencies deps;
-    deps.preferences = env.preferences;
-    deps.fileManager = env.fileManager;
-    deps.clock = env.clock;
-    deps.analytics = env.analytics;
-    deps.transactions = env.transactions;
-    deps.deviceContext = std::make_shared<FixedDeviceContext>();
-    deps.installedAppControllerFactory = [](fbf::FBFAssembly&) { return std::make_unique<Controller>(); };
-    assembly = std::make_unique<fbf::FBFAssembly>(std::move(deps));
+    env.installedAppControllerFactory = [](fbf::FBFAssembly&) { return std::make_unique<Controller>(); };
+    assembly = &env.assembly();
     service = std::make_unique<fbf::FlusherService>(*assembly, std::make_shared<ImmediateRunner>());
     ioThread = std::thread([this] { io.run(); });
   }
   asio::io_context io;
   asio::executor_work_guard<asio::io_context::executor_type> guard{io.get_executor()};
   fbf::testing::TestEnvironment env{true};
-  std::unique_ptr<fbf::FBFAssembly> assembly;
+  fbf::FBFAssembly* assembly = nullptr;
   std::unique_ptr<fbf::FlusherService> service;
   std::thread ioThread;
 };

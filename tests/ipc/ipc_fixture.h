@@ -94,36 +94,20 @@ class FakeInstalledAppController final : public InstalledAppControllerProtocol {
   UserDefaults& defaults_;
 };
 
-class FixedDeviceContext final : public DeviceContextProtocol {
- public:
-  std::optional<std::string> localeIdentifier() const override { return "en_US"; }
-  std::optional<std::string> country() const override { return "US"; }
-  std::optional<std::string> deviceModel() const override { return "TestBox1,1"; }
-  std::optional<std::string> osVersion() const override { return "1.0"; }
-  std::string userAgent() const override { return "test"; }
-};
-
 class IpcFixture : public ::testing::Test {
  protected:
   // Whether the assembly has an installed-app controller.
   virtual bool withWhitelistController() const { return true; }
 
   void SetUp() override {
-    FBFAssemblyDependencies deps;
-    deps.preferences = env.preferences;
-    deps.fileManager = env.fileManager;
-    deps.clock = env.clock;
-    deps.analytics = env.analytics;
-    deps.transactions = env.transactions;
-    deps.deviceContext = std::make_shared<FixedDeviceContext>();
     if (withWhitelistController()) {
-      deps.installedAppControllerFactory = [this](FBFAssembly& a) {
+      env.installedAppControllerFactory = [this](FBFAssembly& a) {
         auto c = std::make_unique<FakeInstalledAppController>(a.userDefaults());
         controller = c.get();
         return c;
       };
     }
-    assembly = std::make_unique<FBFAssembly>(std::move(deps));
+    assembly = &env.assembly();
     runner = std::make_shared<FakeFlushRunner>();
     service = std::make_unique<FlusherService>(*assembly, runner);
     fs::create_directories(env.dirs.runtimeDir);
@@ -152,7 +136,7 @@ class IpcFixture : public ::testing::Test {
       io.restart();
       io.poll();
     }
-    assembly.reset();
+    env.assemblyPtr.reset();
   }
 
   // Runs `f` on the io thread and waits for it.
@@ -200,7 +184,7 @@ class IpcFixture : public ::testing::Test {
   asio::io_context io;
   asio::executor_work_guard<asio::io_context::executor_type> guard{io.get_executor()};
   TestEnvironment env{true};
-  std::unique_ptr<FBFAssembly> assembly;
+  FBFAssembly* assembly = nullptr;
   FakeInstalledAppController* controller = nullptr;
   std::shared_ptr<FakeFlushRunner> runner;
   std::unique_ptr<FlusherService> service;

@@ -10,10 +10,7 @@
 #include <google/protobuf/descriptor.h>
 #include <google/protobuf/descriptor.pb.h>
 
-#include <cstdlib>
 #include <fstream>
-#include <set>
-#include <string>
 
 #include "corevireon.pb.h"
 #include "fbf_ipc.pb.h"

@@ -2,8 +2,6 @@
 #include "flushing/url_matching.h"
 #include "processing/processing_builders.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf {
 namespace {
 

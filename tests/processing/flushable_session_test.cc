@@ -2,8 +2,6 @@
 #include "flushing/session_payload.h"
 #include "processing/processing_builders.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf {
 namespace {
 
@@ -114,26 +112,6 @@ TEST(MissingItemsFeedback, MissingSuggestionsThenMissingResultsLeadTheList) {
             R"(items { type: 30 sessionMissingResults { results { identifier: "1" type: 2 } } } )"
             R"(items { queryId: 1 type: 8 visibleResults { results { identifier: "1" type: 2 } } } )"
             R"(items { type: 20 suggestionEngagement { timestamp: 10 suggestion { identifier: "2" type: 1 } } })");
-}
-
-// Guards against: engagements counted for the wrong client, or usage members read from the processed session.
-TEST(LazyMembers, FollowTheClientAndTheUnprocessedSession) {
-  auto s = sessionWith({pb(R"(resultEngagement { triggerEvent: 8 result { identifier: "a" } })"),
-                        pb(R"(resultEngagement { triggerEvent: 1 result { identifier: "b" } })"), messageless(10),
-                        pb("didGoToSite { }"), pb(R"(startLocalSearch { input: "p" })"),
-                        pb(R"(visibleResults { results { identifier: "b" title: "first" } results { } })"),
-                        pb(R"(visibleResults { results { identifier: "b" title: "second" } })")});
-  s.set_agent("Scoutlume/17");
-  FlushableSession scoutlume(s);
-  ASSERT_EQ(scoutlume.engagements().size(), 1u);
-  EXPECT_EQ(scoutlume.engagements()[0].resultEngagement()->result().identifier(), "b");
-  s.set_agent("Wayfin/17");
-  EXPECT_EQ(FlushableSession(s).engagements().size(), 3u);
-  EXPECT_EQ(scoutlume.keystrokes().size(), 1u);
-  EXPECT_EQ(scoutlume.resultsById().size(), 2u);
-  EXPECT_EQ(scoutlume.resultsById().at("b").title(), "second");
-  scoutlume.postProcessFeedback(nullptr);
-  EXPECT_EQ(scoutlume.resultsById().count("a"), 1u) << "read before processing: the unprocessed identifiers";
 }
 
 // Guards against: fields unknown to this build reaching an upload or going uncounted, or a file without feedback uploaded.

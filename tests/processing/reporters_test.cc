@@ -1,8 +1,6 @@
 #include "flushing/reporters.h"
 #include "processing/processing_builders.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf {
 namespace {
 

@@ -2,8 +2,6 @@
 #include "flushing/session_json.h"
 #include "processing/processing_builders.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf {
 namespace {
 

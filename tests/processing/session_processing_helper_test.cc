@@ -2,8 +2,6 @@
 #include "flushing/session_processing_helper.h"
 #include "processing/processing_builders.h"
 
-#include <gtest/gtest.h>
-
 namespace fbf {
 namespace {
 
@@ -38,7 +36,6 @@ std::vector<CVFeedbackPayload> processRow(SessionProcessingHelper& helper, const
   processAll(helper, payloads);
   return payloads;
 }
-
 
 // Guards against: replacement numbers reused across keys, handed out twice for one key, or given to empty identifiers.
 TEST(IdentifierReplacement, OneNumberPerIdentifierAndTypeInOrderOfFirstAppearance) {
@@ -173,23 +170,6 @@ TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
   redact(typeOne);
   EXPECT_EQ(other.ShortDebugString(), R"(type: 2 title: "t")");
   EXPECT_EQ(typeOne.ShortDebugString(), pb<CVSearchResultForFeedback>("type: 1 " + fields).ShortDebugString());
-}
-
-// Guards against: the results a feedback contains being gathered from the wrong fields or in the wrong order.
-TEST(ContainedResults, FollowTheKindsOfFeedback) {
-  auto ids = [](const auto& results) {
-    std::string out;
-    for (const auto* r : results) out += r->identifier() + " ";
-    return out;
-  };
-  auto ranking = pb<corevireon::CVRankingFeedback>(R"(sections { results { result { identifier: "ranked" } }
-      section { results { items { identifier: "s1" } } } } sections { section { results { items { identifier: "s2" } } } })");
-  EXPECT_EQ(ids(RankingReporter::from(ranking)->containedResults()), "s1 s2 ");
-  EXPECT_FALSE(RankingReporter::from(corevireon::CVSectionRankingFeedback()));
-  EXPECT_EQ(ids(containedResults(pb<corevireon::CVResultRankingFeedback>(
-                R"(result { identifier: "main" } hiddenResults { identifier: "hidden" } duplicateResults { identifier: "dup" })"))),
-            "dup hidden main ");
-  EXPECT_EQ(ids(containedResults(corevireon::CVClearInputFeedback())), "");
 }
 
 }  // namespace

@@ -107,11 +107,6 @@ void ManualQueue::advance(std::chrono::steady_clock::duration d) {
   drain();
 }
 
-size_t ManualQueue::pending() const {
-  std::lock_guard l(m_);
-  return tasks_.size();
-}
-
 // ---- TempDir ----
 
 TempDir::TempDir() {
@@ -151,10 +146,9 @@ LogCapture::LogCapture() : sink_(std::make_shared<Sink>()) {
   logging::addSink(sink_);
 }
 LogCapture::~LogCapture() { logging::removeSink(sink_); }
-std::vector<std::string> LogCapture::lines() const { return sink_->lines(); }
 bool LogCapture::contains(const std::string& text) const { return count(text) > 0; }
 size_t LogCapture::count(const std::string& text) const {
-  auto l = lines();
+  auto l = sink_->lines();
   return std::count_if(l.begin(), l.end(), [&](const std::string& s) { return s.find(text) != std::string::npos; });
 }
 
@@ -239,6 +233,7 @@ FBFAssembly& TestEnvironment::assembly() {
     deps.deviceContext = std::make_shared<DeviceContext>(info, "vireon-fbf/test");
     deps.workloop = manualQueue;
     deps.httpSessionFactory = httpSessionFactory;
+    deps.installedAppControllerFactory = installedAppControllerFactory;
     assemblyPtr = std::make_unique<FBFAssembly>(std::move(deps));
   }
   return *assemblyPtr;

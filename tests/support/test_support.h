@@ -55,7 +55,6 @@ class ManualQueue final : public TaskQueue {
   size_t drain();
   // Moves the queue's time forward, queueing due timers, then drains.
   void advance(std::chrono::steady_clock::duration d);
-  size_t pending() const;
 
  private:
   friend class ManualTimer;
@@ -91,7 +90,6 @@ class LogCapture {
  public:
   LogCapture();
   ~LogCapture();
-  std::vector<std::string> lines() const;
   bool contains(const std::string& text) const;
   size_t count(const std::string& text) const;
 
@@ -130,6 +128,7 @@ struct TestEnvironment {
   std::shared_ptr<TransactionRegistry> transactions;
   std::shared_ptr<ManualQueue> manualQueue;  // null with a real work queue
   HttpSessionFactory httpSessionFactory;     // set before first use of assembly()
+  decltype(FBFAssemblyDependencies::installedAppControllerFactory) installedAppControllerFactory;  // likewise
   std::unique_ptr<FBFAssembly> assemblyPtr;
 
   fs::path cacheDir() const { return dirs.cacheHome / "vireond"; }

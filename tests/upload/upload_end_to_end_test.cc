@@ -7,8 +7,6 @@
 
 #include "corevireon.pb.h"
 
-#include <gtest/gtest.h>
-
 #include <condition_variable>
 
 namespace fbf {

@@ -41,30 +41,6 @@ TEST(RequestBuilderQuery, EndpointDefaultsAndForcedItemsMergeIntoOneSortedQuery)
   EXPECT_EQ(VireonURLRequestBuilder::encodeQueryItems(notText), "ok&z=2");
 }
 
-// Guards against: a default replacing what is already set, or a force that does not.
-TEST(RequestBuilderDefaultsAndForces, FollowTheirSemanticsForItemsAndHeaders) {
-  VireonURLRequestBuilder builder("http://h.example/p");
-  EXPECT_FALSE(builder.containsQueryItem("a"));
-  builder.defaultQueryItem({"a", "1"});
-  builder.defaultQueryItem({"a", "2"});
-  EXPECT_TRUE(builder.containsQueryItem("a"));
-  builder.forceQueryItemsFrom(std::vector<QueryItem>{{"b", "1"}, {"a", "3"}});
-  builder.forceQueryItemsFrom(std::nullopt);
-  EXPECT_EQ(builder.createUrlRequest().url, "http://h.example/p?a=3&b=1");
-
-  builder.defaultHttpHeader("User-Agent", "one");
-  builder.defaultHttpHeader("User-Agent", "two");
-  EXPECT_TRUE(builder.containsHttpHeader("User-Agent", "one"));
-  EXPECT_FALSE(builder.containsHttpHeader("User-Agent", "two"));
-  builder.forceHttpHeader("User-Agent", "three");
-  EXPECT_TRUE(builder.containsHttpHeader("User-Agent", "three"));
-  EXPECT_FALSE(builder.containsHttpHeader("Accept"));
-  auto request = builder.createUrlRequest();
-  EXPECT_EQ(request.header("user-agent"), "three");
-  EXPECT_EQ(request.timeout, std::chrono::seconds(60));
-  EXPECT_FALSE(request.ignoreLocalCache);
-}
-
 // Guards against: a request built for a non-http(s) or unparseable endpoint.
 TEST(RequestBuilderOnABadEndpoint, LogsAndThrowsOrStops) {
   for (const char* url : {"ftp://h.example/p", "h.example/p", "/a/path", "HTTPS://h.example/p"}) {
@@ -74,6 +50,11 @@ TEST(RequestBuilderOnABadEndpoint, LogsAndThrowsOrStops) {
     EXPECT_TRUE(logs.contains("Scheme for url is neither http nor https.")) << url;
   }
   EXPECT_FALSE(URLComponents::parse("http://[::1"));
+  // Digits, "+", "-" and "." may follow the scheme's first letter.
+  auto other = URLComponents::parse("web+x-1.2://h.example/p");
+  ASSERT_TRUE(other);
+  EXPECT_EQ(other->scheme, "web+x-1.2");
+  EXPECT_EQ(other->authority, "h.example");
   GTEST_FLAG_SET(death_test_style, "threadsafe");
   EXPECT_DEATH(VireonURLRequestBuilder("https://h.example/a b"), "cannot be parsed");
 }

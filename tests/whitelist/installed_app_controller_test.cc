@@ -95,7 +95,6 @@ TEST_F(WhitelistUpdates, EachConditionWaitsItsDelay) {
       {"unknown", 7, std::nullopt, 5ms, "update whitelists for reasons unknown"},
       {"now ignores the preference", kNow, 2, 5ms, "update whitelists now"},
       {"soon", kSoon, std::nullopt, 60s, "update whitelists soon"},
-      {"soon, preference 2 s", kSoon, 2, 2s, "update whitelists soon"},
       {"soon, preference 0", kSoon, 0, 0ms, "update whitelists soon"},
       {"soon, preference at the limit", kSoon, 86400, 86400s, "update whitelists soon"},
       {"soon, preference past the limit", kSoon, 86401, 60s, "update whitelists soon"},

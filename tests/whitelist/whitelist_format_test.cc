@@ -47,7 +47,7 @@ TEST(VersionWord, LastFourCharactersAsHexWithTheCompressionBit) {
     uint16_t word;
     size_t complaints;
   };
-  const Row rows[] = {{false, "0a1F", 0x0A1F, 0}, {false, "12345", 0x2345, 0}, {false, "ab", 0x2B00, 1},
+  const Row rows[] = {{false, "0a1F", 0x0A1F, 0}, {false, "09af", 0x09AF, 0}, {false, "12345", 0x2345, 0}, {false, "ab", 0x2B00, 1},
                       {false, "", 0x0000, 1},     {false, "00g0", 0x0670, 1},  {true, "0a1F", 0x8A1F, 0},
                       {true, "ab", 0xAB00, 1}};
   for (const auto& row : rows) {
