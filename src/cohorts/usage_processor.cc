@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <map>
+#include <set>
 #include <string>
 #include <variant>
 
@@ -128,46 +129,88 @@ bool UsageProcessor::session(bool withSearches, bool engagements, CVClient count
   return withSearches && countsAsUsageFor != corevireon::CV_CLIENT_NONE;
 }
 
-void UsageProcessor::reportUsageEvents(const corevireon::CVClientSession& session) {
-  auto& context = persistentStore_.managedObjectContext();
-  context.performAndWait([&] {
-    process(session);
-    context.reset();
-  });
-}
-
-void UsageProcessor::process(const corevireon::CVClientSession& session) {
-  auto& context = persistentStore_.managedObjectContext();
+std::optional<UsageProcessor::SessionUsage> UsageProcessor::usageOf(const corevireon::CVClientSession& session) {
   CVClient client = cohortsClient(session);
-  if (client != corevireon::CV_CLIENT_NONE) {
-    bool searches = false;
-    std::vector<EngagementReporter> engagements;
-    if (session.has_feedbacks()) {
+  if (client == corevireon::CV_CLIENT_NONE || !session.has_feedbacks()) return std::nullopt;
+  bool searches = false;
+  std::vector<EngagementReporter> engagements;
+  for (const auto& p : session.feedbacks().items()) {
+    const google::protobuf::Message* message = codableMessage(p);
+    if (message == nullptr) continue;
+    if (!searches) {
+      auto keystroke = KeystrokeReporter::from(*message);
+      searches = keystroke && keystroke->isKeystroke();
+    }
+    auto engagement = EngagementReporter::from(*message);
+    if (engagement && engagement->isEngagement(client)) engagements.push_back(std::move(*engagement));
+  }
+  if (!UsageProcessor::session(searches, !engagements.empty(), client)) return std::nullopt;
+
+  SessionUsage usage{client, sessionFingerprint(session), session.sessionstart(), {}};
+  switch (client) {
+    case corevireon::CV_CLIENT_WEB_BROWSER:
+      for (const auto& e : engagements) usage.counters.push_back(wayfinCounter(e));
+      break;
+    case corevireon::CV_CLIENT_SYSTEM_SEARCH_UI:
+      for (const auto& e : engagements) usage.counters.push_back(scoutlumeCounter(e));
+      break;
+    case corevireon::CV_CLIENT_MESSAGING: {
+      std::map<std::string, const CVSearchResultForFeedback*> resultsById;
+      // A later result with the same identifier wins.
       for (const auto& p : session.feedbacks().items()) {
         const google::protobuf::Message* message = codableMessage(p);
         if (message == nullptr) continue;
-        if (!searches) {
-          auto keystroke = KeystrokeReporter::from(*message);
-          searches = keystroke && keystroke->isKeystroke();
+        for (const auto* r : containedResults(*message)) {
+          if (r->has_identifier()) resultsById[r->identifier()] = r;
         }
-        auto engagement = EngagementReporter::from(*message);
-        if (engagement && engagement->isEngagement(client)) engagements.push_back(std::move(*engagement));
       }
+      for (const auto& e : engagements) usage.counters.push_back(imagesCounter(e, resultsById));
+      break;
     }
-    if (UsageProcessor::session(searches, !engagements.empty(), client)) {
-      int64_t fingerprint = sessionFingerprint(session);
-      if (alreadyCounted(fingerprint)) {
-        logging::get("UsageProcessor").debug("The usage of this session was counted before; not counted again");
-      } else {
-        stageSessionSentinel(session, client);
-        stageSessionPropensity(session, client, engagements);
-        // Saved in the same transaction as the records just staged.
-        context.stageStatement("INSERT OR IGNORE INTO VIRCountedSession (fingerprint, timestamp) VALUES (?, ?)",
-                               {SqlValue{fingerprint}, SqlValue{session.sessionstart()}});
-      }
+    default:
+      // News and anything else: a sentinel only.
+      break;
+  }
+  return usage;
+}
+
+UsageProcessor::~UsageProcessor() {
+  // Whatever was reported is written before the store can go away.
+  persistentStore_.managedObjectContext().performAndWait([] {});
+}
+
+void UsageProcessor::reportUsageEvents(const corevireon::CVClientSession& session) {
+  auto usage = usageOf(session);
+  if (!usage) return;
+  std::lock_guard lock(mutex_);
+  pending_.push_back(std::move(*usage));
+  if (drainScheduled_) return;
+  drainScheduled_ = true;
+  persistentStore_.managedObjectContext().perform([this] { drain(); });
+}
+
+void UsageProcessor::drain() {
+  std::vector<SessionUsage> batch;
+  {
+    std::lock_guard lock(mutex_);
+    batch.swap(pending_);
+    drainScheduled_ = false;
+  }
+  auto& context = persistentStore_.managedObjectContext();
+  std::set<int64_t> staged;
+  for (const auto& usage : batch) {
+    if (staged.count(usage.fingerprint) != 0 || alreadyCounted(usage.fingerprint)) {
+      logging::get("UsageProcessor").debug("The usage of this session was counted before; not counted again");
+      continue;
     }
+    staged.insert(usage.fingerprint);
+    stage(usage);
+    // Saved in the same transaction as the records just staged.
+    context.stageStatement("INSERT OR IGNORE INTO VIRCountedSession (fingerprint, timestamp) VALUES (?, ?)",
+                           {SqlValue{usage.fingerprint}, SqlValue{usage.sessionStart}});
   }
   saveOrLogError(context);
+  context.reset();
 }
 
 bool UsageProcessor::alreadyCounted(int64_t fingerprint) {
@@ -184,52 +227,30 @@ bool UsageProcessor::alreadyCounted(int64_t fingerprint) {
   return found;
 }
 
-void UsageProcessor::stageSessionSentinel(const corevireon::CVClientSession& session, CVClient client) {
-  auto event = persistentStore_.eventFactory().createUsageEvent();
-  if (!event) return;
-  event->setTimestamp(timeFromSeconds(session.sessionstart()));
-  if (auto category = event->usageCategory()) category->setClientIntVal(client);
-}
-
-void UsageProcessor::stageSessionPropensity(const corevireon::CVClientSession& session, CVClient client,
-                                            const std::vector<EngagementReporter>& engagements) {
+void UsageProcessor::stage(const SessionUsage& usage) {
   auto& factory = persistentStore_.eventFactory();
-  SystemTime start = timeFromSeconds(session.sessionstart());
-  switch (client) {
-    case corevireon::CV_CLIENT_WEB_BROWSER: {
-      auto record = factory.createWayfinSession();
-      if (!record) return;
-      record->setTimestamp(start);
-      for (const auto& e : engagements) record->incrementCounter(wayfinCounter(e));
-      break;
-    }
-    case corevireon::CV_CLIENT_SYSTEM_SEARCH_UI: {
-      auto record = factory.createScoutlumeSession();
-      if (!record) return;
-      record->setTimestamp(start);
-      for (const auto& e : engagements) record->incrementCounter(scoutlumeCounter(e));
-      break;
-    }
-    case corevireon::CV_CLIENT_MESSAGING: {
-      auto record = factory.createEntity<VIRImagesSession>();
-      if (!record) return;
-      record->setTimestamp(start);
-      std::map<std::string, const CVSearchResultForFeedback*> resultsById;
-      // A later result with the same identifier wins.
-      for (const auto& p : session.feedbacks().items()) {
-        const google::protobuf::Message* message = codableMessage(p);
-        if (message == nullptr) continue;
-        for (const auto* r : containedResults(*message)) {
-          if (r->has_identifier()) resultsById[r->identifier()] = r;
-        }
-      }
-      for (const auto& e : engagements) record->incrementCounter(imagesCounter(e, resultsById));
-      break;
-    }
-    default:
-      // News and anything else: a sentinel only.
-      break;
+  const SystemTime start = timeFromSeconds(usage.sessionStart);
+  if (auto event = factory.createUsageEvent()) {
+    event->setTimestamp(start);
+    if (auto category = event->usageCategory()) category->setClientIntVal(usage.client);
   }
+  std::shared_ptr<PropensitySession> record;
+  switch (usage.client) {
+    case corevireon::CV_CLIENT_WEB_BROWSER:
+      record = factory.createWayfinSession();
+      break;
+    case corevireon::CV_CLIENT_SYSTEM_SEARCH_UI:
+      record = factory.createScoutlumeSession();
+      break;
+    case corevireon::CV_CLIENT_MESSAGING:
+      record = factory.createEntity<VIRImagesSession>();
+      break;
+    default:
+      return;
+  }
+  if (!record) return;
+  record->setTimestamp(start);
+  for (size_t counter : usage.counters) record->incrementCounter(counter);
 }
 
 }  // namespace fbf

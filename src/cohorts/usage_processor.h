@@ -68,9 +68,12 @@
 // A counter that would pass 32767 stops the process (a session cannot hold
 // that many engagements of one kind unless its file is corrupt).
 //
-// Thread-safety: `reportUsageEvents` may be called from any queue; it runs
-// its work synchronously on the store's context queue. Holds the store
-// without owning it.
+// Thread-safety: `reportUsageEvents` may be called from any queue; the
+// writes run on the store's context queue, after the call returns, so a read
+// through that queue sees them. A crash between the report and the write
+// loses that session's count only if its upload also finished in that
+// moment; otherwise the session is processed, and counted, again. Holds the
+// store without owning it.
 #pragma once
 
 #include "cohorts/usage_store.h"
@@ -78,6 +81,8 @@
 #include "flushing/flushable_session.h"
 #include "flushing/reporters.h"
 
+#include <mutex>
+#include <optional>
 #include <vector>
 
 namespace fbf {
@@ -108,9 +113,15 @@ using UsageProcessorProtocol = UsageEventSink;
 class UsageProcessor final : public UsageProcessorProtocol {
  public:
   explicit UsageProcessor(DataStorageContainerProtocol& persistentStore) : persistentStore_(persistentStore) {}
+  // Waits until everything reported is written.
+  ~UsageProcessor() override;
+  UsageProcessor(const UsageProcessor&) = delete;
+  UsageProcessor& operator=(const UsageProcessor&) = delete;
 
-  // Stages the session's usage, saves the context (whether or not anything
-  // was staged) and then resets it, so no staged record stays in memory.
+  // Works out what the session counts for on the caller's thread, then
+  // hands that to the store's queue, which writes the sessions reported
+  // since its last write in one transaction and resets the context, so no
+  // staged record stays in memory.
   void reportUsageEvents(const corevireon::CVClientSession& session) override;
 
   // The usage rule on flags.
@@ -118,13 +129,25 @@ class UsageProcessor final : public UsageProcessorProtocol {
   static int64_t sessionFingerprint(const corevireon::CVClientSession& session);
 
  private:
+  // What one session adds to the store: a sentinel for `client` and, for
+  // the surfaces with a counter record, one counter index per engagement.
+  struct SessionUsage {
+    corevireon::CVClient client;
+    int64_t fingerprint;
+    double sessionStart;
+    std::vector<size_t> counters;
+  };
+  // None when the session does not count as usage.
+  static std::optional<SessionUsage> usageOf(const corevireon::CVClientSession& session);
+  // On the store's queue.
+  void drain();
   bool alreadyCounted(int64_t fingerprint);
-  void process(const corevireon::CVClientSession& session);
-  void stageSessionSentinel(const corevireon::CVClientSession& session, corevireon::CVClient client);
-  void stageSessionPropensity(const corevireon::CVClientSession& session, corevireon::CVClient client,
-                              const std::vector<EngagementReporter>& engagements);
+  void stage(const SessionUsage& usage);
 
   DataStorageContainerProtocol& persistentStore_;
+  std::mutex mutex_;
+  std::vector<SessionUsage> pending_;  // guarded by mutex_
+  bool drainScheduled_ = false;        // guarded by mutex_
 };
 
 }  // namespace fbf

@@ -213,6 +213,7 @@ TEST_F(CohortEnvelopes, TheCohortFlushAggregatesDueDaysIntoFilesAndPurgesOnlyWha
   auto session = makeSession("Messages", localTime(2030, 6, 1, 8));
   addResultEngagement(session, ResultFields{});
   flush.usageEventSink()->reportUsageEvents(session);
+  onStore(usage.store(), [] {});  // the write, on the store's queue
   EXPECT_EQ(rows("VIRImagesSession"), 1);
   flush.resetRowCache();
 }
