@@ -4,6 +4,7 @@
 #include "platform/logging.h"
 
 #include <curl/curl.h>
+#include <dlfcn.h>
 #include <fcntl.h>
 #include <strings.h>
 #include <sys/stat.h>
@@ -14,9 +15,85 @@
 #include <unordered_map>
 #include <mutex>
 #include <thread>
+#include <type_traits>
 #include <vector>
 
 namespace fbf {
+namespace {
+
+// libcurl and the thirty or so libraries it pulls in are loaded the first
+// time an upload session is made, not at exec: linked in, they double the
+// time from launch to a listening socket, and many launches (socket
+// activation for a status query, a timer that finds nothing to send) never
+// upload. The names are the library's own, without the "curl_" prefix.
+struct CurlApi {
+  decltype(&::curl_global_init) global_init;
+  decltype(&::curl_easy_init) easy_init;
+  decltype(&::curl_easy_cleanup) easy_cleanup;
+  decltype(&::curl_easy_reset) easy_reset;
+  decltype(&::curl_easy_setopt) easy_setopt;
+  decltype(&::curl_easy_getinfo) easy_getinfo;
+  decltype(&::curl_easy_strerror) easy_strerror;
+  decltype(&::curl_slist_append) slist_append;
+  decltype(&::curl_slist_free_all) slist_free_all;
+  decltype(&::curl_multi_init) multi_init;
+  decltype(&::curl_multi_cleanup) multi_cleanup;
+  decltype(&::curl_multi_setopt) multi_setopt;
+  decltype(&::curl_multi_add_handle) multi_add_handle;
+  decltype(&::curl_multi_remove_handle) multi_remove_handle;
+  decltype(&::curl_multi_perform) multi_perform;
+  decltype(&::curl_multi_poll) multi_poll;
+  decltype(&::curl_multi_wakeup) multi_wakeup;
+  decltype(&::curl_multi_info_read) multi_info_read;
+};
+
+// Null, with the reason in `why`, when libcurl cannot be loaded.
+const CurlApi* loadCurl(std::string* why = nullptr) {
+  static std::string failure;
+  static const CurlApi* api = [] () -> const CurlApi* {
+    // The soname of the libcurl the headers came from.
+    void* handle = dlopen("libcurl.so.4", RTLD_NOW | RTLD_LOCAL);
+    if (handle == nullptr) {
+      const char* error = dlerror();
+      failure = error != nullptr ? error : "dlopen failed";
+      return nullptr;
+    }
+    static CurlApi loaded;
+    bool complete = true;
+    auto bind = [&](auto& slot, const char* name) {
+      slot = reinterpret_cast<std::remove_reference_t<decltype(slot)>>(dlsym(handle, name));
+      if (slot == nullptr && complete) {
+        complete = false;
+        failure = std::string("libcurl lacks ") + name;
+      }
+    };
+    bind(loaded.global_init, "curl_global_init");
+    bind(loaded.easy_init, "curl_easy_init");
+    bind(loaded.easy_cleanup, "curl_easy_cleanup");
+    bind(loaded.easy_reset, "curl_easy_reset");
+    bind(loaded.easy_setopt, "curl_easy_setopt");
+    bind(loaded.easy_getinfo, "curl_easy_getinfo");
+    bind(loaded.easy_strerror, "curl_easy_strerror");
+    bind(loaded.slist_append, "curl_slist_append");
+    bind(loaded.slist_free_all, "curl_slist_free_all");
+    bind(loaded.multi_init, "curl_multi_init");
+    bind(loaded.multi_cleanup, "curl_multi_cleanup");
+    bind(loaded.multi_setopt, "curl_multi_setopt");
+    bind(loaded.multi_add_handle, "curl_multi_add_handle");
+    bind(loaded.multi_remove_handle, "curl_multi_remove_handle");
+    bind(loaded.multi_perform, "curl_multi_perform");
+    bind(loaded.multi_poll, "curl_multi_poll");
+    bind(loaded.multi_wakeup, "curl_multi_wakeup");
+    bind(loaded.multi_info_read, "curl_multi_info_read");
+    if (!complete) return nullptr;
+    loaded.global_init(CURL_GLOBAL_DEFAULT);
+    return &loaded;
+  }();
+  if (api == nullptr && why != nullptr) *why = failure;
+  return api;
+}
+
+}  // namespace
 
 HttpError httpErrorFromCurl(int curlCode, long osErrno, const std::string& detail) {
   HttpError e;
@@ -67,7 +144,8 @@ HttpError httpErrorFromCurl(int curlCode, long osErrno, const std::string& detai
       e = {HttpErrorDomain::other, HttpErrorCode::other, {}};
       break;
   }
-  e.description = curl_easy_strerror(code);
+  const CurlApi* curl = loadCurl();
+  e.description = curl != nullptr ? curl->easy_strerror(code) : "libcurl error " + std::to_string(curlCode);
   if (!detail.empty()) e.description += ": " + detail;
   return e;
 }
@@ -75,11 +153,6 @@ HttpError httpErrorFromCurl(int curlCode, long osErrno, const std::string& detai
 namespace {
 
 spdlog::logger& log() { return logging::get("HttpSession"); }
-
-void globalInitOnce() {
-  static std::once_flag once;
-  std::call_once(once, [] { curl_global_init(CURL_GLOBAL_DEFAULT); });
-}
 
 struct Transfer {
   CURL* easy = nullptr;
@@ -97,8 +170,9 @@ struct Transfer {
   char errorBuffer[CURL_ERROR_SIZE] = {};
 
   ~Transfer() {
-    if (easy) curl_easy_cleanup(easy);
-    if (headers) curl_slist_free_all(headers);
+    // Only sessions make transfers, and a session exists only once libcurl is loaded.
+    if (easy) loadCurl()->easy_cleanup(easy);
+    if (headers) loadCurl()->slist_free_all(headers);
   }
 };
 
@@ -165,12 +239,11 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
   // and buffers); more than this are freed.
   static constexpr size_t kSpareHandles = 32;
 
-  explicit CurlHttpSession(HttpSessionConfiguration config) : config_(std::move(config)) {
+  CurlHttpSession(const CurlApi& curl, HttpSessionConfiguration config) : curl_(curl), config_(std::move(config)) {
     if (!config_.delegateQueue) throw std::invalid_argument("an HTTP session needs a delegate queue");
-    globalInitOnce();
-    multi_ = curl_multi_init();
-    curl_multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, static_cast<long>(std::max(1, config_.maxConnectionsPerHost)));
-    curl_multi_setopt(multi_, CURLMOPT_PIPELINING, static_cast<long>(CURLPIPE_MULTIPLEX));
+    multi_ = curl_.multi_init();
+    curl_.multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, static_cast<long>(std::max(1, config_.maxConnectionsPerHost)));
+    curl_.multi_setopt(multi_, CURLMOPT_PIPELINING, static_cast<long>(CURLPIPE_MULTIPLEX));
     thread_ = std::thread([this] { run(); });
   }
 
@@ -179,7 +252,7 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
       std::lock_guard lock(mutex_);
       stop_ = true;
     }
-    curl_multi_wakeup(multi_);
+    curl_.multi_wakeup(multi_);
     if (thread_.joinable()) {
       if (thread_.get_id() == std::this_thread::get_id()) {
         thread_.detach();
@@ -187,10 +260,10 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
         thread_.join();
       }
     }
-    for (auto& [easy, t] : active_) curl_multi_remove_handle(multi_, easy);
+    for (auto& [easy, t] : active_) curl_.multi_remove_handle(multi_, easy);
     active_.clear();
     spare_.clear();
-    curl_multi_cleanup(multi_);
+    curl_.multi_cleanup(multi_);
   }
 
   void uploadFile(HttpRequest request, std::filesystem::path body, HttpCompletion completion) override {
@@ -218,7 +291,7 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
       std::lock_guard lock(mutex_);
       incoming_.push_back(std::move(t));
     }
-    curl_multi_wakeup(multi_);
+    curl_.multi_wakeup(multi_);
   }
 
   void finishTasksAndInvalidate() override {
@@ -228,7 +301,7 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
       invalidating_ = true;
       keepAlive_ = shared_from_this();
     }
-    curl_multi_wakeup(multi_);
+    curl_.multi_wakeup(multi_);
   }
 
   void cancelAllTasks() override {
@@ -236,7 +309,7 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
       std::lock_guard lock(mutex_);
       cancelling_ = true;
     }
-    curl_multi_wakeup(multi_);
+    curl_.multi_wakeup(multi_);
   }
 
  private:
@@ -248,17 +321,17 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
 
   // The session's thread only.
   CURL* takeHandle() {
-    if (spare_.empty()) return curl_easy_init();
+    if (spare_.empty()) return curl_.easy_init();
     CURL* e = spare_.back().release();
     spare_.pop_back();
-    curl_easy_reset(e);
+    curl_.easy_reset(e);
     return e;
   }
 
   void recycle(Transfer& t) {
     if (!t.easy) return;
     if (spare_.size() < kSpareHandles) spare_.emplace_back(t.easy);
-    else curl_easy_cleanup(t.easy);
+    else curl_.easy_cleanup(t.easy);
     t.easy = nullptr;
   }
 
@@ -266,56 +339,56 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     t.easy = takeHandle();
     if (!t.easy) return false;
     CURL* e = t.easy;
-    curl_easy_setopt(e, CURLOPT_URL, t.request.url.c_str());
-    curl_easy_setopt(e, CURLOPT_PROTOCOLS_STR, "http,https");
-    curl_easy_setopt(e, CURLOPT_NOSIGNAL, 1L);
-    curl_easy_setopt(e, CURLOPT_PRIVATE, &t);
-    curl_easy_setopt(e, CURLOPT_ERRORBUFFER, t.errorBuffer);
-    curl_easy_setopt(e, CURLOPT_FOLLOWLOCATION, 0L);
+    curl_.easy_setopt(e, CURLOPT_URL, t.request.url.c_str());
+    curl_.easy_setopt(e, CURLOPT_PROTOCOLS_STR, "http,https");
+    curl_.easy_setopt(e, CURLOPT_NOSIGNAL, 1L);
+    curl_.easy_setopt(e, CURLOPT_PRIVATE, &t);
+    curl_.easy_setopt(e, CURLOPT_ERRORBUFFER, t.errorBuffer);
+    curl_.easy_setopt(e, CURLOPT_FOLLOWLOCATION, 0L);
     // HTTP/2 where the server offers it (as streams of one connection);
     // transfers wait for that connection rather than opening more.
-    curl_easy_setopt(e, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
-    curl_easy_setopt(e, CURLOPT_PIPEWAIT, 1L);
+    curl_.easy_setopt(e, CURLOPT_HTTP_VERSION, static_cast<long>(CURL_HTTP_VERSION_2TLS));
+    curl_.easy_setopt(e, CURLOPT_PIPEWAIT, 1L);
 
-    curl_easy_setopt(e, CURLOPT_READFUNCTION, readBody);
-    curl_easy_setopt(e, CURLOPT_READDATA, &t);
-    curl_easy_setopt(e, CURLOPT_SEEKFUNCTION, seekBody);
-    curl_easy_setopt(e, CURLOPT_SEEKDATA, &t);
+    curl_.easy_setopt(e, CURLOPT_READFUNCTION, readBody);
+    curl_.easy_setopt(e, CURLOPT_READDATA, &t);
+    curl_.easy_setopt(e, CURLOPT_SEEKFUNCTION, seekBody);
+    curl_.easy_setopt(e, CURLOPT_SEEKDATA, &t);
     if (t.request.method == "PUT") {
-      curl_easy_setopt(e, CURLOPT_UPLOAD, 1L);
-      curl_easy_setopt(e, CURLOPT_INFILESIZE_LARGE, static_cast<curl_off_t>(t.bodySize));
+      curl_.easy_setopt(e, CURLOPT_UPLOAD, 1L);
+      curl_.easy_setopt(e, CURLOPT_INFILESIZE_LARGE, static_cast<curl_off_t>(t.bodySize));
     } else {
-      curl_easy_setopt(e, CURLOPT_POST, 1L);
-      curl_easy_setopt(e, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(t.bodySize));
-      if (t.request.method != "POST") curl_easy_setopt(e, CURLOPT_CUSTOMREQUEST, t.request.method.c_str());
+      curl_.easy_setopt(e, CURLOPT_POST, 1L);
+      curl_.easy_setopt(e, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(t.bodySize));
+      if (t.request.method != "POST") curl_.easy_setopt(e, CURLOPT_CUSTOMREQUEST, t.request.method.c_str());
     }
-    curl_easy_setopt(e, CURLOPT_WRITEFUNCTION, discardBody);
-    curl_easy_setopt(e, CURLOPT_HEADERFUNCTION, collectHeader);
-    curl_easy_setopt(e, CURLOPT_HEADERDATA, &t);
+    curl_.easy_setopt(e, CURLOPT_WRITEFUNCTION, discardBody);
+    curl_.easy_setopt(e, CURLOPT_HEADERFUNCTION, collectHeader);
+    curl_.easy_setopt(e, CURLOPT_HEADERDATA, &t);
 
     bool hasContentType = false;
     for (const auto& [name, value] : t.request.headers) {
       if (strcasecmp(name.c_str(), "Content-Type") == 0) hasContentType = true;
-      t.headers = curl_slist_append(t.headers, (name + ": " + value).c_str());
+      t.headers = curl_.slist_append(t.headers, (name + ": " + value).c_str());
     }
     // The body is sent at once, and a request without a Content-Type must go
     // without one (libcurl would otherwise add a form type to every POST).
-    t.headers = curl_slist_append(t.headers, "Expect:");
-    if (!hasContentType) t.headers = curl_slist_append(t.headers, "Content-Type:");
-    curl_easy_setopt(e, CURLOPT_HTTPHEADER, t.headers);
+    t.headers = curl_.slist_append(t.headers, "Expect:");
+    if (!hasContentType) t.headers = curl_.slist_append(t.headers, "Content-Type:");
+    curl_.easy_setopt(e, CURLOPT_HTTPHEADER, t.headers);
 
-    curl_easy_setopt(e, CURLOPT_SSL_VERIFYPEER, 1L);
-    curl_easy_setopt(e, CURLOPT_SSL_VERIFYHOST, 2L);
-    if (config_.pinnedPublicKeys) curl_easy_setopt(e, CURLOPT_PINNEDPUBLICKEY, config_.pinnedPublicKeys->c_str());
+    curl_.easy_setopt(e, CURLOPT_SSL_VERIFYPEER, 1L);
+    curl_.easy_setopt(e, CURLOPT_SSL_VERIFYHOST, 2L);
+    if (config_.pinnedPublicKeys) curl_.easy_setopt(e, CURLOPT_PINNEDPUBLICKEY, config_.pinnedPublicKeys->c_str());
     if (config_.caFile) {
-      curl_easy_setopt(e, CURLOPT_CAINFO, config_.caFile->c_str());
-      curl_easy_setopt(e, CURLOPT_CAPATH, nullptr);
+      curl_.easy_setopt(e, CURLOPT_CAINFO, config_.caFile->c_str());
+      curl_.easy_setopt(e, CURLOPT_CAPATH, nullptr);
     }
     // The time-out is an idle time-out: no progress for that long.
     long timeout = static_cast<long>(std::max<int64_t>(1, t.request.timeout.count()));
-    curl_easy_setopt(e, CURLOPT_CONNECTTIMEOUT, timeout);
-    curl_easy_setopt(e, CURLOPT_LOW_SPEED_LIMIT, 1L);
-    curl_easy_setopt(e, CURLOPT_LOW_SPEED_TIME, timeout);
+    curl_.easy_setopt(e, CURLOPT_CONNECTTIMEOUT, timeout);
+    curl_.easy_setopt(e, CURLOPT_LOW_SPEED_LIMIT, 1L);
+    curl_.easy_setopt(e, CURLOPT_LOW_SPEED_TIME, timeout);
     return true;
   }
 
@@ -339,7 +412,7 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
           continue;
         }
         CURL* easy = t->easy;
-        if (curl_multi_add_handle(multi_, easy) != CURLM_OK) {
+        if (curl_.multi_add_handle(multi_, easy) != CURLM_OK) {
           fail(std::move(t->completion), {HttpErrorDomain::other, HttpErrorCode::other, "cannot start the transfer"});
           continue;
         }
@@ -347,20 +420,20 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
       }
       if (cancel) cancelActive();
       int running = 0;
-      curl_multi_perform(multi_, &running);
+      curl_.multi_perform(multi_, &running);
       int queued = 0;
-      while (CURLMsg* msg = curl_multi_info_read(multi_, &queued)) {
+      while (CURLMsg* msg = curl_.multi_info_read(multi_, &queued)) {
         if (msg->msg == CURLMSG_DONE) finish(msg->easy_handle, msg->data.result);
       }
       maybeInvalidate();
-      curl_multi_poll(multi_, nullptr, 0, 1000, nullptr);
+      curl_.multi_poll(multi_, nullptr, 0, 1000, nullptr);
     }
   }
 
   // Abandons every running transfer; their files stay with their owners.
   void cancelActive() {
     for (auto& [easy, t] : active_) {
-      curl_multi_remove_handle(multi_, easy);
+      curl_.multi_remove_handle(multi_, easy);
       fail(std::move(t->completion), {HttpErrorDomain::url, HttpErrorCode::cancelled, "the upload was cancelled"});
       recycle(*t);
     }
@@ -371,18 +444,18 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     auto node = active_.extract(easy);
     if (node.empty()) return;
     std::unique_ptr<Transfer> t = std::move(node.mapped());
-    curl_multi_remove_handle(multi_, easy);
+    curl_.multi_remove_handle(multi_, easy);
     std::optional<HttpResponse> response;
     std::optional<HttpError> error;
     if (result == CURLE_OK) {
       long status = 0;
-      curl_easy_getinfo(easy, CURLINFO_RESPONSE_CODE, &status);
+      curl_.easy_getinfo(easy, CURLINFO_RESPONSE_CODE, &status);
       t->response.statusCode = status;
       if (t->request.onStatus) t->request.onStatus(status);
       response = std::move(t->response);
     } else {
       long osErrno = 0;
-      curl_easy_getinfo(easy, CURLINFO_OS_ERRNO, &osErrno);
+      curl_.easy_getinfo(easy, CURLINFO_OS_ERRNO, &osErrno);
       std::string detail = t->readFailed ? t->readError : std::string(t->errorBuffer);
       error = httpErrorFromCurl(t->readFailed ? CURLE_READ_ERROR : result, osErrno, detail);
       log().debug("Transfer to {} failed: {}", t->request.url, error->description);
@@ -411,9 +484,10 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
   }
 
   struct EasyCleanup {
-    void operator()(CURL* e) const { curl_easy_cleanup(e); }
+    void operator()(CURL* e) const { loadCurl()->easy_cleanup(e); }
   };
 
+  const CurlApi& curl_;
   HttpSessionConfiguration config_;
   CURLM* multi_ = nullptr;
   std::thread thread_;
@@ -431,7 +505,13 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
 }  // namespace
 
 std::shared_ptr<HttpClientSession> makeCurlHttpSession(HttpSessionConfiguration config) {
-  return std::make_shared<CurlHttpSession>(std::move(config));
+  std::string why;
+  const CurlApi* curl = loadCurl(&why);
+  if (curl == nullptr) {
+    log().error("Cannot load libcurl, so nothing can be uploaded: {}", why);
+    return nullptr;
+  }
+  return std::make_shared<CurlHttpSession>(*curl, std::move(config));
 }
 
 }  // namespace fbf

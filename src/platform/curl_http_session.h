@@ -27,6 +27,8 @@
 
 namespace fbf {
 
+// Null, with an error logged, when libcurl cannot be loaded: it is loaded
+// with the first session rather than at launch.
 std::shared_ptr<HttpClientSession> makeCurlHttpSession(HttpSessionConfiguration config);
 
 // The one mapping from a libcurl result code (with the OS error of the
