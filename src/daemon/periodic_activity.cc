@@ -185,19 +185,21 @@ void PeriodicActivityScheduler::runNow() {
 
 std::optional<SystemTime> PeriodicActivityScheduler::lastRun() const {
   std::error_code ec;
-  if (!assembly_.fileManager().exists(lastRunFile_)) return std::nullopt;
+  if (!assembly_.fileManager().exists(lastRunFile_)) return ranAt_;
   auto text = assembly_.fileManager().readFile(lastRunFile_, ec);
-  if (!text) return std::nullopt;
+  if (!text) return ranAt_;
   std::optional<SystemTime> when;
   try {
     when = timeFromStoredSeconds(std::stod(*text));
   } catch (const std::exception&) {
   }
   if (!when) log().error("Ignoring unreadable last-run file {}", lastRunFile_.string());
+  if (ranAt_ && (!when || *when < *ranAt_)) return ranAt_;
   return when;
 }
 
 void PeriodicActivityScheduler::recordRun(SystemTime when) {
+  ranAt_ = when;
   std::error_code ec;
   if (!assembly_.fileManager().writeFileAtomically(lastRunFile_, std::to_string(secondsSinceEpoch(when)) + "\n", ec)) {
     log().error("Cannot record the last periodic run in {}: {}", lastRunFile_.string(), ec.message());

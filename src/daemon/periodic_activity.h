@@ -111,6 +111,9 @@ class PeriodicActivityScheduler {
   ActivityCriteria criteria_;
   std::unique_ptr<Timer> timer_;
   std::optional<SystemTime> nextRun_;
+  // The last run of this process, kept in case its record cannot be written:
+  // without it, an unwritable record would make the run due again at once.
+  std::optional<SystemTime> ranAt_;
 };
 
 }  // namespace fbf

@@ -123,7 +123,8 @@ class Scheduling : public PeriodicRun {
  protected:
   std::shared_ptr<testing::ManualQueue> queue = std::make_shared<testing::ManualQueue>("activity");
   std::shared_ptr<FixedPower> sharedPower = std::make_shared<FixedPower>();
-  fs::path lastRun() { return env.cacheDir() / "fbf-last-flush"; }
+  fs::path lastRunFile = env.cacheDir() / "fbf-last-flush";
+  fs::path lastRun() { return lastRunFile; }
   std::unique_ptr<PeriodicActivityScheduler> start() {
     bag();
     env.defaults().setObject("FBFNoExit", true);
@@ -149,6 +150,15 @@ TEST_F(Scheduling, FirstStartOrAnUnreadableLastRunRunsAtOnceAndRemembersTheRun) 
   start();
   EXPECT_EQ(recorder.flushes, 2);
   EXPECT_TRUE(fs::exists(lastRun()));
+}
+
+TEST_F(Scheduling, AnUnwritableLastRunRecordStillWaitsAnIntervalBeforeTheNextRun) {
+  lastRunFile = env.cacheDir() / "gone" / "fbf-last-flush";
+  auto s = start();
+  EXPECT_EQ(recorder.flushes, 1) << "a run that cannot be recorded ran again at once";
+  EXPECT_TRUE(logs.contains("Cannot record the last periodic run"));
+  ASSERT_TRUE(s->nextRunAt());
+  EXPECT_GT(*s->nextRunAt(), env.clock->now() + std::chrono::hours(1));
 }
 
 TEST_F(Scheduling, RecentRunArmsTheTimerInstead) {
