@@ -241,9 +241,9 @@ class Bench {
     return left;
   }
 
-  // Launch to a socket that accepts, with an empty cache, then SIGTERM.
-  double launch() {
-    fill(0, false);
+  // Starts the daemon and waits until its socket accepts; `ready` is the
+  // time that took.
+  pid_t startDaemon(double& ready) {
     const fs::path socketPath = root_ / "run" / "vireon-fbf.sock";
     fs::remove(socketPath);
     auto launched = Clock::now();
@@ -252,10 +252,17 @@ class Bench {
       if (Clock::now() - launched > 10s) die("the daemon did not start: " + slurp(root_ / "daemon.log"));
       std::this_thread::sleep_for(200us);
     }
-    double ready = seconds(Clock::now() - launched);
+    ready = seconds(Clock::now() - launched);
+    return daemon;
+  }
+
+  // Launch to a socket that accepts, with an empty cache, then SIGTERM.
+  double launch() {
+    fill(0, false);
+    double ready = 0;
+    pid_t daemon = startDaemon(ready);
     kill(daemon, SIGTERM);
-    int status = 0;
-    waitpid(daemon, &status, 0);
+    waitpid(daemon, nullptr, 0);
     return ready;
   }
 
@@ -264,15 +271,7 @@ class Bench {
     fill(count, cohorts);
     FlushResult r;
     r.files = count;
-    const fs::path socketPath = root_ / "run" / "vireon-fbf.sock";
-    fs::remove(socketPath);
-    auto launched = Clock::now();
-    pid_t daemon = spawn({(gBin / "vireon-fbf").string()}, root_ / "daemon.out", root_ / "daemon.log");
-    while (!socketAccepts(socketPath)) {
-      if (Clock::now() - launched > 10s) die("the daemon did not start: " + slurp(root_ / "daemon.log"));
-      std::this_thread::sleep_for(200us);
-    }
-    r.readySeconds = seconds(Clock::now() - launched);
+    pid_t daemon = startDaemon(r.readySeconds);
     if (measureIdle) {
       std::this_thread::sleep_for(500ms);  // past bring-up
       double before = processCpu(daemon);
