@@ -127,12 +127,17 @@ double cpuSeconds(const rusage& u) {
          static_cast<double>(u.ru_utime.tv_usec + u.ru_stime.tv_usec) / 1e6;
 }
 
+double statCpu(const fs::path& statFile);
+
 // User plus system CPU seconds of a running process.
-double processCpu(pid_t pid) {
-  std::istringstream in(slurp("/proc/" + std::to_string(pid) + "/stat"));
+double processCpu(pid_t pid) { return statCpu("/proc/" + std::to_string(pid) + "/stat"); }
+
+// User plus system CPU seconds from a /proc stat file (a process's or a
+// thread's).
+double statCpu(const fs::path& statFile) {
   std::string field;
   // The command name may hold spaces: count fields after its closing ")".
-  std::string all = in.str();
+  std::string all = slurp(statFile);
   auto close = all.rfind(')');
   if (close == std::string::npos) return 0;
   std::istringstream rest(all.substr(close + 2));
@@ -141,6 +146,28 @@ double processCpu(pid_t pid) {
     if (i == 14 || i == 15) ticks += std::stod(field);
   }
   return ticks / static_cast<double>(sysconf(_SC_CLK_TCK));
+}
+
+// CPU seconds by thread name of a running process ("name 1.23 s, ..."),
+// the busiest first: which stage of the pipeline is the bottleneck.
+std::string threadCpu(pid_t pid) {
+  std::map<std::string, double> byName;
+  std::error_code ec;
+  for (fs::directory_iterator it("/proc/" + std::to_string(pid) + "/task", ec), end; !ec && it != end; it.increment(ec)) {
+    std::string comm = slurp(it->path() / "comm");
+    while (!comm.empty() && comm.back() == '\n') comm.pop_back();
+    byName[comm] += statCpu(it->path() / "stat");
+  }
+  std::vector<std::pair<double, std::string>> sorted;
+  for (const auto& [name, cpu] : byName) sorted.emplace_back(cpu, name);
+  std::sort(sorted.rbegin(), sorted.rend());
+  std::string out;
+  char buffer[96];
+  for (const auto& [cpu, name] : sorted) {
+    std::snprintf(buffer, sizeof buffer, "%s%s %.2f s", out.empty() ? "" : ", ", name.c_str(), cpu);
+    out += buffer;
+  }
+  return out;
 }
 
 size_t openDescriptors(pid_t pid) {
@@ -201,6 +228,7 @@ struct FlushResult {
   size_t maxDescriptors = 0;
   double readySeconds = 0;
   double idleCpu = -1;  // over kIdleSeconds, when measured
+  std::string threads;  // CPU by thread, at the end of the flush
   double filesPerSecond() const { return wall > 0 ? static_cast<double>(uploaded) / wall : 0; }
   double cpuPerFileMs() const { return uploaded > 0 ? cpu / static_cast<double>(uploaded) * 1e3 : 0; }
 };
@@ -295,6 +323,7 @@ class Bench {
     if (status != 0) die("fbfctl flush failed: " + slurp(root_ / "run.err"));
     r.maxDescriptors = maxFds;
     r.maxRssMB = peakRssMB(daemon);
+    r.threads = threadCpu(daemon);
 
     kill(daemon, SIGTERM);
     rusage usage{};
@@ -588,6 +617,7 @@ int main(int argc, char** argv) {
   std::sort(launches.begin(), launches.end());
   std::printf("  launch to socket ready                    %.1f ms median, %.1f ms best (%zu launches)\n",
               launches[launches.size() / 2] * 1e3, launches.front() * 1e3, launches.size());
+  std::printf("  daemon CPU by thread (%zu files)          %s\n", main.files, main.threads.c_str());
   std::printf("  CPU while idle                            %.1f ms over %.0f s\n", first.idleCpu * 1e3, kIdleSeconds);
 
   stopReceivers();

@@ -2,12 +2,20 @@
 
 #include "flushing/message_cast.h"
 
+#include <memory>
+#include <mutex>
+#include <unordered_map>
+
 namespace fbf {
 
 using corevireon::CVSearchResultForFeedback;
 using corevireon::CVSearchSuggestionForFeedback;
+using google::protobuf::Descriptor;
+using google::protobuf::DescriptorPool;
 using google::protobuf::FieldDescriptor;
 using google::protobuf::Message;
+using google::protobuf::MessageFactory;
+using google::protobuf::Reflection;
 
 std::optional<std::string> CVIdentifiable::identifier() const {
   if (auto* r = result()) return r->has_identifier() ? std::optional(r->identifier()) : std::nullopt;
@@ -129,26 +137,78 @@ void setFeedbackTimestamp(Message& feedback, uint64_t timestamp) {
   }
 }
 
-void forEachMessage(Message& root, const std::function<void(Message&)>& visit) {
-  visit(root);
-  // Straight over the descriptor (no ListFields vector per message): this
-  // runs for every message of every session.
-  const auto* descriptor = root.GetDescriptor();
-  const auto* reflection = root.GetReflection();
-  for (int i = 0, n = descriptor->field_count(); i < n; ++i) {
-    const FieldDescriptor* field = descriptor->field(i);
-    if (field->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) continue;
-    if (field->is_map() && field->message_type()->map_value()->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) {
-      continue;  // scalar maps hold nothing to walk
-    }
-    if (field->is_repeated()) {
-      for (int j = 0, count = reflection->FieldSize(root, field); j < count; ++j) {
-        forEachMessage(*reflection->MutableRepeatedMessage(&root, field, j), visit);
-      }
-    } else if (reflection->HasField(root, field)) {
-      forEachMessage(*reflection->MutableMessage(&root, field), visit);
+namespace {
+
+MessageShape& buildShape(std::unordered_map<const Descriptor*, std::unique_ptr<MessageShape>>& shapes,
+                         const Descriptor* descriptor) {
+  auto [it, added] = shapes.try_emplace(descriptor);
+  if (!added) return *it->second;  // done, or being built further up (a recursive type)
+  it->second = std::make_unique<MessageShape>();
+  MessageShape& shape = *it->second;
+  shape.descriptor = descriptor;
+  if (descriptor->file()->pool() == DescriptorPool::generated_pool()) {
+    if (const Message* prototype = MessageFactory::generated_factory()->GetPrototype(descriptor)) {
+      shape.generatedReflection = prototype->GetReflection();
     }
   }
+  for (int i = 0, n = descriptor->field_count(); i < n; ++i) {
+    const FieldDescriptor* field = descriptor->field(i);
+    const bool single = !field->is_repeated();
+    if (field->cpp_type() == FieldDescriptor::CPPTYPE_MESSAGE) {
+      if (field->is_map() && field->message_type()->map_value()->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) {
+        continue;  // scalar maps hold nothing to walk
+      }
+      shape.children.emplace_back(field, &buildShape(shapes, field->message_type()));
+      if (single && field->message_type() == CVSearchResultForFeedback::descriptor()) {
+        shape.singleResults.push_back(field);
+      }
+    } else if (single && field->number() == 1 && field->name() == "timestamp" &&
+               field->cpp_type() == FieldDescriptor::CPPTYPE_UINT64) {
+      shape.timestamp = field;
+    } else if (single && field->name() == "titleText" && field->cpp_type() == FieldDescriptor::CPPTYPE_STRING) {
+      shape.titleText = field;
+    } else if (single && field->name() == "matchesUnengagedSuggestion" &&
+               field->cpp_type() == FieldDescriptor::CPPTYPE_BOOL) {
+      shape.matchesUnengagedSuggestion = field;
+    }
+  }
+  return shape;
+}
+
+// Below a generated message every message is generated too, so the cached
+// reflection serves; otherwise each message is asked for its own.
+void walk(Message& message, const Reflection& reflection, const MessageShape& shape, bool generated,
+          const MessageVisitor& visit) {
+  visit(message, reflection, shape);
+  for (const auto& [field, childShape] : shape.children) {
+    auto childReflection = [&](const Message& child) -> const Reflection& {
+      return generated ? *childShape->generatedReflection : *child.GetReflection();
+    };
+    if (field->is_repeated()) {
+      for (int j = 0, count = reflection.FieldSize(message, field); j < count; ++j) {
+        Message& child = *reflection.MutableRepeatedMessage(&message, field, j);
+        walk(child, childReflection(child), *childShape, generated, visit);
+      }
+    } else if (reflection.HasField(message, field)) {
+      Message& child = *reflection.MutableMessage(&message, field);
+      walk(child, childReflection(child), *childShape, generated, visit);
+    }
+  }
+}
+
+}  // namespace
+
+const MessageShape& shapeOf(const Descriptor* descriptor) {
+  static std::mutex mutex;
+  static std::unordered_map<const Descriptor*, std::unique_ptr<MessageShape>> shapes;
+  std::lock_guard lock(mutex);
+  return buildShape(shapes, descriptor);
+}
+
+void forEachMessage(Message& root, const MessageVisitor& visit) {
+  const MessageShape& shape = shapeOf(root.GetDescriptor());
+  const Reflection* reflection = root.GetReflection();
+  walk(root, *reflection, shape, reflection == shape.generatedReflection, visit);
 }
 
 }  // namespace fbf

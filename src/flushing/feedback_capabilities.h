@@ -70,11 +70,34 @@ google::protobuf::Message* mutableCodableMessage(corevireon::CVFeedbackPayload& 
 std::optional<uint64_t> feedbackTimestamp(const google::protobuf::Message& feedback);
 void setFeedbackTimestamp(google::protobuf::Message& feedback, uint64_t timestamp);
 
+// What the rewrite's walks need to know of one message type, worked out once
+// per type instead of looked up by name for every message of every session.
+struct MessageShape {
+  const google::protobuf::Descriptor* descriptor = nullptr;
+  // Reflection of the generated class (null for a type outside the
+  // generated pool); only valid for messages of that class.
+  const google::protobuf::Reflection* generatedReflection = nullptr;
+  // The fields that can hold messages (message fields, and maps whose values
+  // are messages), with the shape of the message type they hold.
+  std::vector<std::pair<const google::protobuf::FieldDescriptor*, const MessageShape*>> children;
+  // `timestamp`, field 1, a single uint64; `titleText`, a single string;
+  // `matchesUnengagedSuggestion`, a single bool: null where the type has none.
+  const google::protobuf::FieldDescriptor* timestamp = nullptr;
+  const google::protobuf::FieldDescriptor* titleText = nullptr;
+  const google::protobuf::FieldDescriptor* matchesUnengagedSuggestion = nullptr;
+  // The single fields holding a result, in declaration order.
+  std::vector<const google::protobuf::FieldDescriptor*> singleResults;
+};
+
+const MessageShape& shapeOf(const google::protobuf::Descriptor* descriptor);
+
 // Calls `visit` on `root` and then on every message set anywhere inside it,
 // each parent before its children, found through the descriptors (so a
 // message kind added to the .proto is walked without code here). `visit` may
 // change the message it is given; the children walked are those present after
 // it returns.
-void forEachMessage(google::protobuf::Message& root, const std::function<void(google::protobuf::Message&)>& visit);
+using MessageVisitor =
+    std::function<void(google::protobuf::Message&, const google::protobuf::Reflection&, const MessageShape&)>;
+void forEachMessage(google::protobuf::Message& root, const MessageVisitor& visit);
 
 }  // namespace fbf

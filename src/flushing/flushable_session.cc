@@ -132,23 +132,14 @@ namespace {
 // daemon) from `message` and everything inside it; returns how many there were.
 uint64_t discardUnknownFields(google::protobuf::Message& message) {
   uint64_t discarded = 0;
-  forEachMessage(message, [&discarded](google::protobuf::Message& m) {
-    const auto* reflection = m.GetReflection();
-    if (const int n = reflection->GetUnknownFields(m).field_count(); n > 0) {
+  forEachMessage(message, [&discarded](google::protobuf::Message& m, const google::protobuf::Reflection& reflection,
+                                       const MessageShape&) {
+    if (const int n = reflection.GetUnknownFields(m).field_count(); n > 0) {
       discarded += static_cast<uint64_t>(n);
-      reflection->MutableUnknownFields(&m)->Clear();
+      reflection.MutableUnknownFields(&m)->Clear();
     }
   });
   return discarded;
-}
-
-const google::protobuf::FieldDescriptor* timestampFieldOf(const google::protobuf::Message& m) {
-  const auto* field = m.GetDescriptor()->FindFieldByNumber(1);
-  if (field == nullptr || field->name() != "timestamp" || field->is_repeated() ||
-      field->cpp_type() != google::protobuf::FieldDescriptor::CPPTYPE_UINT64) {
-    return nullptr;
-  }
-  return field;
 }
 
 // The first non-zero feedback timestamp in processing order, if any.
@@ -186,16 +177,16 @@ void FlushableSession::postProcessFeedback(UsageEventSink* storageContainer, Ses
   // uploaded as it stands. Nested feedback (the rankings inside a ranking)
   // carries times of its own, treated alike.
   const std::optional<uint64_t> baseTime = baseTimeOf(*list);
-  auto makeRelative = [&](google::protobuf::Message& m) {
-    const auto* field = timestampFieldOf(m);
+  auto makeRelative = [&](google::protobuf::Message& m, const google::protobuf::Reflection& reflection,
+                          const MessageShape& shape) {
+    const auto* field = shape.timestamp;
     if (field == nullptr) return;
-    const auto* reflection = m.GetReflection();
-    const uint64_t t = reflection->GetUInt64(m, field);
+    const uint64_t t = reflection.GetUInt64(m, field);
     if (t == 0) return;
     if (baseTime && t >= *baseTime) {
-      reflection->SetUInt64(&m, field, (t - *baseTime) / kNanosecondsPerMillisecond);
+      reflection.SetUInt64(&m, field, (t - *baseTime) / kNanosecondsPerMillisecond);
     } else {
-      reflection->SetUInt64(&m, field, 0);
+      reflection.SetUInt64(&m, field, 0);
       ++done.timestampsRemoved;
     }
   };

@@ -6,14 +6,22 @@
 
 namespace fbf {
 
+// T::descriptor() goes through protobuf's once-only initialisation on every
+// call; the rewrite asks this for every message it meets.
+template <class T>
+const google::protobuf::Descriptor* descriptorOf() {
+  static const google::protobuf::Descriptor* const descriptor = T::descriptor();
+  return descriptor;
+}
+
 template <class T>
 const T* messageAs(const google::protobuf::Message& m) {
-  return m.GetDescriptor() == T::descriptor() ? static_cast<const T*>(&m) : nullptr;
+  return m.GetDescriptor() == descriptorOf<T>() ? static_cast<const T*>(&m) : nullptr;
 }
 
 template <class T>
 T* messageAs(google::protobuf::Message& m) {
-  return m.GetDescriptor() == T::descriptor() ? static_cast<T*>(&m) : nullptr;
+  return m.GetDescriptor() == descriptorOf<T>() ? static_cast<T*>(&m) : nullptr;
 }
 
 }  // namespace fbf

@@ -98,32 +98,22 @@ void SessionProcessingHelper::processItems(const Items& items, bool expanded) {
   }
 }
 
-void SessionProcessingHelper::applyTitleRule(google::protobuf::Message& message) {
-  const auto* descriptor = message.GetDescriptor();
-  const FieldDescriptor* titleText = descriptor->FindFieldByName("titleText");
-  if (titleText == nullptr || titleText->cpp_type() != FieldDescriptor::CPPTYPE_STRING || titleText->is_repeated()) {
-    return;
-  }
-  const auto* reflection = message.GetReflection();
+void SessionProcessingHelper::applyTitleRule(google::protobuf::Message& message,
+                                             const google::protobuf::Reflection& reflection,
+                                             const MessageShape& shape) {
+  if (shape.titleText == nullptr) return;
   // The title the user saw stays only when the engaged result is of a type
   // whose titles are not personal.
-  bool keeps = false;
-  for (int i = 0; i < descriptor->field_count(); ++i) {
-    const FieldDescriptor* f = descriptor->field(i);
-    if (f->is_repeated() || f->message_type() != CVSearchResultForFeedback::descriptor()) continue;
-    if (!reflection->HasField(message, f)) continue;
-    keeps = keepsTitle(static_cast<const CVSearchResultForFeedback&>(reflection->GetMessage(message, f)).type());
+  for (const FieldDescriptor* f : shape.singleResults) {
+    if (!reflection.HasField(message, f)) continue;
+    if (keepsTitle(static_cast<const CVSearchResultForFeedback&>(reflection.GetMessage(message, f)).type())) return;
     break;
   }
-  if (keeps) return;
-  if (reflection->HasField(message, titleText)) {
-    reflection->ClearField(&message, titleText);
+  if (reflection.HasField(message, shape.titleText)) {
+    reflection.ClearField(&message, shape.titleText);
     ++titlesCleared_;
   }
-  const FieldDescriptor* matches = descriptor->FindFieldByName("matchesUnengagedSuggestion");
-  if (matches != nullptr && matches->cpp_type() == FieldDescriptor::CPPTYPE_BOOL && !matches->is_repeated()) {
-    reflection->SetBool(&message, matches, false);
-  }
+  if (shape.matchesUnengagedSuggestion != nullptr) reflection.SetBool(&message, shape.matchesUnengagedSuggestion, false);
 }
 
 void SessionProcessingHelper::process(google::protobuf::Message* feedback) {
@@ -134,13 +124,18 @@ void SessionProcessingHelper::process(google::protobuf::Message* feedback) {
     // Whatever the table above does not reach (a section header's results, a
     // kind added to the .proto later) is still mapped and stripped, without
     // bookkeeping: the table alone decides what counts as shown or delivered.
-    forEachMessage(*feedback, [this](google::protobuf::Message& m) {
-      if (auto* r = messageAs<CVSearchResultForFeedback>(m)) {
+    static const auto* const resultType = CVSearchResultForFeedback::descriptor();
+    static const auto* const suggestionType = CVSearchSuggestionForFeedback::descriptor();
+    forEachMessage(*feedback, [this](google::protobuf::Message& m, const google::protobuf::Reflection& reflection,
+                                     const MessageShape& shape) {
+      if (shape.descriptor == resultType) {
+        auto* r = static_cast<CVSearchResultForFeedback*>(&m);
         if (!rewritten_.count(r)) rewriteItem(CVIdentifiable(r));
-      } else if (auto* s = messageAs<CVSearchSuggestionForFeedback>(m)) {
+      } else if (shape.descriptor == suggestionType) {
+        auto* s = static_cast<CVSearchSuggestionForFeedback*>(&m);
         if (!rewritten_.count(s)) rewriteItem(CVIdentifiable(s));
       } else {
-        applyTitleRule(m);
+        applyTitleRule(m, reflection, shape);
       }
     });
     rewritten_.clear();

@@ -113,7 +113,8 @@ class SessionProcessingHelper {
   void processKnownKind(google::protobuf::Message* feedback);
   void processItems(const std::vector<CVIdentifiable>& items, bool expanded);
   void rewriteItem(const CVIdentifiable& item);
-  void applyTitleRule(google::protobuf::Message& message);
+  void applyTitleRule(google::protobuf::Message& message, const google::protobuf::Reflection& reflection,
+                      const MessageShape& shape);
 
   int64_t nextMappedId_ = 1;
   std::unordered_map<std::string, std::string> idMapping_;

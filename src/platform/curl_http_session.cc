@@ -14,6 +14,8 @@
 #include <cstring>
 #include <unordered_map>
 #include <mutex>
+#include <pthread.h>
+
 #include <thread>
 #include <type_traits>
 #include <vector>
@@ -244,7 +246,10 @@ class CurlHttpSession final : public HttpClientSession, public std::enable_share
     multi_ = curl_.multi_init();
     curl_.multi_setopt(multi_, CURLMOPT_MAX_HOST_CONNECTIONS, static_cast<long>(std::max(1, config_.maxConnectionsPerHost)));
     curl_.multi_setopt(multi_, CURLMOPT_PIPELINING, static_cast<long>(CURLPIPE_MULTIPLEX));
-    thread_ = std::thread([this] { run(); });
+    thread_ = std::thread([this] {
+      pthread_setname_np(pthread_self(), "http");
+      run();
+    });
   }
 
   ~CurlHttpSession() override {
