@@ -258,19 +258,19 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
   {
     std::string guid = file.sessionFilename ? file.sessionFilename->sessionIDString() : name;
     SignpostInterval serialize("serialize session", ("file GUID:" + guid).c_str());
-    corevireon::CVClientSession session;
     // Undecodable and empty sessions stay in "processing": they are the
     // file's own fault, and `fbfctl status` shows them.
-    if (!session.ParseFromString(*bytes)) {
+    std::optional<FlushableSession> decoded = FlushableSession::decode(*bytes);
+    if (!decoded) {
       log().error("File contents did not deserialize into a _CVClientSession");
       return;
     }
     bytes.reset();
-    if (!session.has_feedbacks() || session.feedbacks().items_size() == 0) {
+    FlushableSession& flushable = *decoded;
+    if (!flushable.backingStore().has_feedbacks() || flushable.backingStore().feedbacks().items_size() == 0) {
       log().error("Deserialized session contained no feedback.");
       return;
     }
-    FlushableSession flushable(std::move(session));
     flushable.postProcessFeedback(usageStore_ ? usageStore_->usageEventSink() : nullptr);
     if (protobufFormat) {
       // Deterministic: the upload is byte for byte what `fbfctl explain` shows.

@@ -53,9 +53,24 @@ void moveLastToFront(google::protobuf::RepeatedPtrField<CVFeedbackPayload>* list
 
 }  // namespace
 
+FlushableSession::FlushableSession(corevireon::CVClientSession backingStore)
+    : owned_(std::make_unique<corevireon::CVClientSession>(std::move(backingStore))), backingStore_(owned_.get()) {}
+
+std::optional<FlushableSession> FlushableSession::decode(std::string_view bytes) {
+  // Decoded, a session takes two to three times its encoded size: start with
+  // blocks of about that, up to 256 KiB each.
+  google::protobuf::ArenaOptions options;
+  options.start_block_size = std::clamp<size_t>(bytes.size() * 2, 4096, 256 * 1024);
+  options.max_block_size = 256 * 1024;
+  auto arena = std::make_unique<google::protobuf::Arena>(options);
+  auto* session = google::protobuf::Arena::CreateMessage<corevireon::CVClientSession>(arena.get());
+  if (!session->ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) return std::nullopt;
+  return FlushableSession(std::move(arena), session);
+}
+
 std::optional<std::vector<CVFeedbackPayload>> FlushableSession::sessionFeedbacks() const {
-  if (!backingStore_.has_feedbacks()) return std::nullopt;
-  const auto& items = backingStore_.feedbacks().items();
+  if (!backingStore_->has_feedbacks()) return std::nullopt;
+  const auto& items = backingStore_->feedbacks().items();
   std::vector<const CVFeedbackPayload*> order;
   order.reserve(items.size());
   for (const auto& p : items) order.push_back(&p);
@@ -69,9 +84,9 @@ std::optional<std::vector<CVFeedbackPayload>> FlushableSession::sessionFeedbacks
 const std::vector<EngagementReporter>& FlushableSession::engagements() {
   if (!engagements_) {
     std::vector<EngagementReporter> list;
-    const corevireon::CVClient client = cohortsClient(backingStore_);
-    if (backingStore_.has_feedbacks()) {
-      for (const auto& payload : backingStore_.feedbacks().items()) {
+    const corevireon::CVClient client = cohortsClient(*backingStore_);
+    if (backingStore_->has_feedbacks()) {
+      for (const auto& payload : backingStore_->feedbacks().items()) {
         const google::protobuf::Message* message = codableMessage(payload);
         if (message == nullptr) continue;
         auto reporter = EngagementReporter::from(*message);
@@ -90,8 +105,8 @@ void FlushableSession::setEngagements(std::vector<EngagementReporter> engagement
 const std::vector<KeystrokeReporter>& FlushableSession::keystrokes() {
   if (!keystrokes_) {
     std::vector<KeystrokeReporter> list;
-    if (backingStore_.has_feedbacks()) {
-      for (const auto& payload : backingStore_.feedbacks().items()) {
+    if (backingStore_->has_feedbacks()) {
+      for (const auto& payload : backingStore_->feedbacks().items()) {
         const google::protobuf::Message* message = codableMessage(payload);
         if (message == nullptr) continue;
         auto reporter = KeystrokeReporter::from(*message);
@@ -108,8 +123,8 @@ void FlushableSession::setKeystrokes(std::vector<KeystrokeReporter> keystrokes) 
 const std::map<std::string, corevireon::CVSearchResultForFeedback>& FlushableSession::resultsById() {
   if (!resultsById_) {
     std::map<std::string, corevireon::CVSearchResultForFeedback> map;
-    if (backingStore_.has_feedbacks()) {
-      for (const auto& payload : backingStore_.feedbacks().items()) {
+    if (backingStore_->has_feedbacks()) {
+      for (const auto& payload : backingStore_->feedbacks().items()) {
         const google::protobuf::Message* message = codableMessage(payload);
         if (message == nullptr) continue;
         for (const auto* result : containedResults(*message)) {
@@ -163,12 +178,12 @@ void FlushableSession::postProcessFeedback(UsageEventSink* storageContainer, Ses
   SessionRewriteSummary local;
   SessionRewriteSummary& done = summary ? *summary : local;
   done = SessionRewriteSummary();
-  if (storageContainer != nullptr) storageContainer->reportUsageEvents(backingStore_);
+  if (storageContainer != nullptr) storageContainer->reportUsageEvents(*backingStore_);
   // Before anything else: what this build cannot read it cannot rewrite.
-  done.unknownFieldsDiscarded = discardUnknownFields(backingStore_);
-  if (!backingStore_.has_feedbacks()) return;
+  done.unknownFieldsDiscarded = discardUnknownFields(*backingStore_);
+  if (!backingStore_->has_feedbacks()) return;
 
-  auto* list = backingStore_.mutable_feedbacks()->mutable_items();
+  auto* list = backingStore_->mutable_feedbacks()->mutable_items();
   sortForProcessing(list->pointer_begin(), list->pointer_end());
 
   // Device clock readings leave the device only as distances from the first
@@ -226,7 +241,7 @@ void FlushableSession::postProcessFeedback(UsageEventSink* storageContainer, Ses
     moveLastToFront(list);
   }
 
-  if (backingStore_.removetimestamps() && backingStore_.sessionstart() != 0) backingStore_.set_sessionstart(0);
+  if (backingStore_->removetimestamps() && backingStore_->sessionstart() != 0) backingStore_->set_sessionstart(0);
 }
 
 std::string feedbackEventName(int32_t type) {
@@ -310,7 +325,7 @@ std::optional<ordered_json> feedbackDictionary(const CVFeedbackPayload& payload)
 }
 
 ordered_json FlushableSession::generateSessionJSON() const {
-  const auto& s = backingStore_;
+  const auto& s = *backingStore_;
   ordered_json json = ordered_json::object();
 
   if (s.has_feedbacks()) {

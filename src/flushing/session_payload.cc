@@ -32,16 +32,16 @@ std::string serializeSessionDeterministically(const corevireon::CVClientSession&
 
 SessionPayload makeSessionPayload(std::string_view fileBytes, SessionPayloadFormat format, UsageEventSink* usageSink) {
   SessionPayload payload;
-  corevireon::CVClientSession session;
-  if (!session.ParseFromArray(fileBytes.data(), static_cast<int>(fileBytes.size()))) {
+  std::optional<FlushableSession> decoded = FlushableSession::decode(fileBytes);
+  if (!decoded) {
     payload.outcome = SessionPayload::Outcome::undecodable;
     return payload;
   }
-  if (!session.has_feedbacks() || session.feedbacks().items_size() == 0) {
+  FlushableSession& flushable = *decoded;
+  if (!flushable.backingStore().has_feedbacks() || flushable.backingStore().feedbacks().items_size() == 0) {
     payload.outcome = SessionPayload::Outcome::noFeedback;
     return payload;
   }
-  FlushableSession flushable(std::move(session));
   flushable.postProcessFeedback(usageSink, &payload.summary);
   payload.bytes = format == SessionPayloadFormat::protobuf
                       ? serializeSessionDeterministically(flushable.backingStore())
