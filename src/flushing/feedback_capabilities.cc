@@ -181,17 +181,15 @@ void walk(Message& message, const Reflection& reflection, const MessageShape& sh
           const MessageVisitor& visit) {
   visit(message, reflection, shape);
   for (const auto& [field, childShape] : shape.children) {
-    auto childReflection = [&](const Message& child) -> const Reflection& {
-      return generated ? *childShape->generatedReflection : *child.GetReflection();
-    };
+    const Reflection* cached = generated ? childShape->generatedReflection : nullptr;
     if (field->is_repeated()) {
       for (int j = 0, count = reflection.FieldSize(message, field); j < count; ++j) {
         Message& child = *reflection.MutableRepeatedMessage(&message, field, j);
-        walk(child, childReflection(child), *childShape, generated, visit);
+        walk(child, cached ? *cached : *child.GetReflection(), *childShape, generated, visit);
       }
     } else if (reflection.HasField(message, field)) {
       Message& child = *reflection.MutableMessage(&message, field);
-      walk(child, childReflection(child), *childShape, generated, visit);
+      walk(child, cached ? *cached : *child.GetReflection(), *childShape, generated, visit);
     }
   }
 }
