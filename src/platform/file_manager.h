@@ -105,6 +105,14 @@ class FileManager {
   virtual FileDescriptor openForReading(const fs::path& path, std::error_code& error) const = 0;
   // Creates (or truncates) a regular file with mode 0600 for writing.
   virtual FileDescriptor createForWriting(const fs::path& path, std::error_code& error) = 0;
+  // A regular file with mode 0600 and no name yet, in `dir` (which must not
+  // be a link), for writing. It vanishes with its last descriptor unless
+  // `publish` names it first, so a crash leaves nothing half-written behind.
+  // Invalid where the file system cannot make one.
+  virtual FileDescriptor createUnnamedForWriting(const fs::path& dir, std::error_code& error) = 0;
+  // Gives an unnamed file (open as `fd`) the name `path`; fails with
+  // file_exists when the name is taken.
+  virtual bool publish(int fd, const fs::path& path, std::error_code& error) = 0;
 
   virtual std::optional<std::string> readFile(const fs::path& path, std::error_code& error) const = 0;
   // Writes through a temporary file in the same directory and renames it over.

@@ -181,6 +181,23 @@ class PosixFileManager final : public FileManager {
     return true;
   }
 
+  FileDescriptor createUnnamedForWriting(const fs::path& dir, std::error_code& error) override {
+    FileDescriptor fd(open(dir.c_str(), O_TMPFILE | O_WRONLY | O_NOFOLLOW | O_CLOEXEC, 0600));
+    if (!fd.valid()) error = lastError();
+    return fd;
+  }
+
+  bool publish(int fd, const fs::path& path, std::error_code& error) override {
+    // linkat(AT_EMPTY_PATH) needs CAP_DAC_READ_SEARCH; the descriptor's link
+    // under /proc/self does not.
+    const std::string link = "/proc/self/fd/" + std::to_string(fd);
+    if (linkat(AT_FDCWD, link.c_str(), AT_FDCWD, path.c_str(), AT_SYMLINK_FOLLOW) != 0) {
+      error = lastError();
+      return false;
+    }
+    return true;
+  }
+
   FileDescriptor createForWriting(const fs::path& path, std::error_code& error) override {
     FileDescriptor fd(open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, 0600));
     if (!fd.valid()) {

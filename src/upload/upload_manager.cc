@@ -11,6 +11,7 @@
 
 #include "corevireon.pb.h"
 
+#include <fcntl.h>
 #include <strings.h>
 #include <unistd.h>
 
@@ -65,17 +66,20 @@ bool isOfflineError(const HttpError& e) {
   }
 }
 
-// An upload file is written under a hidden name beside its final one and
-// renamed into place only once complete, so that an upload file that exists
-// always holds a whole payload, whatever moment the process dies at. A
-// writer that is not committed removes its partial file.
+// An upload file gets its name only once complete, so that an upload file
+// that exists always holds a whole payload, whatever moment the process dies
+// at. It is written unnamed (O_TMPFILE) and linked into place: one directory
+// change per file instead of a create and a rename, and a crash leaves
+// nothing behind. Where the file system cannot do that it is written under a
+// hidden name beside its final one and renamed; a writer that is not
+// committed removes that partial file.
 class PartialUploadFile {
  public:
   PartialUploadFile(FileManager& fm, fs::path finalPath)
       : fm_(fm), finalPath_(std::move(finalPath)),
         partialPath_(finalPath_.parent_path() / ("." + finalPath_.filename().string() + ".partial")) {}
   ~PartialUploadFile() {
-    if (!committed_) {
+    if (named_ && !committed_) {
       std::error_code ec;
       fm_.removeItem(partialPath_, ec);
     }
@@ -85,10 +89,27 @@ class PartialUploadFile {
 
   FileDescriptor create() {
     std::error_code ec;
+    FileDescriptor fd = fm_.createUnnamedForWriting(finalPath_.parent_path(), ec);
+    if (fd.valid()) {
+      // The stream closes its descriptor when it finishes; the file is named
+      // after that, through a descriptor of its own.
+      unnamed_ = FileDescriptor(fcntl(fd.get(), F_DUPFD_CLOEXEC, 0));
+      if (unnamed_.valid()) return fd;
+    }
+    named_ = true;
     return fm_.createForWriting(partialPath_, ec);
   }
   bool commit() {
     std::error_code ec;
+    if (!named_) {
+      committed_ = fm_.publish(unnamed_.get(), finalPath_, ec);
+      if (committed_ || ec != std::errc::file_exists) return committed_;
+      // An upload file of an earlier attempt has the name: replaced, as a
+      // rename would, through the hidden name.
+      fm_.removeItem(partialPath_, ec);
+      named_ = fm_.publish(unnamed_.get(), partialPath_, ec);
+      if (!named_) return false;
+    }
     committed_ = fm_.moveItem(partialPath_, finalPath_, ec);
     return committed_;
   }
@@ -98,6 +119,8 @@ class PartialUploadFile {
   FileManager& fm_;
   fs::path finalPath_;
   fs::path partialPath_;
+  FileDescriptor unnamed_;
+  bool named_ = false;  // written under partialPath_
   bool committed_ = false;
 };
 
