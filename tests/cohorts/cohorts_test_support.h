@@ -4,7 +4,6 @@
 #pragma once
 
 #include "cohorts/object_graph_storage_container.h"
-#include "corevireon.pb.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>

@@ -4,8 +4,6 @@
 // with the tests' own signature reader. Few daemon launches, no sleeps: the
 // "soon" delay is set to zero and changes are polled for.
 #include "e2e/daemon_home.h"
-#include "platform/file_manager.h"
-#include "platform/user_defaults.h"
 #include "whitelist/signature_decoder.h"
 
 #include <fmt/format.h>

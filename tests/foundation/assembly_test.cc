@@ -1,12 +1,9 @@
-#include "assembly/fbf_assembly.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
-
-using testing::TestEnvironment;
 
 class RecordingSession final : public HttpClientSession {
  public:
@@ -29,15 +26,10 @@ TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
   EXPECT_TRUE(check());
   a.setCancelled(true);
   EXPECT_FALSE(check());
-
-  struct Listener final : ClientConduit {
-    void willUploadData(const std::string&, const std::string&) override {}
-    void willGenerateCohortFeebacks(const std::string&) override {}
-  };
-  a.setCohortsListener(std::make_shared<Listener>());
+  a.setCohortsListener(std::make_shared<RecordingConduit>());
   EXPECT_TRUE(check());
   a.setCohortsListener(nullptr);
-  a.setUploadListener(std::make_shared<Listener>());
+  a.setUploadListener(std::make_shared<RecordingConduit>());
   EXPECT_TRUE(check());
 }
 
@@ -83,4 +75,4 @@ TEST(CleanExit, WaitsForTheLastOpenTransactionAndHappensOnce) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

@@ -4,11 +4,6 @@
 #pragma once
 
 #include "assembly/fbf_assembly.h"
-#include "platform/analytics.h"
-#include "platform/file_manager.h"
-#include "platform/task_queue.h"
-#include "platform/user_defaults.h"
-#include "platform/xdg.h"
 
 #include <spdlog/sinks/base_sink.h>
 
@@ -106,6 +101,14 @@ class RecordingAnalytics final : public AnalyticsSink {
  private:
   mutable std::mutex m_;
   std::vector<std::pair<std::string, nlohmann::json>> events_;
+};
+
+// A listener that keeps every cohort feedback it is sent.
+class RecordingConduit final : public ClientConduit {
+ public:
+  void willUploadData(const std::string&, const std::string&) override {}
+  void willGenerateCohortFeebacks(const std::string& data) override { received.push_back(data); }
+  std::vector<std::string> received;
 };
 
 // Writes `bytes` to `path` (creating parent directories), mode 0600.

@@ -6,8 +6,6 @@
 
 #include <gtest/gtest.h>
 
-#include <sys/stat.h>
-
 namespace fbf::testing {
 namespace {
 
@@ -31,11 +29,6 @@ class RecordingPoster final : public NotificationPoster {
   void post(std::string_view name) override { posted.emplace_back(name); }
   std::vector<std::string> posted;
 };
-
-mode_t modeOf(const fs::path& path) {
-  struct stat st {};
-  return stat(path.c_str(), &st) == 0 ? st.st_mode & 0777 : 0;
-}
 
 // A controller over the test environment's assembly, with its own hand-run
 // low-priority queue, three installed applications and a whitelist resource
@@ -185,7 +178,7 @@ TEST_F(WhitelistUpdates, DestroyedControllerRunsNothingMore) {
 TEST_F(WhitelistUpdates, AssistantListIsWrittenOwnerOnlyAndAnnounced) {
   ASSERT_TRUE(updateNow());
   EXPECT_EQ(readFile(assistantList()), R"(["org.vireon.Notes","seed"])");
-  EXPECT_EQ(modeOf(assistantList()), 0600u);
+  EXPECT_EQ(env.fileManager->attributes(assistantList()).value().mode, 0600u);
   EXPECT_EQ(poster->posted, (std::vector<std::string>{"vireon-fbf.skapp_data_changed"}));
   EXPECT_TRUE(logs.contains("updated whitelist file"));
 
@@ -202,7 +195,7 @@ TEST_F(WhitelistUpdates, IfStaleWorksOnlyOnAListOlderThan48Hours) {
   controller->updateWhitelists(kIfStale, [&] { done = true; });
   EXPECT_FALSE(done);
   EXPECT_EQ(readFile(assistantList()), "");  // created empty
-  EXPECT_EQ(modeOf(assistantList()), 0600u);
+  EXPECT_EQ(env.fileManager->attributes(assistantList()).value().mode, 0600u);
   queue->drain();
   queue->advance(5ms);
   EXPECT_TRUE(done);
