@@ -67,11 +67,10 @@ class WhitelistDaemon : public ::testing::Test {
     home.startDaemon();
     ASSERT_TRUE(logged("setup")) << log();
   }
-  RunResult ctl(const std::vector<std::string>& args) { return home.fbfctl(args); }
 
   // What `fbfctl update-whitelists CONDITION` printed; fails the test on a non-zero exit.
   std::string update(const std::string& condition) {
-    auto r = ctl({"update-whitelists", condition});
+    auto r = home.fbfctl({"update-whitelists", condition});
     EXPECT_EQ(r.status, 0) << r.err << log();
     while (!r.out.empty() && r.out.back() == '\n') r.out.pop_back();
     return r.out;
@@ -151,7 +150,7 @@ TEST_F(WhitelistDaemon, EachConditionPrintsAndStoresTheSignatureOfInstalledWhite
   EXPECT_TRUE(carries(update("now"), {1, 2, 3, 4, 9, 20}));
   EXPECT_TRUE(carries(stored(), {1, 2, 3, 4, 9, 20}));
 
-  auto refused = ctl({"update-whitelists", "later"});
+  auto refused = home.fbfctl({"update-whitelists", "later"});
   EXPECT_NE(refused.status, 0);
   EXPECT_NE(refused.err.find("later"), std::string::npos) << refused.err;
 }
