@@ -60,7 +60,6 @@ inline corevireon::CVClientSession makeSession(const std::string& agent, SystemT
   return s;
 }
 inline corevireon::CVFeedbackPayload* addItem(corevireon::CVClientSession& s) { return s.mutable_feedbacks()->add_items(); }
-inline void addSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_startlocalsearch()->set_input("weather"); }
 inline void addDidGoToSite(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosite(); }
 inline void addDidGoToSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosearch(); }
 

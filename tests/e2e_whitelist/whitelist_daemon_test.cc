@@ -59,7 +59,6 @@ class WhitelistDaemon : public ::testing::Test {
   fs::path userApps() const { return dirs.dataHome / "applications"; }
   fs::path sharedApps() const { return dirs.dataDirs.front() / "applications"; }
   fs::path userResource() const { return dirs.dataHome / "vireond" / "app-whitelist.json"; }
-  fs::path sharedResource() const { return dirs.dataDirs.front() / "vireond" / "app-whitelist.json"; }
   fs::path assistantList() const { return home.cacheDir() / "assistant-apps.json"; }
   std::string log() const { return home.daemonLog(); }
   bool logged(const std::string& line) const { return log().find(line) != std::string::npos; }
@@ -118,7 +117,7 @@ TEST_F(WhitelistDaemon, EachConditionPrintsAndStoresTheSignatureOfInstalledWhite
       {"org.example.Mail", 0}, {"org.example.Todo", 1}, {"a-b-c", 2}, {"org.example.Maps", 3}, {"shown", 4},
       {"org.example.Notes", 5}, {"org.example.Site", 7}, {"org.example.Broken", 8}, {"vendor-tool", 9},
       {"readme", 11}, {"org.example.NotInstalled", 12}, {"loop-org.example.Mail", 13}};
-  writeFile(sharedResource(), whitelistDocument(ids));
+  writeFile(dirs.dataDirs.front() / "vireond" / "app-whitelist.json", whitelistDocument(ids));
   ASSERT_TRUE(store->defaultsForDomain("vireon.assistant")->setObject("Assistant Enabled", true));
   ASSERT_TRUE(store->defaultsForDomain("vireon.scoutlume")
                   ->setObject("DisabledApplications", PropertyList::array({"org.vireon.Notes"})));

@@ -5,15 +5,6 @@
 namespace fbf::testing {
 namespace {
 
-class RecordingSession final : public HttpClientSession {
- public:
-  explicit RecordingSession(HttpSessionConfiguration c) : config(std::move(c)) {}
-  void uploadFile(HttpRequest, std::filesystem::path, HttpCompletion) override {}
-  void finishTasksAndInvalidate() override { config.onInvalidated(); }
-  void cancelAllTasks() override {}
-  HttpSessionConfiguration config;
-};
-
 // Guards against: a cancelled flush going on without a listener, or stopping with one.
 TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
   TestEnvironment env;
@@ -36,9 +27,9 @@ TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
 // Guards against: upload sessions that do not hold a transaction while open, or lose their settings.
 TEST(UploadSessionTransactions, TwoMadeOneInvalidatedLeavesOneOpen) {
   TestEnvironment env;
-  std::vector<std::shared_ptr<RecordingSession>> made;
+  std::vector<std::shared_ptr<FakeHttpSession>> made;
   env.httpSessionFactory = [&](HttpSessionConfiguration c) {
-    made.push_back(std::make_shared<RecordingSession>(std::move(c)));
+    made.push_back(std::make_shared<FakeHttpSession>(std::move(c)));
     return made.back();
   };
   env.defaults().setObject("VIRUploadPinnedPublicKeys", "sha256//abc");

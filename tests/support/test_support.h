@@ -111,6 +111,26 @@ class RecordingConduit final : public ClientConduit {
   std::vector<std::string> received;
 };
 
+// An upload session that keeps each task for the test to answer; invalidating
+// it tells its owner at once, as a real one does when no task is left.
+class FakeHttpSession final : public HttpClientSession {
+ public:
+  explicit FakeHttpSession(HttpSessionConfiguration c) : config(std::move(c)) {}
+  void uploadFile(HttpRequest request, fs::path body, HttpCompletion completion) override {
+    tasks.push_back({std::move(request), std::move(body), std::move(completion)});
+  }
+  void finishTasksAndInvalidate() override { config.onInvalidated(); }
+  void cancelAllTasks() override {}
+
+  struct Task {
+    HttpRequest request;
+    fs::path body;
+    HttpCompletion completion;
+  };
+  HttpSessionConfiguration config;
+  std::vector<Task> tasks;
+};
+
 // Writes `bytes` to `path` (creating parent directories), mode 0600.
 void writeFile(const fs::path& path, std::string_view bytes);
 std::string readFile(const fs::path& path);

@@ -16,23 +16,6 @@ using namespace std::chrono_literals;
 constexpr std::string_view kSessionName =
     "session.412.6F9619FF-8B86-D011-B42D-00C04FC964FF.processing";
 
-// Keeps each task for the test to answer.
-class FakeHttpSession final : public HttpClientSession {
- public:
-  void uploadFile(HttpRequest request, fs::path body, HttpCompletion completion) override {
-    tasks.push_back({std::move(request), std::move(body), std::move(completion)});
-  }
-  void finishTasksAndInvalidate() override {}
-  void cancelAllTasks() override {}
-
-  struct Task {
-    HttpRequest request;
-    fs::path body;
-    HttpCompletion completion;
-  };
-  std::vector<Task> tasks;
-};
-
 corevireon::CVClientSession sampleSession() {
   corevireon::CVClientSession session;
   session.set_countrycode("US");
@@ -43,8 +26,8 @@ corevireon::CVClientSession sampleSession() {
 class UploadManagerTest : public ::testing::Test, public UploadManagerDelegate {
  protected:
   void SetUp() override {
-    env.httpSessionFactory = [this](HttpSessionConfiguration) {
-      sessions.push_back(std::make_shared<FakeHttpSession>());
+    env.httpSessionFactory = [this](HttpSessionConfiguration c) {
+      sessions.push_back(std::make_shared<FakeHttpSession>(std::move(c)));
       return sessions.back();
     };
     env.writeBag({{"feedback_url", "https://feedback.example.net/upload"},

@@ -46,10 +46,10 @@ class WhitelistUpdates : public ::testing::Test {
     deps.vexaAppQuerier = querier;
     deps.notifications = poster;
     controller = std::make_unique<InstalledAppController>(env.assembly(), std::move(deps));
-    writeFile(resourcePath(), whitelistDocument({{"org.example.Mail", entry(0)}}));
+    writeFile(env.dirs.dataHome / "vireond" / "app-whitelist.json",
+              whitelistDocument({{"org.example.Mail", entry(0)}}));
   }
 
-  fs::path resourcePath() const { return env.dirs.dataHome / "vireond" / "app-whitelist.json"; }
   fs::path assistantList() const { return env.cacheDir() / "assistant-apps.json"; }
   int openTransactions() { return env.transactions->openCount(); }
   // Makes a request and lets the queue take it in (arming the timer).
