@@ -80,7 +80,10 @@ TEST_F(CohortSchedule, ADayIsNeverDueInItsFirstHourAndAlwaysADayLater) {
   }
   on([&] { store->lastAggregations().erase(FlushFrequency::weekly); });
   makeScheduler(localTime(2040, 1, 1));
-  on([&] { EXPECT_FALSE(scheduler->shouldAggregate(FlushFrequency::weekly)) << "a frequency without a marker"; });
+  on([&] {
+    EXPECT_FALSE(scheduler->shouldAggregate(FlushFrequency::weekly))
+        << "a frequency without a marker";
+  });
 }
 
 TEST_F(CohortSchedule, CatchingUpCoversLeapFebruaryAndTheWeekAcrossNewYear) {

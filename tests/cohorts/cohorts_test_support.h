@@ -59,7 +59,9 @@ inline corevireon::CVClientSession makeSession(const std::string& agent, SystemT
   s.mutable_feedbacks();
   return s;
 }
-inline corevireon::CVFeedbackPayload* addItem(corevireon::CVClientSession& s) { return s.mutable_feedbacks()->add_items(); }
+inline corevireon::CVFeedbackPayload* addItem(corevireon::CVClientSession& s) {
+  return s.mutable_feedbacks()->add_items();
+}
 inline void addDidGoToSite(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosite(); }
 inline void addDidGoToSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosearch(); }
 

@@ -62,7 +62,9 @@ TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecordButNewsOnlyA
     addResultEngagement(s, ResultFields{});
     report(s);
   }
-  EXPECT_EQ(sql("SELECT group_concat(clientIntVal) FROM (SELECT clientIntVal FROM VIRCategory ORDER BY 1)"), "1,2,3,4");
+  EXPECT_EQ(sql("SELECT group_concat(clientIntVal) FROM (SELECT clientIntVal FROM VIRCategory "
+                "ORDER BY 1)"),
+            "1,2,3,4");
   for (const char* table : {kWayfin, kScoutlume, kImages}) EXPECT_EQ(rows(table), 1) << table;
   EXPECT_EQ(sql("SELECT count(*) FROM VIRUsageEvent WHERE timestamp = " + std::to_string(secondsSinceEpoch(start))),
             "4");

@@ -50,7 +50,8 @@ class PeriodicRun : public ::testing::Test {
   LogCapture logs;
 
   std::shared_ptr<Activity> activity(ActivityState state = ActivityState::run) {
-    return std::make_shared<Activity>(ActivityCriteria{std::chrono::hours(6), false, true}, *power, state);
+    return std::make_shared<Activity>(ActivityCriteria{std::chrono::hours(6), false, true}, *power,
+                                      state);
   }
   void bag() { env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}}); }
 };
@@ -123,7 +124,8 @@ class Scheduling : public PeriodicRun {
   std::unique_ptr<PeriodicActivityScheduler> start() {
     bag();
     env.defaults().setObject("FBFNoExit", true);
-    auto s = std::make_unique<PeriodicActivityScheduler>(env.assembly(), queue, power, recorder.hooks(), lastRunFile);
+    auto s = std::make_unique<PeriodicActivityScheduler>(env.assembly(), queue, power,
+                                                         recorder.hooks(), lastRunFile);
     s->start();
     queue->drain();
     env.manualQueue->drain();
@@ -157,7 +159,8 @@ TEST_F(Scheduling, AnUnwritableLastRunRecordStillWaitsAnIntervalBeforeTheNextRun
 }
 
 TEST_F(Scheduling, RecentRunArmsTheTimerInstead) {
-  writeFile(lastRunFile, std::to_string(secondsSinceEpoch(env.clock->now() - std::chrono::hours(1))));
+  writeFile(lastRunFile,
+            std::to_string(secondsSinceEpoch(env.clock->now() - std::chrono::hours(1))));
   auto s = start();
   EXPECT_EQ(recorder.flushes, 0);
   // Five hours later (the stored time is decimal seconds, so allow a

@@ -161,7 +161,8 @@ int lossCount(const std::vector<nlohmann::json>& events) {
 }
 
 size_t delivered(const std::vector<nlohmann::json>& records) {
-  return std::ranges::count_if(records, [](const nlohmann::json& r) { return r.value("status", 0) == 200; });
+  return std::ranges::count_if(records,
+                               [](const nlohmann::json& r) { return r.value("status", 0) == 200; });
 }
 
 std::vector<nlohmann::json> jsonLines(const fs::path& file) {

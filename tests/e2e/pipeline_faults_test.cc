@@ -44,7 +44,8 @@ TEST_F(PipelineFaults, HundredsOfSessionsUnderALowDescriptorLimitAllArrive) {
   flush();
   // Everything on disk was delivered, nothing dropped on the way.
   EXPECT_EQ(home.sessionFiles().size(), 0u);
-  EXPECT_EQ(lossCount(home.deletionEvents()), 0) << nlohmann::json(home.deletionEvents()).dump().substr(0, 2000);
+  EXPECT_EQ(lossCount(home.deletionEvents()), 0)
+      << nlohmann::json(home.deletionEvents()).dump().substr(0, 2000);
   EXPECT_GE(delivered(receiver->records()), static_cast<size_t>(sessions));
   EXPECT_EQ(home.daemonLog().find("Too many open files"), std::string::npos) << tail(home.daemonLog());
 }

@@ -52,7 +52,8 @@ TEST_F(TheCommandLine, DefaultsWritesReadsAndDeletesWithoutTheDaemon) {
   EXPECT_FALSE(fs::exists(env.dirs.preferencesDir() / "vireond.plist"));
   EXPECT_EQ(cli({"defaults", "write", "vireond", "Name", "plain text"}).status, 0);
   EXPECT_EQ(cli({"defaults", "read", "vireond", "Name"}).out, "plain text\n");
-  EXPECT_EQ(env.fileManager->attributes(env.dirs.preferencesDir() / "vireond.plist").value().mode, 0600u);
+  EXPECT_EQ(env.fileManager->attributes(env.dirs.preferencesDir() / "vireond.plist").value().mode,
+            0600u);
   EXPECT_EQ(cli({"defaults", "delete", "vireond", "Name"}).status, 0);
   EXPECT_EQ(cli({"defaults", "read", "vireond", "Name"}).err, "fbfctl: no value for Name in domain vireond\n");
 }
