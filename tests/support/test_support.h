@@ -7,6 +7,7 @@
 
 #include <spdlog/sinks/base_sink.h>
 
+#include <atomic>
 #include <deque>
 #include <mutex>
 #include <string>
@@ -14,25 +15,16 @@
 
 namespace fbf::testing {
 
+// Read from any thread; moved by the test's own thread only.
 class FakeClock final : public Clock {
  public:
   explicit FakeClock(SystemTime start = std::chrono::system_clock::now()) : now_(start) {}
-  SystemTime now() const override {
-    std::lock_guard l(m_);
-    return now_;
-  }
-  void set(SystemTime t) {
-    std::lock_guard l(m_);
-    now_ = t;
-  }
-  void advance(std::chrono::system_clock::duration d) {
-    std::lock_guard l(m_);
-    now_ += d;
-  }
+  SystemTime now() const override { return now_; }
+  void set(SystemTime t) { now_ = t; }
+  void advance(std::chrono::system_clock::duration d) { now_ = now_.load() + d; }
 
  private:
-  mutable std::mutex m_;
-  SystemTime now_;
+  std::atomic<SystemTime> now_;
 };
 
 // Runs nothing until drained; timers fire when time is advanced by hand.
