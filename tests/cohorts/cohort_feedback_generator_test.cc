@@ -5,7 +5,6 @@
 #include "cohorts/cohorts_usage_store.h"
 #include "cohorts_test_support.h"
 
-#include <sys/stat.h>
 #include <unicode/locid.h>
 
 namespace fbf::testing {
@@ -31,13 +30,6 @@ std::vector<std::string> summaries(const std::vector<CVUsageEnvelope>& envelopes
   }
   return out;
 }
-
-class RecordingConduit final : public ClientConduit {
- public:
-  void willUploadData(const std::string&, const std::string&) override {}
-  void willGenerateCohortFeebacks(const std::string& data) override { received.push_back(data); }
-  std::vector<std::string> received;
-};
 
 // Guards against: envelopes for the wrong period, client order, lookback or active days; markers not advanced; shares or engagement totals computed or formatted wrongly; files or listener calls missing.
 class CohortEnvelopes : public OpenStore {
@@ -66,9 +58,7 @@ class CohortEnvelopes : public OpenStore {
     std::vector<CVUsageEnvelope> out;
     for (const auto& entry : fs::directory_iterator(env.cacheDir() / "CustomFeedback" / "Usage")) {
       EXPECT_EQ(entry.path().filename().string().rfind("cohorts.", 0), 0u) << entry.path();
-      struct stat st {};
-      EXPECT_EQ(stat(entry.path().c_str(), &st), 0);
-      EXPECT_EQ(st.st_mode & 0777, 0600u);
+      EXPECT_EQ(env.fileManager->attributes(entry.path()).value().mode, 0600u);
       out.push_back(decode(readFile(entry.path())).usageenvelope());
     }
     return out;

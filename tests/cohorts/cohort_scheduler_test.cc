@@ -47,11 +47,6 @@ class CohortSchedule : public OpenStore {
                                                   std::make_shared<SeededRandomSource>(seed));
     return *scheduler;
   }
-  bool shouldAggregate(FlushFrequency f) {
-    bool answer = false;
-    on([&] { answer = scheduler->shouldAggregate(f); });
-    return answer;
-  }
 
   std::unique_ptr<CohortScheduler> scheduler;
   RecordingGenerator* recorder = nullptr;
@@ -85,7 +80,10 @@ TEST_F(CohortSchedule, ADayIsNeverDueInItsFirstHourAndAlwaysADayLater) {
   }
   on([&] { store->lastAggregations().erase(FlushFrequency::weekly); });
   makeScheduler(localTime(2040, 1, 1));
-  EXPECT_FALSE(shouldAggregate(FlushFrequency::weekly)) << "a frequency without a marker";
+  on([&] {
+    EXPECT_FALSE(scheduler->shouldAggregate(FlushFrequency::weekly))
+        << "a frequency without a marker";
+  });
 }
 
 TEST_F(CohortSchedule, CatchingUpCoversLeapFebruaryAndTheWeekAcrossNewYear) {

@@ -4,7 +4,6 @@
 #pragma once
 
 #include "cohorts/object_graph_storage_container.h"
-#include "corevireon.pb.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>
@@ -60,8 +59,9 @@ inline corevireon::CVClientSession makeSession(const std::string& agent, SystemT
   s.mutable_feedbacks();
   return s;
 }
-inline corevireon::CVFeedbackPayload* addItem(corevireon::CVClientSession& s) { return s.mutable_feedbacks()->add_items(); }
-inline void addSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_startlocalsearch()->set_input("weather"); }
+inline corevireon::CVFeedbackPayload* addItem(corevireon::CVClientSession& s) {
+  return s.mutable_feedbacks()->add_items();
+}
 inline void addDidGoToSite(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosite(); }
 inline void addDidGoToSearch(corevireon::CVClientSession& s) { addItem(s)->mutable_didgotosearch(); }
 

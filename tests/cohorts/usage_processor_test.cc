@@ -30,7 +30,7 @@ class UsageCounting : public OpenStore {
   }
   CVClientSession searched(const char* agent) {
     auto s = makeSession(agent, start);
-    addSearch(s);
+    addItem(s)->mutable_startlocalsearch()->set_input("weather");
     return s;
   }
   // The one counter record of the entity, as "name=value" for every non-zero
@@ -51,9 +51,6 @@ class UsageCounting : public OpenStore {
     });
     return out;
   }
-  std::string clients() {
-    return sql("SELECT group_concat(clientIntVal) FROM (SELECT clientIntVal FROM VIRCategory ORDER BY 1)");
-  }
 
   SystemTime start = utcTime(2030, 4, 2, 9, 30);
   std::unique_ptr<UsageProcessor> processor;
@@ -65,7 +62,9 @@ TEST_F(UsageCounting, EachSurfaceGetsASentinelAndItsOwnCounterRecordButNewsOnlyA
     addResultEngagement(s, ResultFields{});
     report(s);
   }
-  EXPECT_EQ(clients(), "1,2,3,4");
+  EXPECT_EQ(sql("SELECT group_concat(clientIntVal) FROM (SELECT clientIntVal FROM VIRCategory "
+                "ORDER BY 1)"),
+            "1,2,3,4");
   for (const char* table : {kWayfin, kScoutlume, kImages}) EXPECT_EQ(rows(table), 1) << table;
   EXPECT_EQ(sql("SELECT count(*) FROM VIRUsageEvent WHERE timestamp = " + std::to_string(secondsSinceEpoch(start))),
             "4");

@@ -5,11 +5,8 @@
 
 #include <thread>
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
-
-using testing::LogCapture;
-using testing::TestEnvironment;
 
 class FixedPower final : public PowerSource {
  public:
@@ -48,12 +45,13 @@ struct RecordingHooks {
 class PeriodicRun : public ::testing::Test {
  protected:
   TestEnvironment env;
-  FixedPower power;
+  std::shared_ptr<FixedPower> power = std::make_shared<FixedPower>();
   RecordingHooks recorder;
   LogCapture logs;
 
   std::shared_ptr<Activity> activity(ActivityState state = ActivityState::run) {
-    return std::make_shared<Activity>(ActivityCriteria{std::chrono::hours(6), false, true}, power, state);
+    return std::make_shared<Activity>(ActivityCriteria{std::chrono::hours(6), false, true}, *power,
+                                      state);
   }
   void bag() { env.writeBag({{"feedback_url", "https://127.0.0.1:1/"}}); }
 };
@@ -111,7 +109,7 @@ TEST_F(PeriodicRun, GoingOnBatteryDefersTheRunningFlush) {
   auto a = activity();
   std::thread handler([&] { doPeriodicConduitActivity(a, env.assembly(), recorder.hooks()); });
   // The handler polls once a second; it must see the change and stop the flush.
-  power.battery = true;
+  power->battery = true;
   handler.join();
   EXPECT_EQ(recorder.stops, 1);
   EXPECT_TRUE(logs.contains("Deferring flush."));
@@ -121,14 +119,13 @@ TEST_F(PeriodicRun, GoingOnBatteryDefersTheRunningFlush) {
 // Guards against: a due run skipped or repeated, a flush at check-in, a recent run not waited for, a run on battery, or an unreadable last-run record blocking flushes.
 class Scheduling : public PeriodicRun {
  protected:
-  std::shared_ptr<testing::ManualQueue> queue = std::make_shared<testing::ManualQueue>("activity");
-  std::shared_ptr<FixedPower> sharedPower = std::make_shared<FixedPower>();
+  std::shared_ptr<ManualQueue> queue = std::make_shared<ManualQueue>("activity");
   fs::path lastRunFile = env.cacheDir() / "fbf-last-flush";
-  fs::path lastRun() { return lastRunFile; }
   std::unique_ptr<PeriodicActivityScheduler> start() {
     bag();
     env.defaults().setObject("FBFNoExit", true);
-    auto s = std::make_unique<PeriodicActivityScheduler>(env.assembly(), queue, sharedPower, recorder.hooks(), lastRun());
+    auto s = std::make_unique<PeriodicActivityScheduler>(env.assembly(), queue, power,
+                                                         recorder.hooks(), lastRunFile);
     s->start();
     queue->drain();
     env.manualQueue->drain();
@@ -137,7 +134,7 @@ class Scheduling : public PeriodicRun {
 };
 
 TEST_F(Scheduling, FirstStartOrAnUnreadableLastRunRunsAtOnceAndRemembersTheRun) {
-  testing::writeFile(lastRun(), "yesterday");
+  writeFile(lastRunFile, "yesterday");
   auto s = start();
   EXPECT_EQ(recorder.flushes, 1);
   EXPECT_TRUE(logs.contains("Ignoring unreadable last-run file"));
@@ -146,10 +143,10 @@ TEST_F(Scheduling, FirstStartOrAnUnreadableLastRunRunsAtOnceAndRemembersTheRun) 
   // The run is stored to the microsecond.
   EXPECT_NEAR(std::chrono::duration<double>(*next - env.clock->now()).count(),
               static_cast<double>(PeriodicActivityScheduler::kDefaultInterval.count()), 1.0);
-  fs::remove(lastRun());
+  fs::remove(lastRunFile);
   start();
   EXPECT_EQ(recorder.flushes, 2);
-  EXPECT_TRUE(fs::exists(lastRun()));
+  EXPECT_TRUE(fs::exists(lastRunFile));
 }
 
 TEST_F(Scheduling, AnUnwritableLastRunRecordStillWaitsAnIntervalBeforeTheNextRun) {
@@ -162,7 +159,8 @@ TEST_F(Scheduling, AnUnwritableLastRunRecordStillWaitsAnIntervalBeforeTheNextRun
 }
 
 TEST_F(Scheduling, RecentRunArmsTheTimerInstead) {
-  testing::writeFile(lastRun(), std::to_string(secondsSinceEpoch(env.clock->now() - std::chrono::hours(1))));
+  writeFile(lastRunFile,
+            std::to_string(secondsSinceEpoch(env.clock->now() - std::chrono::hours(1))));
   auto s = start();
   EXPECT_EQ(recorder.flushes, 0);
   // Five hours later (the stored time is decimal seconds, so allow a
@@ -174,14 +172,14 @@ TEST_F(Scheduling, RecentRunArmsTheTimerInstead) {
 }
 
 TEST_F(Scheduling, DueRunWaitsWhileOnBatteryUnlessOverridden) {
-  sharedPower->battery = true;
+  power->battery = true;
   auto s = start();
   EXPECT_EQ(recorder.flushes, 0);
-  sharedPower->battery = false;
+  power->battery = false;
   queue->advance(PeriodicActivityScheduler::kBatteryRecheck);
   env.manualQueue->drain();
   EXPECT_EQ(recorder.flushes, 1);
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

@@ -1,9 +1,8 @@
 #include "e2e/daemon_home.h"
 
-#include "platform/property_list.h"
-
 #include <signal.h>
 
+#include <algorithm>
 #include <fstream>
 
 namespace fbf::testing {
@@ -54,9 +53,7 @@ void Receiver::stop() {
 
 DaemonHome::DaemonHome() : dirs_(XdgDirectories::underRoot(home_.path())), env_(xdgEnvironment(home_.path())) {}
 
-DaemonHome::~DaemonHome() {
-  if (daemon_) stopDaemon();
-}
+DaemonHome::~DaemonHome() { stopDaemon(); }
 
 void DaemonHome::writeBag(const std::string& url, const nlohmann::json& extra) {
   nlohmann::json bag = {{"feedback_url", url},
@@ -159,15 +156,13 @@ std::map<int, int> lossesByReason(const std::vector<nlohmann::json>& events) {
 }
 
 int lossCount(const std::vector<nlohmann::json>& events) {
-  int n = 0;
-  for (const auto& [reason, count] : lossesByReason(events)) n += count;
-  return n;
+  auto isLoss = [](const nlohmann::json& e) { return e.at("reason").get<int>() != kUploaded; };
+  return static_cast<int>(std::ranges::count_if(events, isLoss));
 }
 
 size_t delivered(const std::vector<nlohmann::json>& records) {
-  size_t n = 0;
-  for (const auto& r : records) n += r.value("status", 0) == 200;
-  return n;
+  return std::ranges::count_if(records,
+                               [](const nlohmann::json& r) { return r.value("status", 0) == 200; });
 }
 
 std::vector<nlohmann::json> jsonLines(const fs::path& file) {

@@ -107,7 +107,6 @@ TEST_F(HealthyReceiver, FlushSessionIsRefusedOutsideTheCacheDirectory) {
 using FailingReceiver = ReceiverTest;
 
 TEST_F(FailingReceiver, ReceiverDownCancelsTheFlushAndLosesNothing) {
-  const int port = receiver->port();
   receiver->stop();
   ASSERT_EQ(home.generate(6, 3, 13).status, 0);
   home.startDaemon();
@@ -118,8 +117,7 @@ TEST_F(FailingReceiver, ReceiverDownCancelsTheFlushAndLosesNothing) {
   EXPECT_EQ(lossCount(home.deletionEvents()), 0);
 
   // The cancellation ended that flush only: the next one delivers all, once.
-  receiver = std::make_unique<Receiver>(home.root(), port);
-  ASSERT_TRUE(receiver->running());
+  restartReceiver();
   flush();
   const auto records = receiver->records();
   EXPECT_EQ(deliveredIntact(records), 9u);

@@ -35,12 +35,6 @@ class UploadContent : public ReceiverTest {
     ReceiverTest::SetUp();
     home.startDaemon();
   }
-
-  std::string explainRaw(const fs::path& path) {
-    auto r = home.fbfctl({"explain", "--raw", path.string()});
-    EXPECT_EQ(r.status, 0) << path << ": " << r.err;
-    return r.out;
-  }
 };
 
 TEST_F(UploadContent, ExplainRefusesWhatIsNotAPendingFileOfTheCacheDirectory) {
@@ -179,7 +173,9 @@ TEST_F(UploadContent, NothingOutsideTheReadmeTableLeavesTheDevice) {
 
     // explain writes exactly what the next flush uploads, and sends nothing.
     const size_t before = receiver->records().size();
-    const std::string payload = explainRaw(path);
+    const auto explained = home.fbfctl({"explain", "--raw", path.string()});
+    ASSERT_EQ(explained.status, 0) << explained.err;
+    const std::string& payload = explained.out;
     flush();
     auto records = receiver->records();
     ASSERT_EQ(records.size(), before + 1) << format;

@@ -4,8 +4,6 @@
 // with the tests' own signature reader. Few daemon launches, no sleeps: the
 // "soon" delay is set to zero and changes are polled for.
 #include "e2e/daemon_home.h"
-#include "platform/file_manager.h"
-#include "platform/user_defaults.h"
 #include "whitelist/signature_decoder.h"
 
 #include <fmt/format.h>
@@ -61,7 +59,6 @@ class WhitelistDaemon : public ::testing::Test {
   fs::path userApps() const { return dirs.dataHome / "applications"; }
   fs::path sharedApps() const { return dirs.dataDirs.front() / "applications"; }
   fs::path userResource() const { return dirs.dataHome / "vireond" / "app-whitelist.json"; }
-  fs::path sharedResource() const { return dirs.dataDirs.front() / "vireond" / "app-whitelist.json"; }
   fs::path assistantList() const { return home.cacheDir() / "assistant-apps.json"; }
   std::string log() const { return home.daemonLog(); }
   bool logged(const std::string& line) const { return log().find(line) != std::string::npos; }
@@ -69,11 +66,10 @@ class WhitelistDaemon : public ::testing::Test {
     home.startDaemon();
     ASSERT_TRUE(logged("setup")) << log();
   }
-  RunResult ctl(const std::vector<std::string>& args) { return home.fbfctl(args); }
 
   // What `fbfctl update-whitelists CONDITION` printed; fails the test on a non-zero exit.
   std::string update(const std::string& condition) {
-    auto r = ctl({"update-whitelists", condition});
+    auto r = home.fbfctl({"update-whitelists", condition});
     EXPECT_EQ(r.status, 0) << r.err << log();
     while (!r.out.empty() && r.out.back() == '\n') r.out.pop_back();
     return r.out;
@@ -121,7 +117,7 @@ TEST_F(WhitelistDaemon, EachConditionPrintsAndStoresTheSignatureOfInstalledWhite
       {"org.example.Mail", 0}, {"org.example.Todo", 1}, {"a-b-c", 2}, {"org.example.Maps", 3}, {"shown", 4},
       {"org.example.Notes", 5}, {"org.example.Site", 7}, {"org.example.Broken", 8}, {"vendor-tool", 9},
       {"readme", 11}, {"org.example.NotInstalled", 12}, {"loop-org.example.Mail", 13}};
-  writeFile(sharedResource(), whitelistDocument(ids));
+  writeFile(dirs.dataDirs.front() / "vireond" / "app-whitelist.json", whitelistDocument(ids));
   ASSERT_TRUE(store->defaultsForDomain("vireon.assistant")->setObject("Assistant Enabled", true));
   ASSERT_TRUE(store->defaultsForDomain("vireon.scoutlume")
                   ->setObject("DisabledApplications", PropertyList::array({"org.vireon.Notes"})));
@@ -153,7 +149,7 @@ TEST_F(WhitelistDaemon, EachConditionPrintsAndStoresTheSignatureOfInstalledWhite
   EXPECT_TRUE(carries(update("now"), {1, 2, 3, 4, 9, 20}));
   EXPECT_TRUE(carries(stored(), {1, 2, 3, 4, 9, 20}));
 
-  auto refused = ctl({"update-whitelists", "later"});
+  auto refused = home.fbfctl({"update-whitelists", "later"});
   EXPECT_NE(refused.status, 0);
   EXPECT_NE(refused.err.find("later"), std::string::npos) << refused.err;
 }

@@ -2,14 +2,11 @@
 // upload manager that prepares requests without compressing and holds every
 // upload until the test settles it, so a test decides when (and how) each
 // upload ends.
+#include "flushing/feedback_flusher.h"
 #include "assembly/fbf_strings.h"
 #include "assembly/feedback_types.h"
-#include "flushing/feedback_flusher.h"
-#include "flushing/session_filename.h"
-#include "flushing/upload_manager_protocol.h"
 #include "flushing/flushing_test_util.h"
 #include "processing/processing_builders.h"
-#include "support/test_support.h"
 
 #include <algorithm>
 #include <cstdio>

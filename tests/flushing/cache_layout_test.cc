@@ -1,4 +1,3 @@
-#include "assembly/feedback_deletion_event.h"
 #include "flushing/flushing_test_util.h"
 
 #include <sys/stat.h>

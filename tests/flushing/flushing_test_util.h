@@ -4,7 +4,6 @@
 
 #include "flushing/cache_layout.h"
 #include "flushing/feedback_enumerator.h"
-#include "flushing/session_filename.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>

@@ -1,21 +1,9 @@
-#include "assembly/fbf_assembly.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
-
-using testing::TestEnvironment;
-
-class RecordingSession final : public HttpClientSession {
- public:
-  explicit RecordingSession(HttpSessionConfiguration c) : config(std::move(c)) {}
-  void uploadFile(HttpRequest, std::filesystem::path, HttpCompletion) override {}
-  void finishTasksAndInvalidate() override { config.onInvalidated(); }
-  void cancelAllTasks() override {}
-  HttpSessionConfiguration config;
-};
 
 // Guards against: a cancelled flush going on without a listener, or stopping with one.
 TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
@@ -29,24 +17,19 @@ TEST(AssemblyFlags, ShouldProceedHonoursListenersOverCancellation) {
   EXPECT_TRUE(check());
   a.setCancelled(true);
   EXPECT_FALSE(check());
-
-  struct Listener final : ClientConduit {
-    void willUploadData(const std::string&, const std::string&) override {}
-    void willGenerateCohortFeebacks(const std::string&) override {}
-  };
-  a.setCohortsListener(std::make_shared<Listener>());
+  a.setCohortsListener(std::make_shared<RecordingConduit>());
   EXPECT_TRUE(check());
   a.setCohortsListener(nullptr);
-  a.setUploadListener(std::make_shared<Listener>());
+  a.setUploadListener(std::make_shared<RecordingConduit>());
   EXPECT_TRUE(check());
 }
 
 // Guards against: upload sessions that do not hold a transaction while open, or lose their settings.
 TEST(UploadSessionTransactions, TwoMadeOneInvalidatedLeavesOneOpen) {
   TestEnvironment env;
-  std::vector<std::shared_ptr<RecordingSession>> made;
+  std::vector<std::shared_ptr<FakeHttpSession>> made;
   env.httpSessionFactory = [&](HttpSessionConfiguration c) {
-    made.push_back(std::make_shared<RecordingSession>(std::move(c)));
+    made.push_back(std::make_shared<FakeHttpSession>(std::move(c)));
     return made.back();
   };
   env.defaults().setObject("VIRUploadPinnedPublicKeys", "sha256//abc");
@@ -83,4 +66,4 @@ TEST(CleanExit, WaitsForTheLastOpenTransactionAndHappensOnce) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

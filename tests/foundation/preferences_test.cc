@@ -1,16 +1,9 @@
-#include "assembly/configuration_bag.h"
-#include "platform/property_list.h"
-#include "platform/user_defaults.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
-
-using testing::LogCapture;
-using testing::TestEnvironment;
-using testing::writeFile;
 
 // Guards against: preferences read once and cached, read with the wrong type or default, or losing other keys when written.
 class PreferencesFiles : public ::testing::Test {
@@ -140,4 +133,4 @@ TEST(PropertyListFindings, BinaryStringsThatAreNotTextAreRefused) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

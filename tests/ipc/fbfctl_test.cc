@@ -5,8 +5,6 @@
 #include "fbfctl/fbfctl.h"
 #include "ipc_fixture.h"
 
-#include <sys/stat.h>
-
 #include <sstream>
 
 namespace fbf::testing {
@@ -54,9 +52,8 @@ TEST_F(TheCommandLine, DefaultsWritesReadsAndDeletesWithoutTheDaemon) {
   EXPECT_FALSE(fs::exists(env.dirs.preferencesDir() / "vireond.plist"));
   EXPECT_EQ(cli({"defaults", "write", "vireond", "Name", "plain text"}).status, 0);
   EXPECT_EQ(cli({"defaults", "read", "vireond", "Name"}).out, "plain text\n");
-  struct stat st {};
-  ASSERT_EQ(stat((env.dirs.preferencesDir() / "vireond.plist").c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(env.fileManager->attributes(env.dirs.preferencesDir() / "vireond.plist").value().mode,
+            0600u);
   EXPECT_EQ(cli({"defaults", "delete", "vireond", "Name"}).status, 0);
   EXPECT_EQ(cli({"defaults", "read", "vireond", "Name"}).err, "fbfctl: no value for Name in domain vireond\n");
 }

@@ -15,6 +15,7 @@
 
 #include <asio.hpp>
 
+#include <atomic>
 #include <chrono>
 #include <future>
 #include <mutex>
@@ -43,10 +44,7 @@ class FakeFlushRunner final : public FlushRunner {
   }
 
   // When held, completions wait for `releaseAll` (called on the work queue).
-  void holdCompletions(bool hold) {
-    std::lock_guard l(m_);
-    hold_ = hold;
-  }
+  void holdCompletions(bool hold) { hold_ = hold; }
   void releaseAll() {
     std::vector<std::function<void()>> held;
     {
@@ -74,7 +72,7 @@ class FakeFlushRunner final : public FlushRunner {
   }
 
   mutable std::mutex m_;
-  bool hold_ = false;
+  std::atomic<bool> hold_ = false;
   std::vector<std::string> calls_;
   std::vector<std::function<void()>> held_;
 };

@@ -2,10 +2,9 @@
 #include "flushing/url_matching.h"
 #include "processing/processing_builders.h"
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
 
-using namespace fbf::testing;
 using std::nullopt;
 
 // Guards against: a wrong match level between a shown address and a visited one (suffixes, AMP, queries, IPs).
@@ -101,4 +100,4 @@ TEST(EngagedVisitFilter, KeepsMatchedVisitsWithTheirBestLevelAndNoAddress) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

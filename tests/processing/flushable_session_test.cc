@@ -1,11 +1,9 @@
-#include "flushing/flushable_session.h"
 #include "flushing/session_payload.h"
 #include "processing/processing_builders.h"
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
 
-using namespace fbf::testing;
 using corevireon::CVClientSession;
 using corevireon::CVFeedbackPayload;
 
@@ -135,4 +133,4 @@ TEST(SessionPayloads, CarryNoUnknownFieldAndNeedFeedback) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

@@ -1,11 +1,10 @@
 #include "flushing/reporters.h"
 #include "processing/processing_builders.h"
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
 
 using corevireon::CVClient;
-using fbf::testing::pb;
 
 // Guards against: an agent read as the wrong client surface (case, rule order, absent agent).
 TEST(ClientFromAgent, MatchesTheLowerCasedAgentFirstRuleWins) {
@@ -67,4 +66,4 @@ TEST(Keystrokes, NeedInputAndNetworkEndpoint12NeverCounts) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

@@ -2,10 +2,9 @@
 #include "flushing/session_json.h"
 #include "processing/processing_builders.h"
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
 
-using namespace fbf::testing;
 using corevireon::CVClientSession;
 using corevireon::CVFeedbackPayload;
 
@@ -100,4 +99,4 @@ TEST(DictionaryForm, BytesAreBase64AndMapsAreSortedObjects) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

@@ -2,10 +2,9 @@
 #include "flushing/session_processing_helper.h"
 #include "processing/processing_builders.h"
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
 
-using namespace fbf::testing;
 using corevireon::CVFeedbackPayload;
 using corevireon::CVSearchResultForFeedback;
 
@@ -173,4 +172,4 @@ TEST(Redaction, ClearsQueryTextsAndPunchoutExceptForType1) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

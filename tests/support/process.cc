@@ -90,8 +90,7 @@ ChildProcess::ChildProcess(const std::filesystem::path& program, const std::vect
 ChildProcess::~ChildProcess() {
   if (pid_ > 0 && !status_) {
     kill(pid_, SIGKILL);
-    int st = 0;
-    waitpid(pid_, &st, 0);
+    waitpid(pid_, nullptr, 0);
   }
 }
 

@@ -1,16 +1,13 @@
 #include "support/test_support.h"
 
 #include "platform/logging.h"
-#include "platform/property_list.h"
 #include "upload/device_context.h"
-
-#include <fcntl.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
+#include <utility>
 
 namespace fbf::testing {
 
@@ -40,12 +37,7 @@ void ManualQueue::async(Task task) {
 }
 
 void ManualQueue::sync(const Task& task) {
-  if (draining_) {
-    task();
-    return;
-  }
-  bool was = draining_;
-  draining_ = true;
+  bool was = std::exchange(draining_, true);
   task();
   draining_ = was;
 }
@@ -70,8 +62,7 @@ void ManualQueue::removeDelayed(uint64_t id) {
 
 size_t ManualQueue::drain() {
   size_t ran = 0;
-  bool was = draining_;
-  draining_ = true;
+  bool was = std::exchange(draining_, true);
   while (true) {
     Task t;
     {
@@ -170,15 +161,9 @@ std::vector<std::pair<std::string, nlohmann::json>> RecordingAnalytics::events()
 
 void writeFile(const fs::path& path, std::string_view bytes) {
   fs::create_directories(path.parent_path());
-  int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
-  if (fd < 0) std::abort();
-  size_t off = 0;
-  while (off < bytes.size()) {
-    ssize_t n = write(fd, bytes.data() + off, bytes.size() - off);
-    if (n <= 0) std::abort();
-    off += static_cast<size_t>(n);
-  }
-  close(fd);
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  if (!out.write(bytes.data(), static_cast<std::streamsize>(bytes.size())).flush()) std::abort();
+  fs::permissions(path, fs::perms::owner_read | fs::perms::owner_write);
 }
 
 std::string readFile(const fs::path& path) {

@@ -4,14 +4,10 @@
 #pragma once
 
 #include "assembly/fbf_assembly.h"
-#include "platform/analytics.h"
-#include "platform/file_manager.h"
-#include "platform/task_queue.h"
-#include "platform/user_defaults.h"
-#include "platform/xdg.h"
 
 #include <spdlog/sinks/base_sink.h>
 
+#include <atomic>
 #include <deque>
 #include <mutex>
 #include <string>
@@ -19,25 +15,16 @@
 
 namespace fbf::testing {
 
+// Read from any thread; moved by the test's own thread only.
 class FakeClock final : public Clock {
  public:
   explicit FakeClock(SystemTime start = std::chrono::system_clock::now()) : now_(start) {}
-  SystemTime now() const override {
-    std::lock_guard l(m_);
-    return now_;
-  }
-  void set(SystemTime t) {
-    std::lock_guard l(m_);
-    now_ = t;
-  }
-  void advance(std::chrono::system_clock::duration d) {
-    std::lock_guard l(m_);
-    now_ += d;
-  }
+  SystemTime now() const override { return now_; }
+  void set(SystemTime t) { now_ = t; }
+  void advance(std::chrono::system_clock::duration d) { now_ = now_.load() + d; }
 
  private:
-  mutable std::mutex m_;
-  SystemTime now_;
+  std::atomic<SystemTime> now_;
 };
 
 // Runs nothing until drained; timers fire when time is advanced by hand.
@@ -106,6 +93,34 @@ class RecordingAnalytics final : public AnalyticsSink {
  private:
   mutable std::mutex m_;
   std::vector<std::pair<std::string, nlohmann::json>> events_;
+};
+
+// A listener that keeps every cohort feedback it is sent.
+class RecordingConduit final : public ClientConduit {
+ public:
+  void willUploadData(const std::string&, const std::string&) override {}
+  void willGenerateCohortFeebacks(const std::string& data) override { received.push_back(data); }
+  std::vector<std::string> received;
+};
+
+// An upload session that keeps each task for the test to answer; invalidating
+// it tells its owner at once, as a real one does when no task is left.
+class FakeHttpSession final : public HttpClientSession {
+ public:
+  explicit FakeHttpSession(HttpSessionConfiguration c) : config(std::move(c)) {}
+  void uploadFile(HttpRequest request, fs::path body, HttpCompletion completion) override {
+    tasks.push_back({std::move(request), std::move(body), std::move(completion)});
+  }
+  void finishTasksAndInvalidate() override { config.onInvalidated(); }
+  void cancelAllTasks() override {}
+
+  struct Task {
+    HttpRequest request;
+    fs::path body;
+    HttpCompletion completion;
+  };
+  HttpSessionConfiguration config;
+  std::vector<Task> tasks;
 };
 
 // Writes `bytes` to `path` (creating parent directories), mode 0600.

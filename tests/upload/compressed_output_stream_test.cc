@@ -7,11 +7,8 @@
 
 #include <ostream>
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
-
-using testing::inflateRawIndependently;
-using testing::sha512Hex;
 
 long writeString(OutputStream& s, const std::string& text) {
   return s.write(reinterpret_cast<const uint8_t*>(text.data()), text.size());
@@ -44,7 +41,7 @@ TEST_F(CompressedStream, ClosedWithoutDataIsAValidEmptyStreamThatTakesNoMoreWrit
 TEST_F(CompressedStream, OneLargeWriteIsDigestedOncePerPass) {
   // Incompressible bytes fill the staging buffer several times over, so the
   // encoder takes several passes, and each digests the whole input again.
-  std::string input = testing::randomBytes(20000, 7) + std::string(100000, '\0');
+  std::string input = randomBytes(20000, 7) + std::string(100000, '\0');
   EXPECT_EQ(writeString(stream, input), static_cast<long>(input.size()));
   stream.close();
   std::string repeated = input;
@@ -94,4 +91,4 @@ TEST(FileStreamOnABadDescriptor, ReportsTheErrorOnOpen) {
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

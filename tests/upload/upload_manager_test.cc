@@ -8,34 +8,13 @@
 
 #include <gtest/gtest.h>
 
-namespace fbf {
+namespace fbf::testing {
 namespace {
 
 using namespace std::chrono_literals;
-using testing::inflateRawIndependently;
-using testing::readFile;
-using testing::sha512Hex;
-using testing::writeFile;
 
 constexpr std::string_view kSessionName =
     "session.412.6F9619FF-8B86-D011-B42D-00C04FC964FF.processing";
-
-// Keeps each task for the test to answer.
-class FakeHttpSession final : public HttpClientSession {
- public:
-  void uploadFile(HttpRequest request, fs::path body, HttpCompletion completion) override {
-    tasks.push_back({std::move(request), std::move(body), std::move(completion)});
-  }
-  void finishTasksAndInvalidate() override {}
-  void cancelAllTasks() override {}
-
-  struct Task {
-    HttpRequest request;
-    fs::path body;
-    HttpCompletion completion;
-  };
-  std::vector<Task> tasks;
-};
 
 corevireon::CVClientSession sampleSession() {
   corevireon::CVClientSession session;
@@ -47,8 +26,8 @@ corevireon::CVClientSession sampleSession() {
 class UploadManagerTest : public ::testing::Test, public UploadManagerDelegate {
  protected:
   void SetUp() override {
-    env.httpSessionFactory = [this](HttpSessionConfiguration) {
-      sessions.push_back(std::make_shared<FakeHttpSession>());
+    env.httpSessionFactory = [this](HttpSessionConfiguration c) {
+      sessions.push_back(std::make_shared<FakeHttpSession>(std::move(c)));
       return sessions.back();
     };
     env.writeBag({{"feedback_url", "https://feedback.example.net/upload"},
@@ -70,8 +49,8 @@ class UploadManagerTest : public ::testing::Test, public UploadManagerDelegate {
     return makeManager(std::move(predicates))->feedbackUploadRequest("https://h.example/u", type);
   }
 
-  testing::TestEnvironment env;
-  testing::LogCapture logs;
+  TestEnvironment env;
+  LogCapture logs;
   std::vector<std::shared_ptr<FakeHttpSession>> sessions;
   std::vector<std::pair<fs::path, long>> calls;
 };
@@ -83,8 +62,6 @@ TEST_F(UploadManagerTest, RequestsCarryTheirItemsInNameOrderAndTheRightHeaders) 
   auto r = requestFor("FeedbackV2PB", {yes, no});
   EXPECT_EQ(r.url, "https://h.example/u?key=galleon5290&seed=1&type=FeedbackV2PB&v=2");
   EXPECT_EQ(r.method, "POST");
-  EXPECT_EQ(r.timeout, 600s);
-  EXPECT_TRUE(r.ignoreLocalCache);
   EXPECT_EQ(requestFor("", {no, no}).url, "https://h.example/u?key=galleon5290&v=2");
   env.assembly().setFlushingEagerly(true);
   EXPECT_EQ(requestFor("Usage", {yes, yes}).url,
@@ -211,7 +188,7 @@ TEST_F(UploadOutcome, OnlyStatus200DeletesTheFileAndOnlyOfflineErrorsCancel) {
   auto m = makeManager();
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
-    testing::LogCapture rowLogs;
+    LogCapture rowLogs;
     env.assembly().setCancelled(false);
     auto events = env.analytics->events().size();
     writeFile(uploadFile(), "compressed");
@@ -295,4 +272,4 @@ TEST_F(UploadRetry, AStaleFileIsDroppedAndReportedAYoungOneResentWithoutDigest) 
 }
 
 }  // namespace
-}  // namespace fbf
+}  // namespace fbf::testing

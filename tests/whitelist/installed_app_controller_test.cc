@@ -6,8 +6,6 @@
 
 #include <gtest/gtest.h>
 
-#include <sys/stat.h>
-
 namespace fbf::testing {
 namespace {
 
@@ -32,11 +30,6 @@ class RecordingPoster final : public NotificationPoster {
   std::vector<std::string> posted;
 };
 
-mode_t modeOf(const fs::path& path) {
-  struct stat st {};
-  return stat(path.c_str(), &st) == 0 ? st.st_mode & 0777 : 0;
-}
-
 // A controller over the test environment's assembly, with its own hand-run
 // low-priority queue, three installed applications and a whitelist resource
 // in the temporary XDG data home. What it stores is checked through the
@@ -53,10 +46,10 @@ class WhitelistUpdates : public ::testing::Test {
     deps.vexaAppQuerier = querier;
     deps.notifications = poster;
     controller = std::make_unique<InstalledAppController>(env.assembly(), std::move(deps));
-    writeFile(resourcePath(), whitelistDocument({{"org.example.Mail", entry(0)}}));
+    writeFile(env.dirs.dataHome / "vireond" / "app-whitelist.json",
+              whitelistDocument({{"org.example.Mail", entry(0)}}));
   }
 
-  fs::path resourcePath() const { return env.dirs.dataHome / "vireond" / "app-whitelist.json"; }
   fs::path assistantList() const { return env.cacheDir() / "assistant-apps.json"; }
   int openTransactions() { return env.transactions->openCount(); }
   // Makes a request and lets the queue take it in (arming the timer).
@@ -185,7 +178,7 @@ TEST_F(WhitelistUpdates, DestroyedControllerRunsNothingMore) {
 TEST_F(WhitelistUpdates, AssistantListIsWrittenOwnerOnlyAndAnnounced) {
   ASSERT_TRUE(updateNow());
   EXPECT_EQ(readFile(assistantList()), R"(["org.vireon.Notes","seed"])");
-  EXPECT_EQ(modeOf(assistantList()), 0600u);
+  EXPECT_EQ(env.fileManager->attributes(assistantList()).value().mode, 0600u);
   EXPECT_EQ(poster->posted, (std::vector<std::string>{"vireon-fbf.skapp_data_changed"}));
   EXPECT_TRUE(logs.contains("updated whitelist file"));
 
@@ -202,7 +195,7 @@ TEST_F(WhitelistUpdates, IfStaleWorksOnlyOnAListOlderThan48Hours) {
   controller->updateWhitelists(kIfStale, [&] { done = true; });
   EXPECT_FALSE(done);
   EXPECT_EQ(readFile(assistantList()), "");  // created empty
-  EXPECT_EQ(modeOf(assistantList()), 0600u);
+  EXPECT_EQ(env.fileManager->attributes(assistantList()).value().mode, 0600u);
   queue->drain();
   queue->advance(5ms);
   EXPECT_TRUE(done);
