@@ -78,7 +78,7 @@ class FeedbackFlusher final : public UploadManagerDelegate, public std::enable_s
   static constexpr int kMaximumNumberOfFeedbackFiles = 100;
   // Uploads queued or in flight before the walk waits: enough for HTTP/2
   // streams to hide a slow server's latency, few enough to hold little.
-  static constexpr size_t kMaximumUploadsInFlight = 32;
+  static constexpr size_t kMaximumUploadsInFlight = 64;
   // Payloads handed over for compression and not back yet: one being
   // compressed and one waiting keep the encoder busy without holding more.
   static constexpr size_t kMaximumPreparations = 2;
