@@ -117,7 +117,7 @@ TEST_F(PipelineFaults, AnAbsurdAgeLimitKeepsEverythingAndTheDaemonAlive) {
 // a prompt exit 0 between files, every session still on disk, none left
 // half-claimed, and the walk stopped short.
 TEST_F(PipelineFaults, SigtermDuringStalledUploadsExitsPromptlyAndKeepsEveryFile) {
-  constexpr size_t kSessions = 60;
+  constexpr size_t kSessions = 90;  // more than the 64 the pipeline holds, fewer than pruning keeps
   restartReceiver({"--delay-ms", "120000"});
   ASSERT_EQ(home.generate(kSessions, 0, 9).status, 0);
   home.startDaemon();
