@@ -58,9 +58,11 @@ FlushableSession::FlushableSession(corevireon::CVClientSession backingStore)
 
 std::optional<FlushableSession> FlushableSession::decode(std::string_view bytes) {
   // Decoded, a session takes two to three times its encoded size: start with
-  // blocks of about that, up to 256 KiB each.
+  // blocks of about that, up to 256 KiB each. Whole pages: the arena keeps
+  // its clean-up list at the end of a block, which must stay 8-byte aligned.
+  constexpr size_t kPage = 4096;
   google::protobuf::ArenaOptions options;
-  options.start_block_size = std::clamp<size_t>(bytes.size() * 2, 4096, 256 * 1024);
+  options.start_block_size = std::clamp<size_t>((bytes.size() * 2 + kPage - 1) / kPage * kPage, kPage, 256 * 1024);
   options.max_block_size = 256 * 1024;
   auto arena = std::make_unique<google::protobuf::Arena>(options);
   auto* session = google::protobuf::Arena::CreateMessage<corevireon::CVClientSession>(arena.get());
