@@ -70,8 +70,11 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
-  corevireon::CVClientSession session;
-  if (!session.ParseFromArray(data, static_cast<int>(size))) return 0;
+  // Decoded as the flusher decodes it, into an arena of its own.
+  auto decoded = fbf::FlushableSession::decode(std::string_view(reinterpret_cast<const char*>(data), size));
+  if (!decoded) return 0;
+  fbf::FlushableSession& flushable = *decoded;
+  const corevireon::CVClientSession& session = flushable.backingStore();
   // The flusher drops sessions without feedback before processing them.
   if (!session.has_feedbacks() || session.feedbacks().items_size() == 0) return 0;
 
@@ -82,7 +85,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (carriesIdentifier(m) && identifierOf(m) && !identifierOf(m)->empty()) ++identified;
   });
 
-  fbf::FlushableSession flushable(std::move(session));
   flushable.postProcessFeedback(nullptr);
 
   walk(flushable.backingStore(), [&](const Message& m) {
