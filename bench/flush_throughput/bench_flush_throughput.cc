@@ -127,11 +127,6 @@ double cpuSeconds(const rusage& u) {
          static_cast<double>(u.ru_utime.tv_usec + u.ru_stime.tv_usec) / 1e6;
 }
 
-double statCpu(const fs::path& statFile);
-
-// User plus system CPU seconds of a running process.
-double processCpu(pid_t pid) { return statCpu("/proc/" + std::to_string(pid) + "/stat"); }
-
 // User plus system CPU seconds from a /proc stat file (a process's or a
 // thread's).
 double statCpu(const fs::path& statFile) {
@@ -147,6 +142,9 @@ double statCpu(const fs::path& statFile) {
   }
   return ticks / static_cast<double>(sysconf(_SC_CLK_TCK));
 }
+
+// User plus system CPU seconds of a running process.
+double processCpu(pid_t pid) { return statCpu("/proc/" + std::to_string(pid) + "/stat"); }
 
 // CPU seconds by thread name of a running process ("name 1.23 s, ..."),
 // the busiest first: which stage of the pipeline is the bottleneck.

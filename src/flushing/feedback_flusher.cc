@@ -267,7 +267,7 @@ void FeedbackFlusher::postProcessAndUpload(const FeedbackFile& file) {
     }
     bytes.reset();
     FlushableSession& flushable = *decoded;
-    if (!flushable.backingStore().has_feedbacks() || flushable.backingStore().feedbacks().items_size() == 0) {
+    if (!flushable.hasFeedback()) {
       log().error("Deserialized session contained no feedback.");
       return;
     }

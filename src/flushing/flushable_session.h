@@ -81,6 +81,8 @@ class FlushableSession {
 
   corevireon::CVClientSession& backingStore() { return *backingStore_; }
   const corevireon::CVClientSession& backingStore() const { return *backingStore_; }
+  // At least one feedback payload: sessions without one are never processed.
+  bool hasFeedback() const { return backingStore_->has_feedbacks() && backingStore_->feedbacks().items_size() > 0; }
 
   // A copy of the feedback list in processing order, or none when the
   // session has no list. Ascending by the feedback message's timestamp,

@@ -38,7 +38,7 @@ SessionPayload makeSessionPayload(std::string_view fileBytes, SessionPayloadForm
     return payload;
   }
   FlushableSession& flushable = *decoded;
-  if (!flushable.backingStore().has_feedbacks() || flushable.backingStore().feedbacks().items_size() == 0) {
+  if (!flushable.hasFeedback()) {
     payload.outcome = SessionPayload::Outcome::noFeedback;
     return payload;
   }

@@ -124,14 +124,12 @@ void SessionProcessingHelper::process(google::protobuf::Message* feedback) {
     // Whatever the table above does not reach (a section header's results, a
     // kind added to the .proto later) is still mapped and stripped, without
     // bookkeeping: the table alone decides what counts as shown or delivered.
-    static const auto* const resultType = CVSearchResultForFeedback::descriptor();
-    static const auto* const suggestionType = CVSearchSuggestionForFeedback::descriptor();
     forEachMessage(*feedback, [this](google::protobuf::Message& m, const google::protobuf::Reflection& reflection,
                                      const MessageShape& shape) {
-      if (shape.descriptor == resultType) {
+      if (shape.descriptor == descriptorOf<CVSearchResultForFeedback>()) {
         auto* r = static_cast<CVSearchResultForFeedback*>(&m);
         if (!rewritten_.count(r)) rewriteItem(CVIdentifiable(r));
-      } else if (shape.descriptor == suggestionType) {
+      } else if (shape.descriptor == descriptorOf<CVSearchSuggestionForFeedback>()) {
         auto* s = static_cast<CVSearchSuggestionForFeedback*>(&m);
         if (!rewritten_.count(s)) rewriteItem(CVIdentifiable(s));
       } else {
