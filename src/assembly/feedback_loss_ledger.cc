@@ -37,21 +37,27 @@ FeedbackLossLedger::FeedbackLossLedger(fs::path file, FileManager& fm, SystemTim
     log().error("Cannot create {}: {}", file_.parent_path().string(), ec.message());
     return;
   }
-  // Drop what has left the window; the file is small, so a rewrite is cheap.
+  // Drop what has left the window. Lines are appended as events happen, so
+  // the old ones are at the head: only the head is parsed, up to the first
+  // line inside the window, and the file is rewritten only when something
+  // goes. A week of uploads is tens of thousands of lines, and the daemon
+  // starts often. A line behind that one (the clock was set back) stays
+  // until a later start and is ignored by countsSince; a head line stamped
+  // more than a window ahead of now is taken for a clock error and dropped.
   if (auto text = fm_.readFile(file_, ec)) {
     const double cutoff = secondsSinceEpoch(now - kWindow);
-    std::string kept;
-    bool dropped = false;
-    std::istringstream in(*text);
-    for (std::string line; std::getline(in, line);) {
-      auto parsed = parseLine(line);
-      if (!parsed || parsed->time < cutoff) {
-        dropped = true;
-        continue;
-      }
-      kept += line + "\n";
+    const double ahead = secondsSinceEpoch(now + kWindow);
+    size_t keepFrom = 0;
+    while (keepFrom < text->size()) {
+      size_t end = text->find('\n', keepFrom);
+      end = end == std::string::npos ? text->size() : end + 1;
+      auto parsed = parseLine(text->substr(keepFrom, end - keepFrom));
+      if (parsed && parsed->time >= cutoff && parsed->time <= ahead) break;
+      keepFrom = end;
     }
-    if (dropped && !fm_.writeFileAtomically(file_, kept, ec)) log().error("Cannot rewrite {}: {}", file_.string(), ec.message());
+    if (keepFrom > 0 && !fm_.writeFileAtomically(file_, std::string_view(*text).substr(keepFrom), ec)) {
+      log().error("Cannot rewrite {}: {}", file_.string(), ec.message());
+    }
   }
   fd_ = ::open(file_.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_NOFOLLOW | O_CLOEXEC, 0600);
   if (fd_ < 0) log().error("Cannot open {}", file_.string());

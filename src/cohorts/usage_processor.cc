@@ -23,10 +23,10 @@ bool isQuerySuggestion(const CVSearchResultForFeedback& r) {
 bool inRange(int32_t v, int32_t first, int32_t last) { return first <= v && v <= last; }
 
 bool isDidGoToSite(const EngagementReporter& e) {
-  return std::holds_alternative<corevireon::CVDidGoToSiteFeedback>(e.feedback());
+  return std::holds_alternative<const corevireon::CVDidGoToSiteFeedback*>(e.feedback());
 }
 bool isDidGoToSearch(const EngagementReporter& e) {
-  return std::holds_alternative<corevireon::CVDidGoToSearchFeedback>(e.feedback());
+  return std::holds_alternative<const corevireon::CVDidGoToSearchFeedback*>(e.feedback());
 }
 // The engaged result of a result engagement; null for the other kinds and
 // for an engagement without a result.
@@ -105,23 +105,29 @@ class Fingerprint {
   uint64_t hash_ = 0xcbf29ce484222325ULL;
 };
 
-}  // namespace
-
-int64_t UsageProcessor::sessionFingerprint(const corevireon::CVClientSession& session) {
+// What makes a session the same session when a crash has it processed again:
+// its agent, user and start, and each payload's query, type, kind and
+// timestamp. `messages` are the payloads' feedback messages, null where a
+// payload has none.
+int64_t sessionFingerprint(const corevireon::CVClientSession& session,
+                           const std::vector<const google::protobuf::Message*>& messages) {
   Fingerprint f;
   f.addString(session.agent());
   f.addString(session.userguidstring());
   f.addValue(session.sessionstart());
   f.addValue(session.feedbacks().items_size());
-  for (const auto& p : session.feedbacks().items()) {
+  for (int i = 0; i < session.feedbacks().items_size(); ++i) {
+    const auto& p = session.feedbacks().items(i);
     f.addValue(p.queryid());
     f.addValue(p.type());
     f.addValue(static_cast<int>(p.codable_case()));
-    const google::protobuf::Message* message = codableMessage(p);
+    const google::protobuf::Message* message = messages[static_cast<size_t>(i)];
     f.addValue(message != nullptr ? feedbackTimestamp(*message).value_or(0) : 0);
   }
   return f.value();
 }
+
+}  // namespace
 
 bool UsageProcessor::session(bool withSearches, bool engagements, CVClient countsAsUsageFor) {
   if (!engagements) return false;
@@ -134,8 +140,13 @@ std::optional<UsageProcessor::SessionUsage> UsageProcessor::usageOf(const corevi
   if (client == corevireon::CV_CLIENT_NONE || !session.has_feedbacks()) return std::nullopt;
   bool searches = false;
   std::vector<EngagementReporter> engagements;
+  // Each payload's message is found once; the fingerprint and the messaging
+  // counters walk them again.
+  std::vector<const google::protobuf::Message*> messages;
+  messages.reserve(static_cast<size_t>(session.feedbacks().items_size()));
   for (const auto& p : session.feedbacks().items()) {
     const google::protobuf::Message* message = codableMessage(p);
+    messages.push_back(message);
     if (message == nullptr) continue;
     if (!searches) {
       auto keystroke = KeystrokeReporter::from(*message);
@@ -146,7 +157,8 @@ std::optional<UsageProcessor::SessionUsage> UsageProcessor::usageOf(const corevi
   }
   if (!UsageProcessor::session(searches, !engagements.empty(), client)) return std::nullopt;
 
-  SessionUsage usage{client, sessionFingerprint(session), session.sessionstart(), {}};
+  SessionUsage usage{client, sessionFingerprint(session, messages), session.sessionstart(), {}};
+  usage.counters.reserve(engagements.size());
   switch (client) {
     case corevireon::CV_CLIENT_WEB_BROWSER:
       for (const auto& e : engagements) usage.counters.push_back(wayfinCounter(e));
@@ -157,8 +169,7 @@ std::optional<UsageProcessor::SessionUsage> UsageProcessor::usageOf(const corevi
     case corevireon::CV_CLIENT_MESSAGING: {
       std::map<std::string, const CVSearchResultForFeedback*> resultsById;
       // A later result with the same identifier wins.
-      for (const auto& p : session.feedbacks().items()) {
-        const google::protobuf::Message* message = codableMessage(p);
+      for (const google::protobuf::Message* message : messages) {
         if (message == nullptr) continue;
         for (const auto* r : containedResults(*message)) {
           if (r->has_identifier()) resultsById[r->identifier()] = r;

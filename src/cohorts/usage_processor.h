@@ -126,7 +126,6 @@ class UsageProcessor final : public UsageProcessorProtocol {
 
   // The usage rule on flags.
   static bool session(bool withSearches, bool engagements, corevireon::CVClient countsAsUsageFor);
-  static int64_t sessionFingerprint(const corevireon::CVClientSession& session);
 
  private:
   // What one session adds to the store: a sentinel for `client` and, for

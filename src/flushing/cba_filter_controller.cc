@@ -3,6 +3,7 @@
 #include "flushing/url_matching.h"
 
 #include <algorithm>
+#include <optional>
 #include <set>
 #include <string>
 #include <string_view>
@@ -29,7 +30,17 @@ CBAFilterController::FeedbackList CBAFilterController::arrayOfCBAFilteredFeedbac
 }
 
 void CBAFilterController::filter(FeedbackList& feedback) const {
-  std::unordered_map<uint64_t, std::set<std::string>> candidatesByQuery;
+  // Views into the shown results' addresses, which stay where they are while
+  // the list is filtered (elements are only swapped, and removed at the end).
+  std::unordered_map<uint64_t, std::set<std::string_view>> candidatesByQuery;
+  // Each shown address is parsed once, however many visits it is compared
+  // with; parsing dominated the filter when it was done per comparison.
+  std::unordered_map<std::string_view, std::optional<CBAComparable>> comparable;
+  auto comparableCandidate = [&](std::string_view url) -> const std::optional<CBAComparable>& {
+    auto [it, added] = comparable.try_emplace(url);
+    if (added) it->second = cbaComparable(url);
+    return it->second;
+  };
   int kept = 0;
   for (int i = 0; i < feedback.size(); ++i) {
     corevireon::CVFeedbackPayload& payload = *feedback.Mutable(i);
@@ -43,16 +54,16 @@ void CBAFilterController::filter(FeedbackList& feedback) const {
     } else if (payload.has_cbaengagement()) {
       auto* cba = payload.mutable_cbaengagement();
       cba->set_cbatype(corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH);
-      std::optional<std::string> visited;
-      if (cba->has_url()) visited = cba->url();
+      std::optional<CBAComparable> visited;
+      if (cba->has_url()) visited = cbaComparable(cba->url());
       cba->clear_url();
       auto it = candidatesByQuery.find(payload.queryid());
-      if (it != candidatesByQuery.end() && !it->second.empty()) {
+      if (visited && it != candidatesByQuery.end() && !it->second.empty()) {
         int best = corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH;
-        for (const std::string& candidate : it->second) {
-          std::optional<std::string_view> v;
-          if (visited) v = *visited;
-          best = std::max<int>(best, cbaMatchBetween(candidate, v));
+        for (std::string_view candidate : it->second) {
+          const auto& shown = comparableCandidate(candidate);
+          if (!shown) continue;
+          best = std::max<int>(best, cbaMatchBetween(*shown, *visited));
           if (best == corevireon::CV_CBA_ENGAGEMENT_TYPE_SAME_ADDRESS) break;
         }
         cba->set_cbatype(static_cast<corevireon::CVCBAEngagementType>(best));

@@ -52,39 +52,41 @@ const std::set<int32_t>& triggerEventScoutlumePreviewTypes() {
 }
 
 std::optional<EngagementReporter> EngagementReporter::from(const google::protobuf::Message& feedback) {
-  if (auto* m = messageAs<corevireon::CVResultEngagementFeedback>(feedback)) return EngagementReporter(*m);
-  if (auto* m = messageAs<corevireon::CVDidGoToSiteFeedback>(feedback)) return EngagementReporter(*m);
-  if (auto* m = messageAs<corevireon::CVDidGoToSearchFeedback>(feedback)) return EngagementReporter(*m);
+  if (auto* m = messageAs<corevireon::CVResultEngagementFeedback>(feedback)) return EngagementReporter(m);
+  if (auto* m = messageAs<corevireon::CVDidGoToSiteFeedback>(feedback)) return EngagementReporter(m);
+  if (auto* m = messageAs<corevireon::CVDidGoToSearchFeedback>(feedback)) return EngagementReporter(m);
   return std::nullopt;
 }
 
 bool EngagementReporter::isEngagement(CVClient client) const {
-  if (auto* m = std::get_if<corevireon::CVResultEngagementFeedback>(&feedback_)) {
+  if (auto* const* p = std::get_if<const corevireon::CVResultEngagementFeedback*>(&feedback_)) {
+    const auto* m = *p;
     if (client != corevireon::CV_CLIENT_SYSTEM_SEARCH_UI) return true;
     return triggerEventScoutlumePreviewTypes().count(m->triggerevent()) == 0 &&
            m->destination() != kDestinationNotCounted;
   }
-  if (std::holds_alternative<corevireon::CVDidGoToSiteFeedback>(feedback_)) {
+  if (std::holds_alternative<const corevireon::CVDidGoToSiteFeedback*>(feedback_)) {
     return client == corevireon::CV_CLIENT_WEB_BROWSER;
   }
   return client == corevireon::CV_CLIENT_WEB_BROWSER || client == corevireon::CV_CLIENT_SYSTEM_SEARCH_UI;
 }
 
 const corevireon::CVResultEngagementFeedback* EngagementReporter::resultEngagement() const {
-  return std::get_if<corevireon::CVResultEngagementFeedback>(&feedback_);
+  auto* const* m = std::get_if<const corevireon::CVResultEngagementFeedback*>(&feedback_);
+  return m ? *m : nullptr;
 }
 
 std::optional<KeystrokeReporter> KeystrokeReporter::from(const google::protobuf::Message& feedback) {
-  if (auto* m = messageAs<corevireon::CVStartLocalSearchFeedback>(feedback)) return KeystrokeReporter(*m);
-  if (auto* m = messageAs<corevireon::CVStartNetworkSearchFeedback>(feedback)) return KeystrokeReporter(*m);
+  if (auto* m = messageAs<corevireon::CVStartLocalSearchFeedback>(feedback)) return KeystrokeReporter(m);
+  if (auto* m = messageAs<corevireon::CVStartNetworkSearchFeedback>(feedback)) return KeystrokeReporter(m);
   return std::nullopt;
 }
 
 bool KeystrokeReporter::isKeystroke() const {
-  if (auto* m = std::get_if<corevireon::CVStartLocalSearchFeedback>(&feedback_)) {
-    return m->has_input() && !m->input().empty();
+  if (auto* const* m = std::get_if<const corevireon::CVStartLocalSearchFeedback*>(&feedback_)) {
+    return (*m)->has_input() && !(*m)->input().empty();
   }
-  const auto& m = std::get<corevireon::CVStartNetworkSearchFeedback>(feedback_);
+  const auto& m = *std::get<const corevireon::CVStartNetworkSearchFeedback*>(feedback_);
   if (m.endpoint() == kEndpointWithoutKeystroke) return false;
   return m.has_input() && !m.input().empty();
 }
@@ -95,7 +97,7 @@ std::optional<RankingReporter> RankingReporter::from(const google::protobuf::Mes
 }
 
 std::vector<const corevireon::CVSearchResultForFeedback*> RankingReporter::containedResults() const {
-  return fbf::containedResults(feedback_);
+  return fbf::containedResults(*feedback_);
 }
 
 }  // namespace fbf

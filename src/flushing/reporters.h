@@ -29,14 +29,20 @@ corevireon::CVClient cohortsClient(const corevireon::CVClientSession& session);
 // once on first use.
 const std::set<int32_t>& triggerEventScoutlumePreviewTypes();
 
+// The reporters are handles, like CVIdentifiable: they point into a message
+// owned elsewhere (a session's feedback list) and must not outlive it.
+// Counting a session's usage builds one per feedback message, so copying
+// each message would cost more than the counting itself.
+
 // Result engagement, did-go-to-site and did-go-to-search feedback.
 class EngagementReporter {
  public:
-  using Feedback = std::variant<corevireon::CVResultEngagementFeedback, corevireon::CVDidGoToSiteFeedback,
-                                corevireon::CVDidGoToSearchFeedback>;
+  using Feedback = std::variant<const corevireon::CVResultEngagementFeedback*, const corevireon::CVDidGoToSiteFeedback*,
+                                const corevireon::CVDidGoToSearchFeedback*>;
 
   // A reporter for a message of one of the three kinds; none for anything else.
   static std::optional<EngagementReporter> from(const google::protobuf::Message& feedback);
+  static std::optional<EngagementReporter> from(const google::protobuf::Message&& feedback) = delete;
   explicit EngagementReporter(Feedback feedback) : feedback_(std::move(feedback)) {}
 
   // Result engagement: true for every client but 2; for client 2 only when
@@ -55,9 +61,11 @@ class EngagementReporter {
 // Local and network search starts.
 class KeystrokeReporter {
  public:
-  using Feedback = std::variant<corevireon::CVStartLocalSearchFeedback, corevireon::CVStartNetworkSearchFeedback>;
+  using Feedback =
+      std::variant<const corevireon::CVStartLocalSearchFeedback*, const corevireon::CVStartNetworkSearchFeedback*>;
 
   static std::optional<KeystrokeReporter> from(const google::protobuf::Message& feedback);
+  static std::optional<KeystrokeReporter> from(const google::protobuf::Message&& feedback) = delete;
   explicit KeystrokeReporter(Feedback feedback) : feedback_(std::move(feedback)) {}
 
   // True when `input` is present and non-empty; a network search to
@@ -75,13 +83,14 @@ class KeystrokeReporter {
 class RankingReporter {
  public:
   static std::optional<RankingReporter> from(const google::protobuf::Message& feedback);
-  explicit RankingReporter(corevireon::CVRankingFeedback feedback) : feedback_(std::move(feedback)) {}
+  static std::optional<RankingReporter> from(const google::protobuf::Message&& feedback) = delete;
+  explicit RankingReporter(const corevireon::CVRankingFeedback& feedback) : feedback_(&feedback) {}
 
   std::vector<const corevireon::CVSearchResultForFeedback*> containedResults() const;
-  const corevireon::CVRankingFeedback& feedback() const { return feedback_; }
+  const corevireon::CVRankingFeedback& feedback() const { return *feedback_; }
 
  private:
-  corevireon::CVRankingFeedback feedback_;
+  const corevireon::CVRankingFeedback* feedback_;
 };
 
 }  // namespace fbf

@@ -4,6 +4,7 @@
 #include <uriparser/Uri.h>
 
 #include <string>
+#include <tuple>
 #include <unordered_map>
 #include <vector>
 
@@ -198,27 +199,38 @@ MatchURLComponents sanitised(const MatchURLComponents& parsed) {
 
 }  // namespace
 
+std::optional<CBAComparable> cbaComparable(std::string_view url) {
+  auto parsed = parseURLComponents(url);
+  if (!parsed) return std::nullopt;
+  CBAComparable c{sanitised(*parsed), std::nullopt};
+  c.address.scheme.reset();
+  if (!c.address.path.empty() && c.address.path.back() == '/') c.address.path.pop_back();
+  c.site = normalizedURLStringForTLDFeatures(c.address);
+  return c;
+}
+
+corevireon::CVCBAEngagementType cbaMatchBetween(const CBAComparable& candidate, const CBAComparable& visited) {
+  const MatchURLComponents& x = candidate.address;
+  const MatchURLComponents& y = visited.address;
+  auto allButQuery = [](const MatchURLComponents& c) {
+    return std::tie(c.scheme, c.userInfo, c.host, c.port, c.path, c.fragment, c.hostIsIPLiteral);
+  };
+  if (allButQuery(x) == allButQuery(y)) {
+    return x.query == y.query ? corevireon::CV_CBA_ENGAGEMENT_TYPE_SAME_ADDRESS
+                              : corevireon::CV_CBA_ENGAGEMENT_TYPE_SAME_ADDRESS_IGNORING_QUERY;
+  }
+  // The query never reaches the site key: it is made of the host alone.
+  if (candidate.site == visited.site) return corevireon::CV_CBA_ENGAGEMENT_TYPE_SAME_SITE;
+  return corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH;
+}
+
 corevireon::CVCBAEngagementType cbaMatchBetween(std::optional<std::string_view> candidate,
                                                 std::optional<std::string_view> visited) {
   if (!candidate || !visited) return corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH;
-  auto a = parseURLComponents(*candidate);
-  auto b = parseURLComponents(*visited);
-  if (!a || !b) return corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH;
-
-  MatchURLComponents x = sanitised(*a);
-  MatchURLComponents y = sanitised(*b);
-  for (MatchURLComponents* c : {&x, &y}) {
-    c->scheme.reset();
-    if (!c->path.empty() && c->path.back() == '/') c->path.pop_back();
-  }
-  if (x == y) return corevireon::CV_CBA_ENGAGEMENT_TYPE_SAME_ADDRESS;
-  x.query.reset();
-  y.query.reset();
-  if (x == y) return corevireon::CV_CBA_ENGAGEMENT_TYPE_SAME_ADDRESS_IGNORING_QUERY;
-  if (normalizedURLStringForTLDFeatures(x) == normalizedURLStringForTLDFeatures(y)) {
-    return corevireon::CV_CBA_ENGAGEMENT_TYPE_SAME_SITE;
-  }
-  return corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH;
+  auto x = cbaComparable(*candidate);
+  auto y = cbaComparable(*visited);
+  if (!x || !y) return corevireon::CV_CBA_ENGAGEMENT_TYPE_NO_MATCH;
+  return cbaMatchBetween(*x, *y);
 }
 
 }  // namespace fbf

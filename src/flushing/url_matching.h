@@ -82,4 +82,14 @@ std::optional<std::string> registrableDomain(std::string_view host);
 corevireon::CVCBAEngagementType cbaMatchBetween(std::optional<std::string_view> candidate,
                                                 std::optional<std::string_view> visited);
 
+// The same in two steps, for a caller that compares one address with many:
+// an address parsed, sanitised and keyed as above (none when it does not
+// parse), then the match of two such.
+struct CBAComparable {
+  MatchURLComponents address;  // sanitised, without scheme or trailing "/"
+  std::optional<std::string> site;  // normalizedURLStringForTLDFeatures
+};
+std::optional<CBAComparable> cbaComparable(std::string_view url);
+corevireon::CVCBAEngagementType cbaMatchBetween(const CBAComparable& candidate, const CBAComparable& visited);
+
 }  // namespace fbf

@@ -1,6 +1,12 @@
+#include "assembly/feedback_loss_ledger.h"
 #include "support/test_support.h"
 
 #include <gtest/gtest.h>
+
+#include <algorithm>
+#include <fstream>
+#include <iterator>
+#include <tuple>
 
 namespace fbf::testing {
 namespace {
@@ -45,6 +51,47 @@ TEST(UploadSessionTransactions, TwoMadeOneInvalidatedLeavesOneOpen) {
   env.manualQueue->drain();
   EXPECT_EQ(a.openTransactionCount(), 1u);
   EXPECT_EQ(env.transactions->openCount(), 1);
+}
+
+// Guards against: opening the loss ledger losing events of the last week,
+// keeping what left it, or a bogus head line stopping every later pruning.
+TEST(FeedbackLossLedger, OpeningDropsTheStaleHeadAndKeepsTheWeek) {
+  const SystemTime now = timeFromSeconds(1'800'000'000);
+  auto line = [&](double daysAgo, int reason) {
+    return "{\"time\":" + std::to_string(secondsSinceEpoch(now) - daysAgo * 86400) +
+           ",\"type\":1,\"reason\":" + std::to_string(reason) + "}\n";
+  };
+  struct Case {
+    const char* name;
+    std::string before;
+    std::vector<FeedbackLossCount> counts;  // the week's, after opening
+    size_t lines;                           // left in the file
+  };
+  const std::vector<Case> cases = {
+      {"stale and corrupt head", line(9, 1) + "{oops\n" + line(8, 2) + line(2, 3) + line(1, 3), {{1, 3, 2}}, 2},
+      {"a clock error far ahead", line(-30, 4) + line(1, 5), {{1, 5, 1}}, 1},
+      {"all in the week", line(3, 6) + line(2, 6), {{1, 6, 2}}, 2},
+      {"clock set back behind the head", line(1, 7) + line(10, 8), {{1, 7, 1}}, 2},
+  };
+  for (const auto& c : cases) {
+    TempDir dir;
+    auto fm = makePosixFileManager(XdgDirectories::underRoot(dir.path()));
+    const fs::path file = dir.path() / "state" / "losses.jsonl";
+    fs::create_directories(file.parent_path());
+    std::ofstream(file) << c.before;
+    {
+      FeedbackLossLedger ledger(file, *fm, now);
+      auto counts = ledger.countsSince(now - FeedbackLossLedger::kWindow);
+      ASSERT_EQ(counts.size(), c.counts.size()) << c.name;
+      for (size_t i = 0; i < counts.size(); ++i) {
+        EXPECT_EQ(std::tie(counts[i].feedbackType, counts[i].reason, counts[i].files),
+                  std::tie(c.counts[i].feedbackType, c.counts[i].reason, c.counts[i].files))
+            << c.name;
+      }
+    }
+    std::ifstream in(file);
+    EXPECT_EQ(static_cast<size_t>(std::count(std::istreambuf_iterator<char>(in), {}, '\n')), c.lines) << c.name;
+  }
 }
 
 // Guards against: a clean exit that does not wait for every open transaction, or happens twice.

@@ -37,13 +37,16 @@ TEST(Engagements, DependOnTriggerDestinationAndSurface) {
     EXPECT_EQ(EngagementReporter::from(m)->isEngagement(client), engagement)
         << "trigger " << trigger << " destination " << destination << " client " << client;
   }
-  auto site = *EngagementReporter::from(corevireon::CVDidGoToSiteFeedback());
-  auto search = *EngagementReporter::from(corevireon::CVDidGoToSearchFeedback());
+  const corevireon::CVDidGoToSiteFeedback siteFeedback;
+  const corevireon::CVDidGoToSearchFeedback searchFeedback;
+  auto site = *EngagementReporter::from(siteFeedback);
+  auto search = *EngagementReporter::from(searchFeedback);
   for (int c = 0; c <= 4; ++c) {
     EXPECT_EQ(site.isEngagement(static_cast<CVClient>(c)), c == 1) << c;
     EXPECT_EQ(search.isEngagement(static_cast<CVClient>(c)), c == 1 || c == 2) << c;
   }
-  EXPECT_FALSE(EngagementReporter::from(corevireon::CVClearInputFeedback()));
+  const corevireon::CVClearInputFeedback clear;
+  EXPECT_FALSE(EngagementReporter::from(clear));
 }
 
 // Guards against: a search without input, or to network endpoint 12, counted as a keystroke.
@@ -62,7 +65,8 @@ TEST(Keystrokes, NeedInputAndNetworkEndpoint12NeverCounts) {
   }
   network.set_endpoint(12);
   EXPECT_FALSE(KeystrokeReporter::from(network)->isKeystroke());
-  EXPECT_FALSE(KeystrokeReporter::from(corevireon::CVEndLocalSearchFeedback()));
+  const corevireon::CVEndLocalSearchFeedback end;
+  EXPECT_FALSE(KeystrokeReporter::from(end));
 }
 
 }  // namespace
