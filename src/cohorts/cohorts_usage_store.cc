@@ -22,6 +22,7 @@ CohortsUsageStore::CohortsUsageStore(FBFAssemblyProtocol& assembly, std::unique_
       usageProcessor_(*store_) {}
 
 void CohortsUsageStore::flushCohortsFeedback() {
+  usageProcessor_.writePending();
   CohortScheduler scheduler(assembly_, *store_, random_);
   scheduler.doPeriodicUsageCalculations();
   int64_t lookback = CohortFeedbackGenerator::cohortsLookbackInDays(assembly_.cachedBag());

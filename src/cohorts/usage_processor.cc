@@ -107,22 +107,18 @@ class Fingerprint {
 
 // What makes a session the same session when a crash has it processed again:
 // its agent, user and start, and each payload's query, type, kind and
-// timestamp. `messages` are the payloads' feedback messages, null where a
-// payload has none.
-int64_t sessionFingerprint(const corevireon::CVClientSession& session,
-                           const std::vector<const google::protobuf::Message*>& messages) {
+// timestamp.
+int64_t sessionFingerprint(const corevireon::CVClientSession& session) {
   Fingerprint f;
   f.addString(session.agent());
   f.addString(session.userguidstring());
   f.addValue(session.sessionstart());
   f.addValue(session.feedbacks().items_size());
-  for (int i = 0; i < session.feedbacks().items_size(); ++i) {
-    const auto& p = session.feedbacks().items(i);
+  for (const auto& p : session.feedbacks().items()) {
     f.addValue(p.queryid());
     f.addValue(p.type());
     f.addValue(static_cast<int>(p.codable_case()));
-    const google::protobuf::Message* message = messages[static_cast<size_t>(i)];
-    f.addValue(message != nullptr ? feedbackTimestamp(*message).value_or(0) : 0);
+    f.addValue(codableTimestamp(p).value_or(0));
   }
   return f.value();
 }
@@ -140,8 +136,8 @@ std::optional<UsageProcessor::SessionUsage> UsageProcessor::usageOf(const corevi
   if (client == corevireon::CV_CLIENT_NONE || !session.has_feedbacks()) return std::nullopt;
   bool searches = false;
   std::vector<EngagementReporter> engagements;
-  // Each payload's message is found once; the fingerprint and the messaging
-  // counters walk them again.
+  // Each payload's message is found once; the messaging counters walk them
+  // again.
   std::vector<const google::protobuf::Message*> messages;
   messages.reserve(static_cast<size_t>(session.feedbacks().items_size()));
   for (const auto& p : session.feedbacks().items()) {
@@ -157,7 +153,7 @@ std::optional<UsageProcessor::SessionUsage> UsageProcessor::usageOf(const corevi
   }
   if (!UsageProcessor::session(searches, !engagements.empty(), client)) return std::nullopt;
 
-  SessionUsage usage{client, sessionFingerprint(session, messages), session.sessionstart(), {}};
+  SessionUsage usage{client, sessionFingerprint(session), session.sessionstart(), {}};
   usage.counters.reserve(engagements.size());
   switch (client) {
     case corevireon::CV_CLIENT_WEB_BROWSER:
@@ -185,9 +181,20 @@ std::optional<UsageProcessor::SessionUsage> UsageProcessor::usageOf(const corevi
   return usage;
 }
 
+UsageProcessor::UsageProcessor(DataStorageContainerProtocol& persistentStore)
+    : persistentStore_(persistentStore), drainTimer_(persistentStore.managedObjectContext().queue().makeTimer()) {}
+
 UsageProcessor::~UsageProcessor() {
-  // Whatever was reported is written before the store can go away.
-  persistentStore_.managedObjectContext().performAndWait([] {});
+  // Whatever was reported is written before the store can go away, and the
+  // timer goes on its own queue.
+  persistentStore_.managedObjectContext().performAndWait([this] {
+    drain();
+    drainTimer_.reset();
+  });
+}
+
+void UsageProcessor::writePending() {
+  persistentStore_.managedObjectContext().performAndWait([this] { drain(); });
 }
 
 void UsageProcessor::reportUsageEvents(const corevireon::CVClientSession& session) {
@@ -195,18 +202,26 @@ void UsageProcessor::reportUsageEvents(const corevireon::CVClientSession& sessio
   if (!usage) return;
   std::lock_guard lock(mutex_);
   pending_.push_back(std::move(*usage));
-  if (drainScheduled_) return;
-  drainScheduled_ = true;
-  persistentStore_.managedObjectContext().perform([this] { drain(); });
+  auto& context = persistentStore_.managedObjectContext();
+  if (pending_.size() >= kBatchSessions) {
+    if (!drainPosted_) context.perform([this] { drain(); });
+    drainPosted_ = true;
+  } else if (!timerArmed_ && !drainPosted_) {
+    timerArmed_ = true;
+    context.perform([this] { drainTimer_->schedule(kBatchDelay, [this] { drain(); }); });
+  }
 }
 
 void UsageProcessor::drain() {
+  if (drainTimer_) drainTimer_->cancel();
   std::vector<SessionUsage> batch;
   {
     std::lock_guard lock(mutex_);
     batch.swap(pending_);
-    drainScheduled_ = false;
+    drainPosted_ = false;
+    timerArmed_ = false;
   }
+  if (batch.empty()) return;
   auto& context = persistentStore_.managedObjectContext();
   std::set<int64_t> staged;
   for (const auto& usage : batch) {

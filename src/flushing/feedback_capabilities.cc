@@ -5,6 +5,7 @@
 #include <memory>
 #include <mutex>
 #include <unordered_map>
+#include <vector>
 
 namespace fbf {
 
@@ -97,42 +98,79 @@ Results containedResults(const Message& feedback) {
   return out;
 }
 
-const Message* codableMessage(const corevireon::CVFeedbackPayload& payload) {
-  if (payload.codable_case() == corevireon::CVFeedbackPayload::CODABLE_NOT_SET) return nullptr;
-  const auto* reflection = payload.GetReflection();
-  static const auto* const oneof = corevireon::CVFeedbackPayload::descriptor()->FindOneofByName("codable");
-  const FieldDescriptor* field = reflection->GetOneofFieldDescriptor(payload, oneof);
-  return field ? &reflection->GetMessage(payload, field) : nullptr;
-}
-
-Message* mutableCodableMessage(corevireon::CVFeedbackPayload& payload) {
-  if (payload.codable_case() == corevireon::CVFeedbackPayload::CODABLE_NOT_SET) return nullptr;
-  const auto* reflection = payload.GetReflection();
-  static const auto* const oneof = corevireon::CVFeedbackPayload::descriptor()->FindOneofByName("codable");
-  const FieldDescriptor* field = reflection->GetOneofFieldDescriptor(payload, oneof);
-  return field ? reflection->MutableMessage(&payload, field) : nullptr;
-}
-
 namespace {
 
-const FieldDescriptor* timestampField(const Message& feedback) {
-  const FieldDescriptor* field = feedback.GetDescriptor()->FindFieldByNumber(1);
+const FieldDescriptor* timestampField(const Descriptor* descriptor) {
+  const FieldDescriptor* field = descriptor->FindFieldByNumber(1);
   if (field == nullptr || field->cpp_type() != FieldDescriptor::CPPTYPE_UINT64 || field->is_repeated()) {
     return nullptr;
   }
   return field;
 }
 
+// The payload's oneof by case number, worked out once. Every session's
+// payloads go through here several times, and asking a generated message
+// for its descriptor or reflection takes protobuf's once-only path (a
+// std::call_once with its thread-locals) on each call.
+struct CodableField {
+  const FieldDescriptor* field = nullptr;
+  const Reflection* reflection = nullptr;  // of the message the field holds
+  const FieldDescriptor* timestamp = nullptr;
+};
+struct CodableTable {
+  const Reflection* payloadReflection = nullptr;
+  std::vector<CodableField> byCase;
+  const CodableField* find(int codableCase) const {
+    if (codableCase <= 0 || static_cast<size_t>(codableCase) >= byCase.size()) return nullptr;
+    const CodableField& f = byCase[static_cast<size_t>(codableCase)];
+    return f.field ? &f : nullptr;
+  }
+};
+
+const CodableTable& codableTable() {
+  static const CodableTable table = [] {
+    CodableTable t;
+    t.payloadReflection = corevireon::CVFeedbackPayload::GetReflection();
+    const auto* oneof = corevireon::CVFeedbackPayload::descriptor()->FindOneofByName("codable");
+    for (int i = 0; oneof != nullptr && i < oneof->field_count(); ++i) {
+      const FieldDescriptor* field = oneof->field(i);
+      if (field->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) continue;
+      const Message* prototype = MessageFactory::generated_factory()->GetPrototype(field->message_type());
+      if (static_cast<size_t>(field->number()) >= t.byCase.size()) t.byCase.resize(static_cast<size_t>(field->number()) + 1);
+      t.byCase[static_cast<size_t>(field->number())] = {field, prototype ? prototype->GetReflection() : nullptr,
+                                                        timestampField(field->message_type())};
+    }
+    return t;
+  }();
+  return table;
+}
+
 }  // namespace
 
+const Message* codableMessage(const corevireon::CVFeedbackPayload& payload) {
+  const CodableField* f = codableTable().find(payload.codable_case());
+  return f ? &codableTable().payloadReflection->GetMessage(payload, f->field) : nullptr;
+}
+
+Message* mutableCodableMessage(corevireon::CVFeedbackPayload& payload) {
+  const CodableField* f = codableTable().find(payload.codable_case());
+  return f ? codableTable().payloadReflection->MutableMessage(&payload, f->field) : nullptr;
+}
+
+std::optional<uint64_t> codableTimestamp(const corevireon::CVFeedbackPayload& payload) {
+  const CodableField* f = codableTable().find(payload.codable_case());
+  if (f == nullptr || f->timestamp == nullptr || f->reflection == nullptr) return std::nullopt;
+  return f->reflection->GetUInt64(codableTable().payloadReflection->GetMessage(payload, f->field), f->timestamp);
+}
+
 std::optional<uint64_t> feedbackTimestamp(const Message& feedback) {
-  const FieldDescriptor* field = timestampField(feedback);
+  const FieldDescriptor* field = timestampField(feedback.GetDescriptor());
   if (field == nullptr) return std::nullopt;
   return feedback.GetReflection()->GetUInt64(feedback, field);
 }
 
 void setFeedbackTimestamp(Message& feedback, uint64_t timestamp) {
-  if (const FieldDescriptor* field = timestampField(feedback)) {
+  if (const FieldDescriptor* field = timestampField(feedback.GetDescriptor())) {
     feedback.GetReflection()->SetUInt64(&feedback, field, timestamp);
   }
 }

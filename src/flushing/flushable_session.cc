@@ -34,12 +34,11 @@ void sortForProcessing(It begin, It end) {
   auto byTimestamp = [](const Keyed& a, const Keyed& b) { return a.timestamp < b.timestamp; };
   size_t runStart = 0;
   for (It it = begin; it != end; ++it) {
-    const google::protobuf::Message* message = codableMessage(**it);
-    if (message == nullptr) {
+    if ((**it).codable_case() == CVFeedbackPayload::CODABLE_NOT_SET) {
       std::stable_sort(keyed.begin() + static_cast<std::ptrdiff_t>(runStart), keyed.end(), byTimestamp);
       runStart = keyed.size() + 1;
     }
-    keyed.push_back({message ? feedbackTimestamp(*message).value_or(0) : 0, *it});
+    keyed.push_back({codableTimestamp(**it).value_or(0), *it});
   }
   std::stable_sort(keyed.begin() + static_cast<std::ptrdiff_t>(runStart), keyed.end(), byTimestamp);
   It out = begin;
@@ -162,9 +161,7 @@ uint64_t discardUnknownFields(google::protobuf::Message& message) {
 // The first non-zero feedback timestamp in processing order, if any.
 std::optional<uint64_t> baseTimeOf(const google::protobuf::RepeatedPtrField<CVFeedbackPayload>& list) {
   for (const auto& payload : list) {
-    const google::protobuf::Message* message = codableMessage(payload);
-    if (message == nullptr) continue;
-    if (auto t = feedbackTimestamp(*message); t && *t != 0) return *t;
+    if (auto t = codableTimestamp(payload); t && *t != 0) return *t;
   }
   return std::nullopt;
 }

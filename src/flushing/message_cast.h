@@ -1,8 +1,9 @@
-// Checked downcasts from a generic protobuf message to a generated type, by
-// descriptor (no RTTI lookup through the class hierarchy).
+// Checked downcasts from a generic protobuf message to a generated type.
 #pragma once
 
 #include <google/protobuf/message.h>
+
+#include <typeinfo>
 
 namespace fbf {
 
@@ -14,14 +15,18 @@ const google::protobuf::Descriptor* descriptorOf() {
   return descriptor;
 }
 
+// By exact dynamic type: a comparison of type_info objects, where asking
+// the message for its descriptor takes protobuf's once-only path on every
+// call. It also refuses a dynamic message that shares the generated type's
+// descriptor, which a cast by descriptor would have let through.
 template <class T>
 const T* messageAs(const google::protobuf::Message& m) {
-  return m.GetDescriptor() == descriptorOf<T>() ? static_cast<const T*>(&m) : nullptr;
+  return typeid(m) == typeid(T) ? static_cast<const T*>(&m) : nullptr;
 }
 
 template <class T>
 T* messageAs(google::protobuf::Message& m) {
-  return m.GetDescriptor() == descriptorOf<T>() ? static_cast<T*>(&m) : nullptr;
+  return typeid(m) == typeid(T) ? static_cast<T*>(&m) : nullptr;
 }
 
 }  // namespace fbf

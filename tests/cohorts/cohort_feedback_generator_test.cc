@@ -203,7 +203,7 @@ TEST_F(CohortEnvelopes, TheCohortFlushAggregatesDueDaysIntoFilesAndPurgesOnlyWha
   auto session = makeSession("Messages", localTime(2030, 6, 1, 8));
   addResultEngagement(session, ResultFields{});
   flush.usageEventSink()->reportUsageEvents(session);
-  onStore(usage.store(), [] {});  // the write, on the store's queue
+  usage.usageProcessor().writePending();
   EXPECT_EQ(rows("VIRImagesSession"), 1);
   flush.resetRowCache();
 }

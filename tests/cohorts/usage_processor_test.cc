@@ -26,7 +26,7 @@ class UsageCounting : public OpenStore {
   // The store writes on its own queue: the empty block waits for it.
   void report(const CVClientSession& s) {
     processor->reportUsageEvents(s);
-    on([] {});
+    processor->writePending();
   }
   CVClientSession searched(const char* agent) {
     auto s = makeSession(agent, start);
@@ -183,6 +183,19 @@ TEST_F(UsageCounting, ASessionProcessedAgainIsCountedOnceAndADifferentOneStillCo
   addDidGoToSite(other);
   report(other);
   for (const char* table : {"VIRUsageEvent", kWayfin, "VIRCountedSession"}) EXPECT_EQ(rows(table), 2) << table;
+  // In one batch: a session counted before, one twice, and new ones; a full
+  // batch is written without being asked.
+  const size_t fresh = UsageProcessor::kBatchSessions - 2;
+  processor->reportUsageEvents(s);
+  for (size_t i = 0; i <= fresh; ++i) {
+    auto next = other;
+    next.set_sessionstart(other.sessionstart() + static_cast<double>(i % fresh + 1));
+    processor->reportUsageEvents(next);
+  }
+  on([] {});
+  for (const char* table : {"VIRUsageEvent", kWayfin, "VIRCountedSession"}) {
+    EXPECT_EQ(rows(table), static_cast<int>(2 + fresh)) << table;
+  }
 }
 
 TEST_F(UsageCounting, TheSigned16BitMaximumIsStoredAndOneMoreStopsTheProcess) {
