@@ -100,30 +100,18 @@ Results containedResults(const Message& feedback) {
 
 namespace {
 
-const FieldDescriptor* timestampField(const Descriptor* descriptor) {
-  const FieldDescriptor* field = descriptor->FindFieldByNumber(1);
-  if (field == nullptr || field->cpp_type() != FieldDescriptor::CPPTYPE_UINT64 || field->is_repeated()) {
-    return nullptr;
-  }
-  return field;
-}
-
-// The payload's oneof by case number, worked out once. Every session's
-// payloads go through here several times, and asking a generated message
-// for its descriptor or reflection takes protobuf's once-only path (a
-// std::call_once with its thread-locals) on each call.
-struct CodableField {
-  const FieldDescriptor* field = nullptr;
-  const Reflection* reflection = nullptr;  // of the message the field holds
-  const FieldDescriptor* timestamp = nullptr;
-};
+// The payload's oneof by case number, worked out once, with the shape of the
+// message each case holds. Every session's payloads go through here several
+// times, and asking a generated message for its descriptor or reflection
+// takes protobuf's once-only path (a std::call_once with its thread-locals)
+// on each call.
 struct CodableTable {
   const Reflection* payloadReflection = nullptr;
-  std::vector<CodableField> byCase;
-  const CodableField* find(int codableCase) const {
+  std::vector<std::pair<const FieldDescriptor*, const MessageShape*>> byCase;
+  const std::pair<const FieldDescriptor*, const MessageShape*>* find(int codableCase) const {
     if (codableCase <= 0 || static_cast<size_t>(codableCase) >= byCase.size()) return nullptr;
-    const CodableField& f = byCase[static_cast<size_t>(codableCase)];
-    return f.field ? &f : nullptr;
+    const auto& entry = byCase[static_cast<size_t>(codableCase)];
+    return entry.first ? &entry : nullptr;
   }
 };
 
@@ -135,10 +123,9 @@ const CodableTable& codableTable() {
     for (int i = 0; oneof != nullptr && i < oneof->field_count(); ++i) {
       const FieldDescriptor* field = oneof->field(i);
       if (field->cpp_type() != FieldDescriptor::CPPTYPE_MESSAGE) continue;
-      const Message* prototype = MessageFactory::generated_factory()->GetPrototype(field->message_type());
-      if (static_cast<size_t>(field->number()) >= t.byCase.size()) t.byCase.resize(static_cast<size_t>(field->number()) + 1);
-      t.byCase[static_cast<size_t>(field->number())] = {field, prototype ? prototype->GetReflection() : nullptr,
-                                                        timestampField(field->message_type())};
+      const auto number = static_cast<size_t>(field->number());
+      if (number >= t.byCase.size()) t.byCase.resize(number + 1);
+      t.byCase[number] = {field, &shapeOf(field->message_type())};
     }
     return t;
   }();
@@ -148,31 +135,22 @@ const CodableTable& codableTable() {
 }  // namespace
 
 const Message* codableMessage(const corevireon::CVFeedbackPayload& payload) {
-  const CodableField* f = codableTable().find(payload.codable_case());
-  return f ? &codableTable().payloadReflection->GetMessage(payload, f->field) : nullptr;
+  const auto* entry = codableTable().find(payload.codable_case());
+  return entry ? &codableTable().payloadReflection->GetMessage(payload, entry->first) : nullptr;
 }
 
 Message* mutableCodableMessage(corevireon::CVFeedbackPayload& payload) {
-  const CodableField* f = codableTable().find(payload.codable_case());
-  return f ? codableTable().payloadReflection->MutableMessage(&payload, f->field) : nullptr;
+  const auto* entry = codableTable().find(payload.codable_case());
+  return entry ? codableTable().payloadReflection->MutableMessage(&payload, entry->first) : nullptr;
 }
 
 std::optional<uint64_t> codableTimestamp(const corevireon::CVFeedbackPayload& payload) {
-  const CodableField* f = codableTable().find(payload.codable_case());
-  if (f == nullptr || f->timestamp == nullptr || f->reflection == nullptr) return std::nullopt;
-  return f->reflection->GetUInt64(codableTable().payloadReflection->GetMessage(payload, f->field), f->timestamp);
-}
-
-std::optional<uint64_t> feedbackTimestamp(const Message& feedback) {
-  const FieldDescriptor* field = timestampField(feedback.GetDescriptor());
-  if (field == nullptr) return std::nullopt;
-  return feedback.GetReflection()->GetUInt64(feedback, field);
-}
-
-void setFeedbackTimestamp(Message& feedback, uint64_t timestamp) {
-  if (const FieldDescriptor* field = timestampField(feedback.GetDescriptor())) {
-    feedback.GetReflection()->SetUInt64(&feedback, field, timestamp);
-  }
+  const auto* entry = codableTable().find(payload.codable_case());
+  if (entry == nullptr) return std::nullopt;
+  const MessageShape& shape = *entry->second;
+  if (shape.timestamp == nullptr || shape.generatedReflection == nullptr) return std::nullopt;
+  const Message& message = codableTable().payloadReflection->GetMessage(payload, entry->first);
+  return shape.generatedReflection->GetUInt64(message, shape.timestamp);
 }
 
 namespace {

@@ -65,12 +65,9 @@ std::vector<const corevireon::CVSearchResultForFeedback*> containedResults(
 const google::protobuf::Message* codableMessage(const corevireon::CVFeedbackPayload& payload);
 google::protobuf::Message* mutableCodableMessage(corevireon::CVFeedbackPayload& payload);
 
-// `timestamp` (field 1) of a feedback message; absent for a message that has
-// no such field (never the case for the feedback messages of a session).
-std::optional<uint64_t> feedbackTimestamp(const google::protobuf::Message& feedback);
-// The same for the message a payload carries; none when it carries none.
+// `timestamp` (field 1) of the feedback message a payload carries; none
+// when it carries none.
 std::optional<uint64_t> codableTimestamp(const corevireon::CVFeedbackPayload& payload);
-void setFeedbackTimestamp(google::protobuf::Message& feedback, uint64_t timestamp);
 
 // What the rewrite's walks need to know of one message type, worked out once
 // per type instead of looked up by name for every message of every session.

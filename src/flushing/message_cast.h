@@ -7,14 +7,6 @@
 
 namespace fbf {
 
-// T::descriptor() goes through protobuf's once-only initialisation on every
-// call; the rewrite asks this for every message it meets.
-template <class T>
-const google::protobuf::Descriptor* descriptorOf() {
-  static const google::protobuf::Descriptor* const descriptor = T::descriptor();
-  return descriptor;
-}
-
 // By exact dynamic type: a comparison of type_info objects, where asking
 // the message for its descriptor takes protobuf's once-only path on every
 // call. It also refuses a dynamic message that shares the generated type's

@@ -126,11 +126,9 @@ void SessionProcessingHelper::process(google::protobuf::Message* feedback) {
     // bookkeeping: the table alone decides what counts as shown or delivered.
     forEachMessage(*feedback, [this](google::protobuf::Message& m, const google::protobuf::Reflection& reflection,
                                      const MessageShape& shape) {
-      if (shape.descriptor == descriptorOf<CVSearchResultForFeedback>()) {
-        auto* r = static_cast<CVSearchResultForFeedback*>(&m);
+      if (auto* r = messageAs<CVSearchResultForFeedback>(m)) {
         if (!rewritten_.count(r)) rewriteItem(CVIdentifiable(r));
-      } else if (shape.descriptor == descriptorOf<CVSearchSuggestionForFeedback>()) {
-        auto* s = static_cast<CVSearchSuggestionForFeedback*>(&m);
+      } else if (auto* s = messageAs<CVSearchSuggestionForFeedback>(m)) {
         if (!rewritten_.count(s)) rewriteItem(CVIdentifiable(s));
       } else {
         applyTitleRule(m, reflection, shape);
